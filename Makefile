@@ -1,0 +1,42 @@
+# The project's commands. `make run` builds and runs the example program;
+# `make test` builds everything and runs every test through CTest.
+# Sanitizer runs: `make test-asan` (AddressSanitizer + UBSan, every test) and
+# `make test-tsan` (ThreadSanitizer, every test); `make fuzz-smoke`
+# runs each libFuzzer target briefly when clang is installed.
+
+JOBS ?= $(shell nproc)
+CTEST = ctest --output-on-failure -j$(JOBS) --timeout 600
+
+.PHONY: run test test-asan test-tsan fuzz-smoke deps format clean
+
+deps:
+	@tools/install-deps.sh
+
+run: deps
+	cmake --preset default
+	cmake --build build -j$(JOBS) --target open_tree
+	build/examples/open_tree
+
+test: deps
+	cmake --preset default
+	cmake --build build -j$(JOBS)
+	cd build && $(CTEST)
+
+test-asan: deps
+	cmake --preset asan
+	cmake --build build-asan -j$(JOBS)
+	cd build-asan && $(CTEST)
+
+test-tsan: deps
+	cmake --preset tsan
+	cmake --build build-tsan -j$(JOBS)
+	cd build-tsan && $(CTEST)
+
+fuzz-smoke: deps
+	tools/fuzz-smoke.sh
+
+format:
+	git ls-files '*.c' '*.cpp' '*.h' | xargs clang-format -i
+
+clean:
+	rm -rf build build-asan build-tsan build-fuzz

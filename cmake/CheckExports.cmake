@@ -1,0 +1,46 @@
+# Fails unless the shared library LIBRARY defines, in its dynamic symbol
+# table, exactly the names listed as global in VERSION_SCRIPT (plus the
+# version node itself): no C++ mangled name, no internal function, and no
+# listed name missing.
+#   cmake -DLIBRARY=<lib.so> -DVERSION_SCRIPT=<map> -P CheckExports.cmake
+find_program(NM nm REQUIRED)
+execute_process(COMMAND ${NM} -D --defined-only ${LIBRARY}
+  OUTPUT_VARIABLE symbols RESULT_VARIABLE nm_result)
+if(NOT nm_result EQUAL 0)
+  message(FATAL_ERROR "nm failed on ${LIBRARY}")
+endif()
+
+file(READ ${VERSION_SCRIPT} script)
+string(REGEX MATCH "global:(.*)local:" global_part "${script}")
+string(REGEX MATCHALL "[A-Za-z_][A-Za-z0-9_]*" allowed "${CMAKE_MATCH_1}")
+string(REGEX MATCH "^[A-Za-z_0-9]+" version_node "${script}")
+
+string(REPLACE "\n" ";" lines "${symbols}")
+set(found "")
+set(unexpected "")
+foreach(line IN LISTS lines)
+  if(line MATCHES "^[0-9a-fA-F]* *([A-Za-z]) ([^@ ]+)")
+    set(name ${CMAKE_MATCH_2})
+    if(name STREQUAL version_node)
+      continue()
+    endif()
+    list(FIND allowed ${name} position)
+    if(position EQUAL -1)
+      list(APPEND unexpected ${name})
+    else()
+      list(APPEND found ${name})
+    endif()
+  endif()
+endforeach()
+set(missing "")
+foreach(name IN LISTS allowed)
+  list(FIND found ${name} position)
+  if(position EQUAL -1)
+    list(APPEND missing ${name})
+  endif()
+endforeach()
+if(unexpected OR missing)
+  message(FATAL_ERROR "${LIBRARY}: unexpected exports: [${unexpected}] missing exports: [${missing}]")
+endif()
+list(LENGTH found count)
+message(STATUS "${LIBRARY}: exactly the ${count} names of ${VERSION_SCRIPT}")

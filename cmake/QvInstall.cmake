@@ -1,0 +1,30 @@
+# Installation: the four shared libraries, their public headers, the
+# message catalog, a CMake package (find_package(qv) gives qv::qv_sr ...)
+# and a pkg-config file (pkg-config --cflags --libs qv_sr).
+include(CMakePackageConfigHelpers)
+
+set(QV_PUBLIC_HEADERS
+  ${PROJECT_SOURCE_DIR}/cu/include/qv_types.h
+  ${PROJECT_SOURCE_DIR}/cu/include/qv_cu.h
+  ${PROJECT_SOURCE_DIR}/tr/include/qv_tr.h
+  ${PROJECT_SOURCE_DIR}/pmsg/include/qv_pmsg.h
+  ${PROJECT_SOURCE_DIR}/sr/include/qv_sr.h)
+
+install(TARGETS qv_cu qv_tr qv_pmsg qv_sr
+  EXPORT qvTargets
+  LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR}
+  INCLUDES DESTINATION ${CMAKE_INSTALL_INCLUDEDIR})
+install(FILES ${QV_PUBLIC_HEADERS} DESTINATION ${CMAKE_INSTALL_INCLUDEDIR})
+install(FILES ${PROJECT_BINARY_DIR}/nls/qv_sr.cat DESTINATION ${CMAKE_INSTALL_DATADIR}/qv/nls)
+
+install(EXPORT qvTargets NAMESPACE qv:: DESTINATION ${CMAKE_INSTALL_LIBDIR}/cmake/qv)
+configure_package_config_file(${PROJECT_SOURCE_DIR}/cmake/qvConfig.cmake.in
+  ${PROJECT_BINARY_DIR}/qvConfig.cmake
+  INSTALL_DESTINATION ${CMAKE_INSTALL_LIBDIR}/cmake/qv)
+write_basic_package_version_file(${PROJECT_BINARY_DIR}/qvConfigVersion.cmake
+  COMPATIBILITY SameMajorVersion)
+install(FILES ${PROJECT_BINARY_DIR}/qvConfig.cmake ${PROJECT_BINARY_DIR}/qvConfigVersion.cmake
+  DESTINATION ${CMAKE_INSTALL_LIBDIR}/cmake/qv)
+
+configure_file(${PROJECT_SOURCE_DIR}/cmake/qv_sr.pc.in ${PROJECT_BINARY_DIR}/qv_sr.pc @ONLY)
+install(FILES ${PROJECT_BINARY_DIR}/qv_sr.pc DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig)

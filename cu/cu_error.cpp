@@ -1,0 +1,86 @@
+// cu_error.cpp - the per-thread error information of libqv_cu:
+// cu_set_error_1, cu_set_no_error_1, cu_get_error_1 and cu_rel_error_1.
+//
+// Each thread has one record (code, message set and number, formatted text)
+// in thread-local storage, so threads never see each other's errors and no
+// lock is needed. The text is formatted when the error is raised, from the
+// catalog's translation when there is one (cu_catalog.cpp) and the built-in
+// default otherwise (cu_message_format.cpp).
+
+#include <cstdarg>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+#include <string>
+
+#include "cu_i_message.h"
+#include "qv_cu.h"
+
+namespace {
+
+struct thread_error {
+  int32_t code = 0;
+  int32_t set = 0;
+  int32_t message = 0;
+  std::string text;
+};
+
+thread_local thread_error This_Thread_Error;
+
+}  // namespace
+
+extern "C" int32_t cu_set_error_1(int32_t code, int32_t /*reserved*/, const char *p_catalog,
+                                  int32_t set, int32_t message, const char *p_default_text, ...) {
+  thread_error &error = This_Thread_Error;
+  error.code = code;
+  error.set = set;
+  error.message = message;
+  error.text.clear();
+  va_list arguments;
+  va_start(arguments, p_default_text);
+  try {
+    error.text =
+        cu_i_format_message(cu_i_catalog_text(p_catalog, set, message), p_default_text, arguments);
+  } catch (...) {
+    // Out of memory while formatting: the code is what matters; keep it.
+    error.text.clear();
+  }
+  va_end(arguments);
+  return code;
+}
+
+extern "C" int32_t cu_set_no_error_1(void) {
+  thread_error &error = This_Thread_Error;
+  error.code = 0;
+  error.set = 0;
+  error.message = 0;
+  error.text.clear();
+  return 0;
+}
+
+extern "C" int32_t cu_get_error_1(cu_error_t **pp_error) {
+  if (pp_error == nullptr) {
+    return CU_RESULT_NULL_ARGUMENT;
+  }
+  const thread_error &error = This_Thread_Error;
+  // One block: the record, then its text, so one free releases both.
+  const size_t text_size = error.text.size() + 1;
+  void *p_block = std::malloc(sizeof(cu_error_t) + text_size);
+  if (p_block == nullptr) {
+    *pp_error = nullptr;
+    return CU_RESULT_NO_MEMORY;
+  }
+  auto *p_error = static_cast<cu_error_t *>(p_block);
+  char *p_text = static_cast<char *>(p_block) + sizeof(cu_error_t);
+  std::memcpy(p_text, error.text.c_str(), text_size);
+  p_error->code = error.code;
+  p_error->set = error.set;
+  p_error->message = error.message;
+  p_error->p_text = p_text;
+  *pp_error = p_error;
+  return CU_RESULT_OK;
+}
+
+extern "C" void cu_rel_error_1(cu_error_t *p_error) {
+  std::free(p_error);
+}

@@ -1,0 +1,190 @@
+/*
+ * qv_sr.h - the registry library libqv_sr: named, typed tables shared by the
+ * threads of a process and, through files, by processes.
+ *
+ * Conventions
+ *  1. Return codes. Every function returns a signed 32-bit code: 0 for
+ *     success, otherwise an SR_E_* code below. The code is also the number
+ *     of the message ("2605-<code>") that explains it.
+ *  2. Error information. A failing call leaves a message for the calling
+ *     thread; a successful exported call clears it. Read it with
+ *     cu_get_error_1() and release it with cu_rel_error_1() (qv_cu.h).
+ *     Messages come from the catalog "qv_sr.cat" (message set 1) when the C
+ *     library finds it through NLSPATH, else from the built-in texts
+ *     cu_mesgtbl_qv_sr_set. Threads never see each other's messages.
+ *  3. Memory. Everything a call hands back is the caller's and is released
+ *     with free() unless the function's contract names another release call.
+ *  4. Threads. A tree handle may be used by several threads at once; the
+ *     library locks what it touches. Closing a tree while other threads still
+ *     use it or its tables is the caller's error.
+ *  5. fork(). In a child process forked after the first sr_open_tree_1, every
+ *     call that would change a table or the namespace returns SR_E_INTERNAL
+ *     at once, without a message and without taking a lock (a thread of the
+ *     parent may have held one at the fork); reading calls still work.
+ *  6. Tracing is off unless QV_TRACE_LEVELS enables the component "_SRA"
+ *     (categories "API", "Errors", "Wherever"; see qv_tr.h).
+ */
+#ifndef QV_SR_H
+#define QV_SR_H
+
+#include <stdint.h>
+
+#include "qv_cu.h"
+#include "qv_types.h"
+
+#if defined(__GNUC__)
+#define QV_SR_EXPORT __attribute__((visibility("default")))
+#else
+#define QV_SR_EXPORT
+#endif
+
+#ifdef __cplusplus
+extern "C" {
+#endif
+
+/* ---- Return codes ------------------------------------------------------ */
+
+#define SR_E_SYSTEM_CALL 10          /* a system call failed unexpectedly */
+#define SR_E_LIBRARY_CALL 11         /* a companion library call failed */
+#define SR_E_NO_MEMORY 12            /* memory could not be allocated */
+#define SR_E_TREE_FULL 13            /* the filesystem of the local tree is full */
+#define SR_E_TABLE_UNREADABLE 14     /* a table file cannot be read */
+#define SR_E_INTERNAL 15             /* internal inconsistency; also any change in a forked child */
+#define SR_E_FILESYSTEM_FULL 16      /* a write found the filesystem full */
+#define SR_E_INVALID_HANDLE 100      /* a null or unknown tree or table handle */
+#define SR_E_NULL_POINTER 101        /* a required pointer argument was null */
+#define SR_E_INVALID_PATH 102        /* a registry path is not valid */
+#define SR_E_INVALID_MODE 103        /* a create or open mode is not valid */
+#define SR_E_NO_COLUMNS 104          /* column names or definitions were expected */
+#define SR_E_INVALID_COLUMN 105      /* a column definition or name is not valid */
+#define SR_E_DUPLICATE_COLUMN 106    /* a column name was given twice */
+#define SR_E_KEY_EXPECTED 107        /* the key column value was expected */
+#define SR_E_DUPLICATE_KEY 108       /* the key exists already, or two key columns */
+#define SR_E_INVALID_CRITERIA 109    /* a replacement variable in criteria is not valid */
+#define SR_E_NO_TABLE 200            /* the table does not exist */
+#define SR_E_TABLE_EXISTS 201        /* the table exists already */
+#define SR_E_NO_ROW_FOR_KEY 202      /* no row has the key */
+#define SR_E_NO_ROW_FOR_INDEX 203    /* no row has the index */
+#define SR_E_ROW_DELETED 204         /* the row at the index has been deleted */
+#define SR_E_NO_ROWS 205             /* there are no rows to delete */
+#define SR_E_ACCESS 206              /* no permission, or a write to a read-only table */
+#define SR_E_MOUNT_POINT_EXISTS 207  /* a mount point containing the path exists */
+#define SR_E_NO_MOUNT_POINT 208      /* the mount point does not exist */
+#define SR_E_UNCOMMITTED 209         /* the call needs a committed table */
+#define SR_E_NOT_APPLIED 210         /* the call needs pending updates applied first */
+#define SR_E_EXCLUSIVE_MODES 211     /* a table was opened in mutually exclusive modes */
+#define SR_E_APPLIED_UNCOMMITTED 212 /* the table has applied but uncommitted updates */
+
+/* The built-in texts of message set 1 of "qv_sr.cat", indexed by message
+ * number (not by code: codes 16 and 213 have the last two numbers). */
+#define SR_MESSAGE_COUNT 32
+QV_SR_EXPORT extern const char *const cu_mesgtbl_qv_sr_set[SR_MESSAGE_COUNT];
+
+/* ---- Column definitions ------------------------------------------------ */
+
+/* A column qualifier: a base value (qualifier & 15) with modifiers OR-ed on. */
+typedef enum {
+  SR_UNKNOWN_QUALIFIER = 0,
+  SR_SYSTEM = 1,
+  SR_STANDARD = 2,
+  SR_PRIMARY_KEY = 3,
+  SR_PRIMARY_KEY_NOCHECK = 4,
+  SR_PROTECTED = 16,
+  SR_INVISIBLE = 32,
+  SR_SET_TO_DEFAULT_WHEN_UNSPECIFIED = 64
+} sr_qualifier_t;
+
+/* One field of a structured-data definition. */
+typedef struct sr_sd_field_def_struct_t {
+  qv_data_type_t type;
+  qv_char_ptr_t name;
+} sr_sd_field_def_t;
+
+/* The elements of a QV_SD_PTR or QV_SD_PTR_ARRAY column. */
+typedef struct sr_sd_def_struct_t {
+  uint32_t number_of_fields;
+  sr_sd_field_def_t field_def[];
+} sr_sd_def_t;
+
+/*
+ * A column. Names are 1 to 255 bytes: a letter, then letters, digits and
+ * underscores; they are compared byte for byte. `properties` is the
+ * application's own and is handed back unchanged. `sd_defn` is required for
+ * structured-data columns and ignored for the others. `default_value` points
+ * to the default's block for variable-length types (null means empty).
+ */
+typedef struct sr_column_struct_t {
+  qv_char_ptr_t name;
+  qv_data_type_t type;
+  sr_qualifier_t qualifier;
+  int32_t properties;
+  sr_sd_def_t *sd_defn;
+  qv_value_t default_value;
+} sr_column_t;
+
+/* The state of a row in the view a read asked for. */
+typedef enum {
+  SR_ROW_STATE_COMMITTED = 0,
+  SR_ROW_STATE_ADDED = 1,
+  SR_ROW_STATE_UPDATED = 2,
+  SR_ROW_STATE_DELETED = 3,
+  SR_ROW_STATE_NO_ROW = 4
+} sr_row_state_t;
+
+/* Kinds and storage of the entries of the older directory-list calls. */
+typedef enum {
+  SR_UNKNOWN_ENTRY = 0,
+  SR_TABLE = 1,
+  SR_DIRECTORY = 2,
+  SR_MOUNT_POINT = 3,
+  SR_DIRECTORY_CONTAINER = 4,
+  SR_LOCAL_PERSISTENCE_MOUNT_POINT = 5,
+  SR_TREE = 6,
+  SR_REGISTRY = 7
+} sr_entry_t;
+
+typedef enum {
+  SR_UNKNOWN_STORAGE = 0,
+  SR_PERSISTENT = 1,
+  SR_TRANSIENT = 2,
+  SR_REMOTE = 3
+} sr_storage_t;
+
+typedef struct sr_entry_metadata_struct_t {
+  qv_char_ptr_t name;
+  sr_entry_t type;
+  sr_storage_t storage;
+  struct sr_entry_metadata_struct_t *p_table_list;
+} sr_entry_metadata_t;
+
+/* A tree or table handle. */
+typedef void *sr_opaque_handle_t;
+
+/* ---- Trees ------------------------------------------------------------- */
+
+/*
+ * Opens a tree, the handle every table operation works in, and stores it in
+ * *tree_handle. Strings are converted between the process's current locale
+ * and the stored form (UTF-8) for the life of the tree; in a UTF-8 locale or
+ * the C locale they are stored byte for byte. `number_of_retries` and
+ * `timeout` are accepted for compatibility and not used.
+ * Returns 0; SR_E_INVALID_HANDLE when tree_handle is null; SR_E_NO_MEMORY;
+ * SR_E_LIBRARY_CALL when the locale's code set cannot be converted;
+ * SR_E_SYSTEM_CALL when a process lock fails.
+ */
+QV_SR_EXPORT int32_t sr_open_tree_1(sr_opaque_handle_t *tree_handle, uint32_t number_of_retries,
+                                    uint32_t timeout);
+
+/*
+ * Closes a tree: every table and mount point of it is closed, whatever
+ * handles the caller still holds, and the handle becomes invalid.
+ * Returns 0; SR_E_INVALID_HANDLE for a null handle or one that is not an open
+ * tree (for example, closed already); SR_E_SYSTEM_CALL when a lock fails.
+ */
+QV_SR_EXPORT int32_t sr_close_tree_1(sr_opaque_handle_t tree_handle);
+
+#ifdef __cplusplus
+}
+#endif
+
+#endif /* QV_SR_H */

@@ -1,0 +1,68 @@
+/*
+ * c_interface_test.c - proves the public headers are C: this translation
+ * unit is compiled by the C compiler, links against the shared libraries and
+ * checks the contract of the calls it makes. Exit status 0 means success.
+ */
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+
+#include "qv_cu.h"
+#include "qv_sr.h"
+#include "qv_types.h"
+
+static int failures = 0;
+
+#define CHECK(condition)                                                      \
+  do {                                                                        \
+    if (!(condition)) {                                                       \
+      fprintf(stderr, "%s:%d: failed: %s\n", __FILE__, __LINE__, #condition); \
+      ++failures;                                                             \
+    }                                                                         \
+  } while (0)
+
+static int32_t last_code(char *p_text, size_t size) {
+  cu_error_t *p_error = NULL;
+  int32_t code = -1;
+  if (cu_get_error_1(&p_error) == 0) {
+    code = p_error->code;
+    snprintf(p_text, size, "%s", p_error->p_text);
+    cu_rel_error_1(p_error);
+  }
+  return code;
+}
+
+int main(void) {
+  char text[512];
+  sr_opaque_handle_t tree = NULL;
+  sr_column_t column;
+  qv_value_t value;
+
+  CHECK(sr_open_tree_1(NULL, 0, 0) == SR_E_INVALID_HANDLE);
+  CHECK(last_code(text, sizeof text) == 100);
+  CHECK(strcmp(text, "2605-100 A function was passed an invalid handle.\n") == 0);
+
+  CHECK(sr_open_tree_1(&tree, 0, 0) == 0);
+  CHECK(tree != NULL);
+  CHECK(last_code(text, sizeof text) == 0);
+  CHECK(sr_close_tree_1(tree) == 0);
+
+  /* The types are usable from C with their documented sizes. */
+  CHECK(sizeof(qv_value_t) == 8);
+  CHECK(sizeof(qv_structured_data_element_t) == 16);
+  CHECK(sizeof(qv_resource_handle_t) == 20);
+  memset(&column, 0, sizeof column);
+  column.name = "Port";
+  column.type = QV_UINT32;
+  column.qualifier = (sr_qualifier_t)(SR_STANDARD | SR_PROTECTED);
+  value.val_uint32 = 8080;
+  column.default_value = value;
+  CHECK((column.qualifier & 15) == SR_STANDARD);
+  CHECK((cu_dtc_table_1[QV_CHAR_PTR_ARRAY] & CU_DTC_POINTER) != 0);
+  CHECK(strcmp(cu_mesgtbl_qv_sr_set[0], "Reserved: DO NOT USE!") == 0);
+
+  if (failures == 0) {
+    printf("C interface: all checks passed\n");
+  }
+  return failures == 0 ? 0 : 1;
+}

@@ -1,0 +1,226 @@
+// The message set and the errors the frame raises: built-in texts, the
+// compiled catalog agreeing with them, the inserts of each raising
+// function, the key-not-found texts and the filesystem-full lookup.
+
+#include <gtest/gtest.h>
+#include <nl_types.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <string>
+
+#include "sr_i_errors.h"
+
+namespace {
+
+struct last_error {
+  int32_t code;
+  int32_t message;
+  std::string text;
+};
+
+last_error read_last_error() {
+  cu_error_t *p_error = nullptr;
+  EXPECT_EQ(cu_get_error_1(&p_error), 0);
+  last_error copy{p_error->code, p_error->message, p_error->p_text};
+  cu_rel_error_1(p_error);
+  return copy;
+}
+
+TEST(MessageSet, BuiltInTableKeepsTheInterfaceOrder) {
+  EXPECT_STREQ(cu_mesgtbl_qv_sr_set[0], "Reserved: DO NOT USE!");
+  EXPECT_STREQ(cu_mesgtbl_qv_sr_set[7], "2605-100 A function was passed an invalid handle.\n");
+  EXPECT_STREQ(cu_mesgtbl_qv_sr_set[29],
+               "2605-212 An attempt was made to update a table that has applied but uncommitted "
+               "updates.\n");
+  EXPECT_STREQ(cu_mesgtbl_qv_sr_set[30],
+               "2605-016 The filesystem containing the local tree is full: mounted(%1$s) "
+               "mounted_over(%2$s).\n");
+  EXPECT_STREQ(cu_mesgtbl_qv_sr_set[31],
+               "2605-213 There is no row corresponding to the specified key value (%1$s) in "
+               "table (%2$s).\n");
+}
+
+TEST(MessageSet, EveryPlainCodeHasTheMessageOfItsNumber) {
+  for (int32_t code : {13,  14,  100, 101, 103, 104, 105, 106, 107, 108, 200, 201,
+                       202, 203, 204, 205, 206, 207, 208, 209, 210, 211, 212}) {
+    const int32_t number = sr_i_plain_message_number(code);
+    ASSERT_GT(number, 0) << code;
+    char prefix[16];
+    std::snprintf(prefix, sizeof prefix, "2605-%03d ", code);
+    EXPECT_EQ(std::string(cu_mesgtbl_qv_sr_set[number]).rfind(prefix, 0), 0u) << code;
+  }
+}
+
+TEST(MessageSet, CompiledCatalogHoldsTheBuiltInTexts) {
+  const std::string path = std::string(SR_TEST_CATALOG_DIR) + "/qv_sr.cat";
+  nl_catd catalog = catopen(path.c_str(), 0);
+  ASSERT_NE(catalog, reinterpret_cast<nl_catd>(-1)) << path;
+  for (int number = 1; number < SR_MESSAGE_COUNT; ++number) {
+    EXPECT_STREQ(catgets(catalog, 1, number, "missing"), cu_mesgtbl_qv_sr_set[number]) << number;
+  }
+  catclose(catalog);
+}
+
+// Raises from a function of known name and returns the line it raised on.
+int raise_system_call_from_here() {
+  const int line = __LINE__ + 1;
+  EXPECT_EQ(sr_i_raise_system_call("pthread_cond_wait", 22), SR_E_SYSTEM_CALL);
+  return line;
+}
+
+TEST(RaisingErrors, SystemCallMessageNamesCallFunctionLineModuleAndVersion) {
+  const int line = raise_system_call_from_here();
+  const last_error error = read_last_error();
+  EXPECT_EQ(error.code, 10);
+  EXPECT_EQ(error.message, SR_I_MESSAGE_SYSTEM_CALL);
+  EXPECT_EQ(error.text,
+            "2605-010 The pthread_cond_wait system call unexpectedly returned an "
+            "errno of 22 to the raise_system_call_from_here function near line " +
+                std::to_string(line) +
+                " of file tests/sr/sr_messages_test, version " SR_TEST_VERSION ".\n");
+}
+
+TEST(RaisingErrors, EachRaisingFunctionUsesItsMessage) {
+  EXPECT_EQ(sr_i_raise_library_call("cu_iconv_str", 3), 11);
+  EXPECT_EQ(read_last_error().text.rfind("2605-011 The cu_iconv_str library function "
+                                         "unexpectedly returned 3 to the TestBody function",
+                                         0),
+            0u);
+  EXPECT_EQ(sr_i_raise_no_memory(), 12);
+  EXPECT_EQ(
+      read_last_error().text.rfind("2605-012 Memory could not be allocated in the TestBody", 0),
+      0u);
+  EXPECT_EQ(sr_i_raise_internal(), 15);
+  EXPECT_EQ(read_last_error().message, SR_I_MESSAGE_INTERNAL);
+  EXPECT_EQ(sr_i_raise_invalid_path(nullptr), 102);
+  EXPECT_EQ(read_last_error().text, "2605-102 <NULL POINTER> is an invalid pathname.\n");
+  EXPECT_EQ(sr_i_raise_invalid_path("/a//b"), 102);
+  EXPECT_EQ(read_last_error().text, "2605-102 /a//b is an invalid pathname.\n");
+  EXPECT_EQ(sr_i_raise(SR_E_APPLIED_UNCOMMITTED), 212);
+  EXPECT_EQ(read_last_error().message, 29);
+}
+
+// The key-not-found error: code 202, text of 213, key rendered by its type.
+std::string key_not_found_text(const char *p_table, qv_value_t key, qv_data_type_t type) {
+  EXPECT_EQ(trace_key_not_found(p_table, &key, type), SR_E_NO_ROW_FOR_KEY);
+  const last_error error = read_last_error();
+  EXPECT_EQ(error.code, 202);
+  EXPECT_EQ(error.message, SR_I_MESSAGE_KEY_NOT_FOUND);
+  return error.text;
+}
+
+std::string expected_text(const std::string &key, const std::string &table) {
+  return "2605-213 There is no row corresponding to the specified key value (" + key +
+         ") in table (" + table + ").\n";
+}
+
+TEST(KeyNotFound, NumericKeysAreRenderedByTheirType) {
+  qv_value_t key{};
+  key.val_int32 = -42;
+  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_INT32), expected_text("-42", "/cfg/t"));
+  key.val_uint32 = 4000000000u;
+  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_UINT32), expected_text("4000000000", "/cfg/t"));
+  key.val_int64 = -9000000000LL;
+  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_INT64), expected_text("-9000000000", "/cfg/t"));
+  key.val_uint64 = 18446744073709551615ULL;
+  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_UINT64),
+            expected_text("18446744073709551615", "/cfg/t"));
+  key.val_float32 = 1.5f;
+  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_FLOAT32), expected_text("1.5", "/cfg/t"));
+  key.val_float64 = 0.000125;
+  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_FLOAT64), expected_text("0.000125", "/cfg/t"));
+}
+
+TEST(KeyNotFound, StringKeysAreCutAt255Bytes) {
+  std::string long_key(300, 'k');
+  qv_value_t key{};
+  key.ptr_char = long_key.data();
+  EXPECT_EQ(key_not_found_text("t", key, QV_CHAR_PTR), expected_text(std::string(255, 'k'), "t"));
+}
+
+TEST(KeyNotFound, ResourceHandleKeysShowSixHexadecimalGroups) {
+  qv_resource_handle_t handle{0, {0xa, 0xbeef, 0x12345678, 0xffffffff}};
+  const uint16_t halves[2] = {0x0102, 0xfffe};  // the header's halves in memory order
+  std::memcpy(&handle.header, halves, sizeof halves);
+  qv_value_t key{};
+  key.ptr_rsrc_handle = &handle;
+  EXPECT_EQ(key_not_found_text("t", key, QV_RSRC_HANDLE_PTR),
+            expected_text("0x0102 0xfffe 0x0000000a 0x0000beef 0x12345678 0xffffffff", "t"));
+}
+
+TEST(KeyNotFound, OtherTypesAndMissingTableNameHaveFixedTexts) {
+  qv_value_t key{};
+  EXPECT_EQ(key_not_found_text(nullptr, key, QV_BINARY_PTR),
+            expected_text("***UNKNOWN KEY TYPE****", "(UNKNOWN_TABLE_NAME)"));
+}
+
+// A mount table written for one test.
+class FilesystemFull : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    directory_ = std::filesystem::temp_directory_path() /
+                 ("sr_mtab_" + std::to_string(getpid()) + "_" +
+                  ::testing::UnitTest::GetInstance()->current_test_info()->name());
+    std::filesystem::create_directories(directory_);
+    mount_table_ = (directory_ / "mtab").string();
+    saved_path_ = Sr_Mount_Table_Path;
+    Sr_Mount_Table_Path = mount_table_.c_str();
+  }
+  void TearDown() override {
+    Sr_Mount_Table_Path = saved_path_;
+    std::filesystem::remove_all(directory_);
+  }
+  void write_mount_table(const std::string &text) { std::ofstream(mount_table_) << text; }
+  std::string full_text_for(const char *p_path) {
+    EXPECT_EQ(trace_filesystem_full_for_path(p_path), SR_E_FILESYSTEM_FULL);
+    return read_last_error().text;
+  }
+  static std::string expected(const std::string &device, const std::string &directory) {
+    return "2605-016 The filesystem containing the local tree is full: mounted(" + device +
+           ") mounted_over(" + directory + ").\n";
+  }
+
+  std::filesystem::path directory_;
+  std::string mount_table_;
+  const char *saved_path_ = nullptr;
+};
+
+TEST_F(FilesystemFull, LongestWholeComponentPrefixWins) {
+  write_mount_table(
+      "/dev/root / ext4 rw 0 0\n"
+      "/dev/sda2 /data ext4 rw 0 0\n"
+      "/dev/sda3 /data/big xfs rw 0 0\n"
+      "tmpfs /dat tmpfs rw 0 0\n"
+      "/dev/sdb1 /mnt/my\\040disk ext4 rw 0 0\n"
+      "short line\n");
+  EXPECT_EQ(full_text_for("/data/big/tables/t1"), expected("/dev/sda3", "/data/big"));
+  EXPECT_EQ(full_text_for("/data/bigger/t1"), expected("/dev/sda2", "/data"));
+  EXPECT_EQ(full_text_for("/data"), expected("/dev/sda2", "/data"));
+  EXPECT_EQ(full_text_for("/dat/t"), expected("tmpfs", "/dat"));
+  EXPECT_EQ(full_text_for("/database/t"), expected("/dev/root", "/"));
+  EXPECT_EQ(full_text_for("/mnt/my disk/t"), expected("/dev/sdb1", "/mnt/my disk"));
+}
+
+TEST_F(FilesystemFull, LaterMountOverTheSameDirectoryWins) {
+  write_mount_table("/dev/sda2 /srv ext4 rw 0 0\noverlay /srv overlay rw 0 0\n");
+  EXPECT_EQ(full_text_for("/srv/registry/t"), expected("overlay", "/srv"));
+}
+
+TEST_F(FilesystemFull, WithoutRootEntryTheDeviceIsUnknown) {
+  write_mount_table("/dev/sda2 /data ext4 rw 0 0\n");
+  EXPECT_EQ(full_text_for("/home/t"), expected("UNKNOWN", "/"));
+}
+
+TEST_F(FilesystemFull, UnreadableMountTableRaisesNothing) {
+  cu_set_error_1(205, 0, "", 1, 22, "earlier error\n");
+  EXPECT_EQ(trace_filesystem_full_for_path("/data/t"), SR_E_FILESYSTEM_FULL);
+  const last_error error = read_last_error();
+  EXPECT_EQ(error.code, 205);
+  EXPECT_EQ(error.text, "earlier error\n");
+}
+
+}  // namespace

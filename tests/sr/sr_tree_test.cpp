@@ -1,0 +1,121 @@
+// Trees through the exported calls: opening and closing, bad handles, the
+// set of open trees under concurrent use, and the conversion handles that
+// follow the process's locale.
+
+#include <gtest/gtest.h>
+
+#include <clocale>
+#include <cstdlib>
+#include <filesystem>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "qv_sr.h"
+#include "sr_i_tree.h"
+
+namespace {
+
+int32_t last_error_code() {
+  cu_error_t *p_error = nullptr;
+  EXPECT_EQ(cu_get_error_1(&p_error), 0);
+  const int32_t code = p_error->code;
+  cu_rel_error_1(p_error);
+  return code;
+}
+
+bool is_open_tree(sr_opaque_handle_t tree) {
+  pthread_mutex_lock(&Registry_Trees_Mutex);
+  const bool open =
+      P_Registry_Trees != nullptr && P_Registry_Trees->count(static_cast<sr_i_tree_t *>(tree)) == 1;
+  pthread_mutex_unlock(&Registry_Trees_Mutex);
+  return open;
+}
+
+TEST(Trees, OpenRegistersTheTreeAndCloseEndsIt) {
+  sr_opaque_handle_t tree = nullptr;
+  ASSERT_EQ(sr_open_tree_1(&tree, 3, 1000), 0);
+  ASSERT_NE(tree, nullptr);
+  EXPECT_TRUE(is_open_tree(tree));
+  EXPECT_EQ(sr_close_tree_1(tree), 0);
+  EXPECT_FALSE(is_open_tree(tree));
+}
+
+TEST(Trees, NullHandlesAreInvalidHandles) {
+  EXPECT_EQ(sr_open_tree_1(nullptr, 0, 0), SR_E_INVALID_HANDLE);
+  EXPECT_EQ(last_error_code(), 100);
+  EXPECT_EQ(sr_close_tree_1(nullptr), SR_E_INVALID_HANDLE);
+  EXPECT_EQ(last_error_code(), 100);
+}
+
+TEST(Trees, ClosingATreeTwiceIsRefusedNotACrash) {
+  sr_opaque_handle_t tree = nullptr;
+  ASSERT_EQ(sr_open_tree_1(&tree, 0, 0), 0);
+  ASSERT_EQ(sr_close_tree_1(tree), 0);
+  EXPECT_EQ(sr_close_tree_1(tree), SR_E_INVALID_HANDLE);
+  // A later success clears the message of the refused call.
+  ASSERT_EQ(sr_open_tree_1(&tree, 0, 0), 0);
+  EXPECT_EQ(last_error_code(), 0);
+  EXPECT_EQ(sr_close_tree_1(tree), 0);
+}
+
+TEST(Trees, ManyThreadsOpenAndCloseTreesAtOnce) {
+  std::vector<std::thread> threads;
+  std::atomic<int> failures{0};
+  for (int thread = 0; thread < 4; ++thread) {
+    threads.emplace_back([&] {
+      for (int round = 0; round < 200; ++round) {
+        sr_opaque_handle_t tree = nullptr;
+        if (sr_open_tree_1(&tree, 0, 0) != 0 || !is_open_tree(tree) || sr_close_tree_1(tree) != 0) {
+          ++failures;
+        }
+      }
+    });
+  }
+  for (std::thread &thread : threads) {
+    thread.join();
+  }
+  EXPECT_EQ(failures, 0);
+}
+
+// Converts with one of a tree's handles.
+std::string convert(cu_iconv_t *p_handle, const std::string &text) {
+  char *p_out = nullptr;
+  EXPECT_EQ(cu_iconv_str_1(p_handle, text.c_str(), &p_out), 0);
+  std::string out = p_out ? p_out : "";
+  std::free(p_out);
+  return out;
+}
+
+TEST(TreeConversion, CLocaleStoresBytesAsTheyAre) {
+  ASSERT_NE(std::setlocale(LC_CTYPE, "C"), nullptr);
+  sr_opaque_handle_t handle = nullptr;
+  ASSERT_EQ(sr_open_tree_1(&handle, 0, 0), 0);
+  auto *p_tree = static_cast<sr_i_tree_t *>(handle);
+  EXPECT_EQ(cu_iconv_is_unchanged_1(p_tree->p_to_table_string_conversion_handle), 1);
+  EXPECT_EQ(cu_iconv_is_unchanged_1(p_tree->p_from_table_string_conversion_handle), 1);
+  const std::string utf8 = "gr\xc3\xbc\xc3\x9f dich \xe2\x82\xac";
+  EXPECT_EQ(convert(p_tree->p_to_table_string_conversion_handle, utf8), utf8);
+  EXPECT_EQ(sr_close_tree_1(handle), 0);
+}
+
+TEST(TreeConversion, Latin1LocaleIsConvertedAndKeptForTheLifeOfTheTree) {
+  // A Latin-1 locale compiled by the build (localedef) into SR_TEST_LOCALE_DIR.
+  const std::string locale_directory = SR_TEST_LOCALE_DIR;
+  if (!std::filesystem::exists(locale_directory + "/fr_FR.ISO-8859-1")) {
+    GTEST_SKIP() << "no Latin-1 locale could be built on this machine";
+  }
+  setenv("LOCPATH", locale_directory.c_str(), 1);
+  ASSERT_NE(std::setlocale(LC_CTYPE, "fr_FR.ISO-8859-1"), nullptr);
+  sr_opaque_handle_t handle = nullptr;
+  const int32_t rc = sr_open_tree_1(&handle, 0, 0);
+  std::setlocale(LC_CTYPE, "C");  // the tree keeps the handles it opened
+  unsetenv("LOCPATH");
+  ASSERT_EQ(rc, 0);
+  auto *p_tree = static_cast<sr_i_tree_t *>(handle);
+  EXPECT_EQ(convert(p_tree->p_to_table_string_conversion_handle, "caf\xe9"), "caf\xc3\xa9");
+  EXPECT_EQ(convert(p_tree->p_from_table_string_conversion_handle, "caf\xc3\xa9"), "caf\xe9");
+  EXPECT_EQ(sr_close_tree_1(handle), 0);
+}
+
+}  // namespace

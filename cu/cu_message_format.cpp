@@ -39,7 +39,7 @@ struct conversion {
   size_t end;
   size_t position;  // 1-based
   argument_kind kind;
-  std::string spec;
+  std::string directive;  // the conversion without its position, for snprintf
 };
 
 // A parsed text: its conversions in order, or nothing when a conversion is
@@ -140,7 +140,7 @@ parsed_text parse(std::string_view text) {
       item.position = next_sequential++;
       sequential = true;
     }
-    const size_t spec_start = cursor;
+    const size_t directive_start = cursor;
     while (cursor < text.size() && std::strchr("-+ #0'", text[cursor]) != nullptr) {
       ++cursor;
     }
@@ -153,7 +153,7 @@ parsed_text parse(std::string_view text) {
       return std::nullopt;
     }
     item.kind = *kind;
-    item.spec.append(text.substr(spec_start, cursor - spec_start));
+    item.directive.append(text.substr(directive_start, cursor - directive_start));
     item.end = cursor;
     conversions.push_back(std::move(item));
     at = cursor - 1;
@@ -232,43 +232,43 @@ std::vector<argument> read_arguments(const std::vector<argument_kind> &kinds, va
 // Renders one conversion of the given argument by snprintf.
 void append_conversion(std::string &out, const conversion &item, const argument &value) {
   char buffer[512];
-  const char *spec = item.spec.c_str();
+  const char *directive = item.directive.c_str();
   int length = 0;
 #pragma GCC diagnostic push
 #pragma GCC diagnostic ignored "-Wformat-nonliteral"
   switch (value.kind) {
     case argument_kind::integer:
-      length = std::snprintf(buffer, sizeof buffer, spec, static_cast<int>(value.integer));
+      length = std::snprintf(buffer, sizeof buffer, directive, static_cast<int>(value.integer));
       break;
     case argument_kind::long_integer:
-      length = std::snprintf(buffer, sizeof buffer, spec, static_cast<long>(value.integer));
+      length = std::snprintf(buffer, sizeof buffer, directive, static_cast<long>(value.integer));
       break;
     case argument_kind::long_long_integer:
-      length = std::snprintf(buffer, sizeof buffer, spec, value.integer);
+      length = std::snprintf(buffer, sizeof buffer, directive, value.integer);
       break;
     case argument_kind::size:
-      length = std::snprintf(buffer, sizeof buffer, spec, static_cast<size_t>(value.integer));
+      length = std::snprintf(buffer, sizeof buffer, directive, static_cast<size_t>(value.integer));
       break;
     case argument_kind::floating:
-      length = std::snprintf(buffer, sizeof buffer, spec, static_cast<double>(value.floating));
+      length = std::snprintf(buffer, sizeof buffer, directive, static_cast<double>(value.floating));
       break;
     case argument_kind::long_floating:
-      length = std::snprintf(buffer, sizeof buffer, spec, value.floating);
+      length = std::snprintf(buffer, sizeof buffer, directive, value.floating);
       break;
     case argument_kind::string: {
       const char *text = value.pointer ? static_cast<const char *>(value.pointer) : "(null)";
       // A string may be longer than the buffer; print it through its own size.
-      const int needed = std::snprintf(nullptr, 0, spec, text);
+      const int needed = std::snprintf(nullptr, 0, directive, text);
       if (needed > 0) {
         std::string piece(static_cast<size_t>(needed) + 1, '\0');
-        std::snprintf(piece.data(), piece.size(), spec, text);
+        std::snprintf(piece.data(), piece.size(), directive, text);
         piece.pop_back();
         out += piece;
       }
       return;
     }
     case argument_kind::pointer:
-      length = std::snprintf(buffer, sizeof buffer, spec, value.pointer);
+      length = std::snprintf(buffer, sizeof buffer, directive, value.pointer);
       break;
   }
 #pragma GCC diagnostic pop

@@ -22,8 +22,11 @@ for target in "${targets[@]}"; do
   name=$(basename "$target")
   corpus="build-fuzz/corpus/$name"
   mkdir -p "$corpus"
+  # Seeds live in fuzz/corpus/<library> for the targets fuzz_<library>_*.
+  library=${name#fuzz_}
+  library=${library%%_*}
   seeds=()
-  [ -d "fuzz/corpus/$name" ] && seeds=("fuzz/corpus/$name")
+  [ -d "fuzz/corpus/$library" ] && seeds=("fuzz/corpus/$library")
   echo "fuzz-smoke: $name for ${seconds}s"
   "$target" -max_total_time="$seconds" -timeout=10 -rss_limit_mb=2048 -print_final_stats=1 \
     "$corpus" "${seeds[@]}" 2>&1 | tail -n 5

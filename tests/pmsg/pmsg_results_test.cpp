@@ -1,0 +1,168 @@
+// Result codes: what each kind of bad call returns, that NO_ROOM means
+// exactly "the area is too small", and that strings go through the caller's
+// conversion handle, a failed conversion failing the call.
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+
+#include "pmsg_test_values.h"
+
+extern "C" int pmsg_c_interface_round_trip(void);
+
+namespace {
+
+TEST(Results, HeaderWorksFromC) {
+  EXPECT_EQ(pmsg_c_interface_round_trip(), 0);
+}
+
+TEST(Results, BadArgumentsAreNamed) {
+  value_arena arena;
+  qv_value_t text = arena.string("x"), value{};
+  qv_pmsg_value_t slot{};
+  unsigned char area[16];
+  uint32_t offset = 0, length = 0;
+  for (int32_t bad_type : {0, 1, QV_DATA_TYPE_LIMIT}) {
+    EXPECT_EQ(qv_pmsg_size_conv_protocol_value_1(1, 0, as_type(bad_type), &text, &length), 2);
+    EXPECT_EQ(qv_pmsg_build_conv_protocol_value_1(nullptr, 0, as_type(bad_type), &text, &slot, area,
+                                                  16, &offset),
+              2);
+    EXPECT_EQ(qv_pmsg_build_conv_packed_client_value_1(nullptr, 0, as_type(bad_type), &value, &slot,
+                                                       area, 16),
+              2);
+    EXPECT_EQ(qv_pmsg_convert_pmsg_value_1(&slot, as_type(bad_type), area), 2);
+  }
+  EXPECT_EQ(qv_pmsg_size_conv_protocol_value_1(1, 1, QV_CHAR_PTR, &text, &length), 7);
+  EXPECT_EQ(
+      qv_pmsg_build_conv_protocol_value_1(nullptr, 4, QV_CHAR_PTR, &text, &slot, area, 16, &offset),
+      7);
+  EXPECT_EQ(
+      qv_pmsg_build_conv_packed_client_value_1(nullptr, 2, QV_CHAR_PTR, &value, &slot, area, 16),
+      7);
+  EXPECT_EQ(qv_pmsg_size_conv_protocol_value_1(1, 0, QV_CHAR_PTR, &text, nullptr), 1);
+  EXPECT_EQ(
+      qv_pmsg_build_conv_protocol_value_1(nullptr, 0, QV_CHAR_PTR, &text, &slot, area, 16, nullptr),
+      1);
+  EXPECT_EQ(qv_pmsg_build_conv_protocol_value_1(nullptr, 0, QV_CHAR_PTR, &text, &slot, nullptr, 16,
+                                                &offset),
+            1);
+  EXPECT_EQ(
+      qv_pmsg_build_conv_packed_client_value_1(nullptr, 0, QV_CHAR_PTR, &value, &slot, nullptr, 16),
+      1);
+  EXPECT_EQ(qv_pmsg_convert_pmsg_value_1(&slot, QV_CHAR_PTR, nullptr), 1);
+  EXPECT_EQ(qv_pmsg_cnv_required_1(nullptr, nullptr, nullptr), 1);
+  EXPECT_EQ(offset, 0u);
+}
+
+TEST(Results, NoRoomOnlyWhenTheAreaIsTooSmall) {
+  value_arena arena;
+  qv_value_t value = arena.array({arena.string("abc"), arena.string("de")});
+  uint32_t needed = 0;
+  ASSERT_EQ(qv_pmsg_size_conv_protocol_value_1(1, 0, QV_CHAR_PTR_ARRAY, &value, &needed), 0);
+  ASSERT_EQ(needed, 4u + 2 * 8 + 4 + 3) << "count, two anchors, two strings with their NULs";
+  std::vector<unsigned char> area(10 + needed);
+  qv_pmsg_value_t slot{};
+  uint32_t offset = 10;
+  EXPECT_EQ(qv_pmsg_build_conv_protocol_value_1(nullptr, 0, QV_CHAR_PTR_ARRAY, &value, &slot,
+                                                area.data(), 9 + needed, &offset),
+            5);
+  EXPECT_EQ(offset, 10u);
+  EXPECT_EQ(slot.val_uint64, 0u);
+  uint32_t past_the_end = 11 + needed;
+  EXPECT_EQ(qv_pmsg_build_conv_protocol_value_1(nullptr, 0, QV_CHAR_PTR_ARRAY, &value, &slot,
+                                                area.data(), 10 + needed, &past_the_end),
+            5);
+  EXPECT_EQ(qv_pmsg_build_conv_protocol_value_1(nullptr, 0, QV_CHAR_PTR_ARRAY, &value, &slot,
+                                                area.data(), 10 + needed, &offset),
+            0);
+  EXPECT_EQ(offset, 10 + needed);
+
+  // A body of no bytes fits into no area at all.
+  qv_value_t empty = arena.binary("");
+  uint32_t zero = 0;
+  EXPECT_EQ(qv_pmsg_build_conv_protocol_value_1(nullptr, 0, QV_BINARY_PTR, &empty, &slot, nullptr,
+                                                0, &zero),
+            0);
+  EXPECT_EQ(slot.anchor.length, 0u);
+}
+
+TEST(Results, ClientValuesThatCannotBeEncoded) {
+  value_arena arena;
+  qv_value_t negative = arena.byte_string({});
+  negative.ptr_sbs->length = -4;
+  qv_value_t overrun = arena.byte_string({{QV_INT32, 0, "abcd"}});
+  overrun.ptr_sbs->length = 6;  // the field says 4 data bytes, only 2 are counted
+  qv_value_t bad_element = arena.structured({{QV_INT32, number32(1)}, {QV_NONE, number32(2)}});
+  struct {
+    int32_t type;
+    qv_value_t value;
+    int32_t code;
+  } cases[] = {{QV_SBS_PTR, negative, 4}, {QV_SBS_PTR, overrun, 4}, {QV_SD_PTR, bad_element, 2}};
+  for (const auto &one : cases) {
+    encoded_row row;
+    EXPECT_EQ(append_value(row, one.type, one.value), one.code);
+    EXPECT_EQ(row.used, 0u);
+    uint32_t size = 0;
+    EXPECT_EQ(qv_pmsg_size_conv_protocol_value_1(1, 0, as_type(one.type), &one.value, &size),
+              one.code);
+  }
+}
+
+class StringConversion : public testing::Test {
+ protected:
+  void SetUp() override {
+    ASSERT_EQ(cu_iconv_open_1("ISO-8859-1", CU_ICONV_TO_STORED, &p_to_stored_), 0);
+    ASSERT_EQ(cu_iconv_open_1("ISO-8859-1", CU_ICONV_FROM_STORED, &p_from_stored_), 0);
+    ASSERT_EQ(cu_iconv_open_1("ANSI_X3.4-1968", CU_ICONV_FROM_STORED, &p_to_ascii_), 0);
+  }
+  void TearDown() override {
+    cu_iconv_close_1(p_to_stored_);
+    cu_iconv_close_1(p_from_stored_);
+    cu_iconv_close_1(p_to_ascii_);
+  }
+  cu_iconv_t *p_to_stored_ = nullptr, *p_from_stored_ = nullptr, *p_to_ascii_ = nullptr;
+};
+
+TEST_F(StringConversion, EveryStringGoesThroughTheHandle) {
+  value_arena arena;
+  qv_value_t latin1 = arena.string("caf\xE9");
+  qv_value_t structured = arena.structured(
+      {{QV_CHAR_PTR, latin1}, {QV_CHAR_PTR_ARRAY, arena.array({latin1, arena.string("\xFC")})}});
+  encoded_row row;
+  ASSERT_EQ(append_value(row, QV_CHAR_PTR, latin1, p_to_stored_), 0);
+  ASSERT_EQ(append_value(row, QV_SD_PTR, structured, p_to_stored_), 0);
+  EXPECT_EQ(row.slots[0].anchor.length, 6u);
+  EXPECT_EQ(std::memcmp(row.area.data(), "caf\xC3\xA9", 6), 0) << "stored as UTF-8";
+
+  decoded_value stored, text, nested;
+  ASSERT_EQ(decode_slot(row, 0, QV_CHAR_PTR, stored), 0);
+  EXPECT_STREQ(stored.value.ptr_char, "caf\xC3\xA9");
+  ASSERT_EQ(decode_slot(row, 0, QV_CHAR_PTR, text, p_from_stored_), 0);
+  EXPECT_STREQ(text.value.ptr_char, "caf\xE9");
+  ASSERT_EQ(decode_slot(row, 1, QV_SD_PTR, nested, p_from_stored_), 0);
+  EXPECT_TRUE(values_equal(QV_SD_PTR, structured, nested.value));
+}
+
+TEST_F(StringConversion, FailedConversionFailsTheCall) {
+  value_arena arena;
+  encoded_row row;
+  ASSERT_EQ(append_value(row, QV_CHAR_PTR, arena.string("caf\xC3\xA9")), 0);
+  decoded_value untouched;
+  untouched.value.val_uint64 = 0x1234;
+  EXPECT_EQ(decode_slot(row, 0, QV_CHAR_PTR, untouched, p_to_ascii_),
+            QV_PMSG_RESULT_CONVERSION_FAILED);
+  EXPECT_EQ(untouched.value.val_uint64, 0x1234u);
+
+  // ISO-8859-1 maps every byte, so a failing encode needs a code set with
+  // holes: ASCII. A nested string fails the whole value.
+  cu_iconv_t *p_from_ascii = nullptr;
+  ASSERT_EQ(cu_iconv_open_1("ANSI_X3.4-1968", CU_ICONV_TO_STORED, &p_from_ascii), 0);
+  encoded_row failed;
+  EXPECT_EQ(append_value(failed, QV_CHAR_PTR_ARRAY,
+                         arena.array({arena.string("ok"), arena.string("caf\xE9")}), p_from_ascii),
+            QV_PMSG_RESULT_CONVERSION_FAILED);
+  EXPECT_EQ(failed.used, 0u);
+  cu_iconv_close_1(p_from_ascii);
+}
+
+}  // namespace

@@ -5,6 +5,7 @@
 #include "sr_i_tree.h"
 
 #include "sr_i_errors.h"
+#include "sr_i_table.h"
 
 std::set<sr_i_tree_t *> *P_Registry_Trees;
 pthread_mutex_t Registry_Trees_Mutex = PTHREAD_MUTEX_INITIALIZER;
@@ -86,6 +87,14 @@ int32_t sr_i_close_tree(sr_i_tree_t *p_tree) {
     p_tree->p_to_table_string_conversion_handle = nullptr;
     cu_iconv_close_1(p_tree->p_from_table_string_conversion_handle);
     p_tree->p_from_table_string_conversion_handle = nullptr;
+    for (auto &[name, p_table] : p_tree->tables) {
+      sr_i_close_table(p_table);
+    }
+    p_tree->tables.clear();
+    for (sr_i_table_t *p_table : p_tree->unnamed_tables) {
+      sr_i_close_table(p_table);
+    }
+    p_tree->unnamed_tables.clear();
     p_tree->mount_points.clear();
   }
   sr_i_rw_close(&p_tree->lock);

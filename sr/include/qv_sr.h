@@ -157,6 +157,17 @@ typedef struct sr_entry_metadata_struct_t {
   struct sr_entry_metadata_struct_t *p_table_list;
 } sr_entry_metadata_t;
 
+/*
+ * Key hashing supplied by a client of a hashed-key table. The hash function
+ * receives a pointer to a key value (for a string key the characters, for a
+ * resource handle the handle, for a number the number) and returns a bucket
+ * number below the bucket count the table was created with. The compare
+ * function receives the stored key first and the key looked for second and
+ * returns 0 when they are equal.
+ */
+typedef uint32_t (*sr_hash_function_t)(const void *p_key);
+typedef int32_t (*sr_hash_keys_compare_function_t)(const void *p_stored_key, const void *p_key);
+
 /* A tree or table handle. */
 typedef void *sr_opaque_handle_t;
 
@@ -182,6 +193,38 @@ QV_SR_EXPORT int32_t sr_open_tree_1(sr_opaque_handle_t *tree_handle, uint32_t nu
  * tree (for example, closed already); SR_E_SYSTEM_CALL when a lock fails.
  */
 QV_SR_EXPORT int32_t sr_close_tree_1(sr_opaque_handle_t tree_handle);
+
+/* ---- Mount points ------------------------------------------------------ */
+
+/*
+ * Maps the registry path prefix `p_registry_path` onto the directory
+ * `p_filesystem_path`, creating it and its parents (mode 0755) when missing:
+ * from then on a table created below the prefix is persistent, one file in
+ * that directory named by the rest of its path with "," for "/" (mount /a on
+ * /var/reg, and /a/b/c/t is the file /var/reg/b,c,t). Mount points may nest
+ * (mounting /a while /a/b is mounted is allowed); a path then belongs to the
+ * deepest mount point that contains it. `create` is ignored: directories are
+ * always created. Mount points last until unmounted or the tree is closed.
+ * Returns 0; SR_E_INVALID_HANDLE; SR_E_NULL_POINTER for a null directory;
+ * SR_E_INVALID_PATH; SR_E_MOUNT_POINT_EXISTS when the path is already below
+ * a mount point or mounted; SR_E_TABLE_EXISTS when a table has exactly this
+ * path; SR_E_FILESYSTEM_FULL or SR_E_SYSTEM_CALL ("mkdir") when the
+ * directory cannot be made (one already made is kept); SR_E_NO_MEMORY;
+ * SR_E_INTERNAL in a forked child.
+ */
+QV_SR_EXPORT int32_t sr_mount_local_tree_1(sr_opaque_handle_t tree_handle,
+                                           const char *p_registry_path,
+                                           const char *p_filesystem_path, int32_t create);
+
+/*
+ * Removes the mount point `p_registry_path` (as it was given to the mount
+ * call). Tables already open below it keep their files; a later create or
+ * open of such a path makes a transient table. Returns 0;
+ * SR_E_INVALID_HANDLE; SR_E_NO_MOUNT_POINT when the tree has no mount point
+ * at all (whatever the path) or not this one; SR_E_INVALID_PATH.
+ */
+QV_SR_EXPORT int32_t sr_unmount_local_tree_1(sr_opaque_handle_t tree_handle,
+                                             const char *p_registry_path);
 
 #ifdef __cplusplus
 }

@@ -2,7 +2,8 @@
  * sr_i_tree.h - trees, the client's handle on the registry, and the
  * process-wide set of open trees.
  *
- * A tree owns its mount points (ordered by name, byte for byte), the two
+ * A tree owns its named tables (by name), its unnamed tables (selection
+ * results, by address), its mount points (by name, byte for byte), the two
  * string conversion handles every string value passes through, and the
  * read-write lock that serialises changes to its namespace. The tree lock is
  * taken before any table lock; Registry_Trees_Mutex guards only the set of
@@ -29,8 +30,17 @@ typedef struct sr_i_mount_point_struct_t {
   uint32_t block_size = 0;
 } sr_i_mount_point_t;
 
+struct sr_i_table_struct_t;
+
 typedef struct sr_i_tree_struct_t {
-  /* Mount points by name; std::string orders bytes as strcmp does. */
+  /* Named tables by key: a transient table's registry path, a persistent
+   * table's file path (see sr_i_resolve_path). std::string orders bytes as
+   * strcmp does. A transient table stays here until deleted; a persistent
+   * one while it is open. */
+  std::map<std::string, struct sr_i_table_struct_t *, std::less<>> tables;
+  /* Tables without a name, by address. */
+  std::set<struct sr_i_table_struct_t *> unnamed_tables;
+  /* Mount points by name. */
   std::map<std::string, sr_i_mount_point_t, std::less<>> mount_points;
   /* From the process's code set into the stored form, and back; fixed for
    * the life of the tree. */
@@ -63,8 +73,10 @@ int32_t sr_i_unregister_tree(sr_i_tree_t *p_tree);
 
 /*
  * Tears a tree down: takes its lock for writing (a failure returns the code
- * and leaves the tree alive), closes the conversion handles and the mount
- * points, then frees the tree. Used by sr_close_tree_1 and by a failed open.
+ * and leaves the tree alive), closes the conversion handles, every table
+ * whatever handles are still held, and the mount points, then frees the
+ * tree. It takes no table lock: no other thread may use the tables. Used by sr_close_tree_1 and by
+ * a failed open.
  */
 int32_t sr_i_close_tree(sr_i_tree_t *p_tree);
 

@@ -1,0 +1,108 @@
+/*
+ * sr_i_hash_table.h - the key hash table of a keyed table: a fixed number of
+ * buckets, each a singly linked chain of elements that map a key value to
+ * the row's position in the table's fixed row index.
+ *
+ * Elements do not copy keys: `p_key_value` points at the key inside a row
+ * record, and whoever replaces or frees that record repoints the element
+ * (sr_i_hash_table_get_index hands out the field's address for this).
+ * The hash table has no lock of its own: lookups run under the owning
+ * table's read lock, changes under its write lock.
+ */
+#ifndef SR_I_HASH_TABLE_H
+#define SR_I_HASH_TABLE_H
+
+#include <cstdint>
+
+#include "qv_sr.h"
+
+/* The bucket count of the built-in hash for resource-handle keys. */
+inline constexpr uint32_t Sr_Resource_Handle_Hash_Buckets = 16384;
+
+typedef struct sr_hash_table_element_struct_t {
+  uint32_t row_index;                            /* position of the row in the fixed row index */
+  const void *p_key_value;                       /* the key inside the row's record, not a copy */
+  struct sr_hash_table_element_struct_t *p_next; /* same bucket; null at the end */
+} sr_hash_table_element_t;
+
+typedef struct sr_hash_table_struct_t {
+  uint32_t total_hash_buckets;                        /* fixed for the table's life */
+  sr_hash_function_t p_hash_function;                 /* null: the built-in hash */
+  sr_hash_keys_compare_function_t p_compare_function; /* 0 means equal */
+  sr_hash_table_element_t **p_elements;               /* bucket heads */
+} sr_hash_table_t;
+
+/*
+ * Makes an empty hash table. With a null `p_hash_function` keys are resource
+ * handles (qv_resource_handle_t): the table gets 16384 buckets, the bucket is
+ * the low 14 bits of `id.id4` and keys compare with cu_rsrc_hndl_cmp_1,
+ * whatever count and compare function were passed. A client hash function
+ * needs a compare function and at least one bucket (the exported calls
+ * check both with 101 first); without them this returns 15.
+ * Returns 0 and the table in `*p_p_hash_table`, 12 or 15 (raised).
+ */
+int32_t sr_i_hash_table_open(uint32_t total_hash_buckets, sr_hash_function_t p_hash_function,
+                             sr_hash_keys_compare_function_t p_compare_function,
+                             sr_hash_table_t **p_p_hash_table);
+
+/* Frees every element, the buckets and the table; a null table is accepted.
+ * Returns 0. Row records the elements point into are not touched. */
+int32_t sr_i_hash_table_close(sr_hash_table_t *p_hash_table);
+
+/*
+ * The bucket of a key through `*p_hash_index`. A client hash function must
+ * return a bucket below `total_hash_buckets`; any other result is refused
+ * with 15 (raised) rather than used, here and in every operation below that
+ * hashes a key.
+ */
+int32_t sr_i_hash_table_bucket(const sr_hash_table_t *p_hash_table, const void *p_key_value,
+                               uint32_t *p_hash_index);
+
+/*
+ * Adds an element for the key at `p_key_value` (kept, not copied) and row
+ * `row_index` at the head of its bucket, and returns the bucket and the
+ * element through `*p_hash_index` and `*p_p_hash_table_element`: the row's
+ * index entry keeps both so the element can be unlinked without hashing.
+ *
+ * When `qualifier & 15` is SR_PRIMARY_KEY and an element with an equal key
+ * exists, nothing is added: `*p_hash_index` and `*p_p_hash_table_element`
+ * name that existing element and the result is 108, not raised (adding a row
+ * may revive a deleted row through it). Under any other qualifier, notably
+ * SR_PRIMARY_KEY_NOCHECK, equal keys are all kept, the newest first.
+ * Returns 0, 108, 12 (raised) or 15 (raised, bad bucket); on 12 and 15 the
+ * table is unchanged.
+ */
+int32_t sr_i_hash_table_add(sr_hash_table_t *p_hash_table, const void *p_key_value,
+                            uint32_t row_index, uint32_t *p_hash_index,
+                            sr_hash_table_element_t **p_p_hash_table_element,
+                            sr_qualifier_t qualifier);
+
+/*
+ * Finds the most recently added element whose key equals the key at
+ * `p_key_value`: its row through `*p_row_index` and, when
+ * `p_p_p_key_value` is not null, the address of its `p_key_value` field,
+ * through which the caller repoints it at a new record.
+ * Returns 0, 202 (not raised: the caller reports a missing key in its own
+ * words) or 15 (raised, bad bucket).
+ */
+int32_t sr_i_hash_table_get_index(const sr_hash_table_t *p_hash_table, const void *p_key_value,
+                                  uint32_t *p_row_index, const void ***p_p_p_key_value);
+
+/*
+ * Unlinks and frees exactly `p_hash_table_element` (by identity, not by key)
+ * from bucket `hash_index`. Returns 0, 202 (raised) when the element is not
+ * in that bucket, or 15 (raised) when `hash_index` is not a bucket.
+ */
+int32_t sr_i_hash_table_remove_element(sr_hash_table_t *p_hash_table, uint32_t hash_index,
+                                       sr_hash_table_element_t *p_hash_table_element);
+
+/* Unlinks and frees the most recently added element whose key equals the
+ * key at `p_key_value`. Returns 0, 202 (raised) or 15 (raised, bad bucket). */
+int32_t sr_i_hash_table_remove(sr_hash_table_t *p_hash_table, const void *p_key_value);
+
+/* Prints to standard output, for diagnosis: "<bucket> <chain length>" for
+ * each non-empty bucket in bucket order, then the bucket count, the longest
+ * chain and the number of empty buckets. */
+void sr_i_hash_table_output_stats(const sr_hash_table_t *p_hash_table);
+
+#endif /* SR_I_HASH_TABLE_H */

@@ -1,0 +1,150 @@
+/*
+ * sr_i_table.h - the table object behind every table handle, transient or
+ * persistent: column definitions (in the metadata record), row records (in
+ * the record buffer pool), the fixed row index with its free chain, the
+ * packed index of live rows, the change lists, the key hash table, and the
+ * state of the table's files.
+ *
+ * A row keeps its fixed index position for life; the packed index lists the
+ * rows in order. Pending changes are entries of two doubly linked lists that
+ * point at their rows' index entries.
+ */
+#ifndef SR_I_TABLE_H
+#define SR_I_TABLE_H
+
+#include <sys/uio.h>
+
+#include <cstdint>
+
+#include "qv_sr.h"
+#include "sr_i_read_write_lock.h"
+#include "sr_i_record_buffer_pool.h"
+
+struct sr_hash_table_struct_t;
+struct sr_hash_table_element_struct_t;
+struct sr_i_application_metadata_struct_t;
+struct sr_i_tree_struct_t;
+struct sr_i_change_entry_struct_t;
+
+/* Table open modes (the `mode` field). */
+inline constexpr uint32_t Sr_Mode_Read_Only = 1;
+inline constexpr uint32_t Sr_Mode_Writable = 2;
+
+/* Positions a new transient table starts with, and what 0 stands for. */
+inline constexpr uint32_t Sr_Initial_Transient_Rows = 100;
+inline constexpr uint32_t Sr_Default_Index_Rows = 10;
+
+/* One position of the fixed row index. */
+typedef struct sr_i_index_entry_struct_t {
+  void *p_applied;   /* the row record as applied, or null */
+  void *p_committed; /* the row record as committed; null: no committed row */
+  uint32_t file_offset;
+  uint32_t applied_file_offset;
+  /* The row's pending change; while the entry is free, the next free entry. */
+  void *p_pending_change;
+  uint32_t hash_index;
+  struct sr_hash_table_element_struct_t *p_hash_table_element;
+  uint32_t packed_index;
+} sr_i_index_entry_t;
+
+/* A pending change of one row. */
+typedef struct sr_i_change_entry_struct_t {
+  uint32_t deletion;
+  sr_i_index_entry_t *p_index_entry;
+  struct sr_i_change_entry_struct_t *p_next;
+  struct sr_i_change_entry_struct_t *p_prev;
+} sr_i_change_entry_t;
+
+typedef struct sr_i_table_struct_t {
+  char *p_name; /* absolute registry path, or null for an unnamed table */
+  uint32_t references;
+  void *p_metadata_record_data;
+  sr_column_t *p_columns;
+  uint32_t total_columns;
+  uint32_t total_variable_length_columns;
+  uint32_t maximum_rows;
+  uint32_t total_applied_rows;
+  uint32_t total_committed_rows;
+  sr_i_index_entry_t *p_rows_fixed_index;
+  uint32_t *p_rows_packed_index;
+  sr_i_change_entry_t *p_rows_change_list;
+  sr_i_change_entry_t *p_rows_change_list_tail;
+  sr_i_change_entry_t *p_delete_rows_change_list;
+  sr_i_change_entry_t *p_delete_rows_change_list_tail;
+  uint32_t implicitly_controlled;
+  uint32_t uncommitted_updates_visible;
+  uint64_t change_counter;
+  uint64_t applied_change_counter;
+  struct sr_i_tree_struct_t *p_tree;
+  struct sr_i_table_struct_t *p_next;
+  uint32_t mode;
+  uint32_t block_size; /* the mount point's; 0 for a transient table */
+  uint32_t ready_for_commit;
+  uint32_t applied_deletions;
+  int32_t file_fd;
+  int32_t rewrite_file_fd;
+  /* The data file's name, a NUL at file_path_length, then the rewrite
+   * file's suffix: writing "." over the NUL names the rewrite file. */
+  char *p_file_path;
+  uint32_t file_path_length;
+  uint32_t commit_record_offset;
+  uint32_t applied_commit_record_offset;
+  uint32_t commit_record_length;
+  uint32_t applied_commit_record_length;
+  uint32_t file_length;
+  uint32_t disk_commit_record_offset;
+  uint32_t disk_applied_commit_record_offset;
+  uint32_t disk_commit_record_length;
+  uint32_t disk_applied_commit_record_length;
+  uint32_t disk_file_length;
+  uint32_t rewrite_file_length;
+  char *p_persistent_table_registry_path;
+  struct sr_hash_table_struct_t *p_rows_hash_table;
+  sr_i_index_entry_t *p_rows_free_chain;
+  struct sr_i_application_metadata_struct_t *p_application_metadata;
+  void *p_packed_rows_array;
+  sr_i_read_write_lock_t lock;
+  sr_i_record_buffer_pool_t record_buffer_pool;
+  struct iovec io_vector[16];
+} sr_i_table_t;
+
+/*
+ * A new table object with nothing in it: no name, no columns, no index, an
+ * empty pool, change counters at 1, no files (descriptors -1), its lock
+ * open. Null when memory runs out (12 raised). Free it with sr_i_close_table.
+ */
+sr_i_table_t *sr_i_new_table();
+
+/* Frees the table and everything it owns, writing nothing: what is pending
+ * or applied and not committed is dropped. Null is ignored. */
+void sr_i_close_table(sr_i_table_t *p_table);
+
+/* Makes both indexes for `maximum_rows` positions (10 for 0), all free.
+ * Returns 0 or 12 (raised). */
+int32_t sr_i_establish_rows_index(sr_i_table_t *p_table, uint32_t maximum_rows);
+
+/* Adds `total_new_rows` free positions, keeping the pending changes
+ * pointed at their rows when the index moves. Returns 0 or 12 (raised);
+ * after a failure the table must only be freed. */
+int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows);
+
+/* Clears an entry and gives it back; the chain stays in address order. */
+void sr_i_rows_free_chain_insert(sr_i_table_t *p_table, sr_i_index_entry_t *p_entry);
+
+/* Takes the lowest free entry, or null when none is free. */
+sr_i_index_entry_t *sr_i_rows_free_chain_remove(sr_i_table_t *p_table);
+
+/* Frees every change entry of both lists and empties them. */
+void sr_i_free_change_lists(sr_i_table_t *p_table);
+
+/* Whether `length` bytes from `offset` lie in one file block of the
+ * table's block size (a record ending on a boundary does not); the block
+ * number of `offset` goes to `block`. */
+bool sr_i_record_contained_in_block(const sr_i_table_t *p_table, uint32_t offset, uint32_t length,
+                                    uint32_t &block);
+
+/* Make p_file_path name the data file, or the rewrite file. */
+void sr_i_set_data_path(sr_i_table_t *p_table);
+void sr_i_set_rewrite_path(sr_i_table_t *p_table);
+
+#endif /* SR_I_TABLE_H */

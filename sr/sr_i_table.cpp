@@ -1,0 +1,189 @@
+// sr_i_table.cpp - the table object: making and freeing it (freeing drops
+// whatever is pending or applied and not committed), the fixed row
+// index with its free chain and growth, the change lists, block
+// containment and the data/rewrite file name switch.
+//
+// Index entries are handed out lowest position first: the free chain is
+// kept in ascending address order, linked through p_pending_change, which a
+// free entry does not otherwise use.
+
+#include "sr_i_table.h"
+
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+
+#include "sr_i_errors.h"
+#include "sr_i_hash_table.h"
+
+namespace {
+
+sr_i_index_entry_t *next_free(const sr_i_index_entry_t *p_entry) {
+  return static_cast<sr_i_index_entry_t *>(p_entry->p_pending_change);
+}
+
+// Chains entries [first, last) in ascending order, the last one ending it.
+void chain_free_entries(sr_i_index_entry_t *p_first, sr_i_index_entry_t *p_last) {
+  for (sr_i_index_entry_t *p_entry = p_first; p_entry != p_last; ++p_entry) {
+    p_entry->p_pending_change = p_entry + 1 == p_last ? nullptr : p_entry + 1;
+  }
+}
+
+void free_change_list(sr_i_change_entry_t *p_entry) {
+  while (p_entry != nullptr) {
+    sr_i_change_entry_t *p_next = p_entry->p_next;
+    std::free(p_entry);
+    p_entry = p_next;
+  }
+}
+
+}  // namespace
+
+sr_i_table_t *sr_i_new_table() {
+  auto *p_table = static_cast<sr_i_table_t *>(std::calloc(1, sizeof(sr_i_table_t)));
+  if (p_table == nullptr) {
+    sr_i_raise_no_memory();
+    return nullptr;
+  }
+  p_table->change_counter = 1;
+  p_table->applied_change_counter = 1;
+  p_table->file_fd = -1;
+  p_table->rewrite_file_fd = -1;
+  sr_i_rw_open(&p_table->lock);
+  return p_table;
+}
+
+void sr_i_close_table(sr_i_table_t *p_table) {
+  if (p_table == nullptr) {
+    return;
+  }
+  sr_i_rw_close(&p_table->lock);
+  sr_i_rb_uninitialize_record_buffer_pool(&p_table->record_buffer_pool);
+  sr_i_hash_table_close(p_table->p_rows_hash_table);
+  std::free(p_table->p_rows_fixed_index);
+  std::free(p_table->p_rows_packed_index);
+  sr_i_free_change_lists(p_table);
+  std::free(p_table->p_name);
+  std::free(p_table->p_file_path);
+  std::free(p_table->p_persistent_table_registry_path);
+  std::free(p_table);
+}
+
+int32_t sr_i_establish_rows_index(sr_i_table_t *p_table, uint32_t maximum_rows) {
+  if (maximum_rows == 0) {
+    maximum_rows = Sr_Default_Index_Rows;
+  }
+  auto *p_fixed =
+      static_cast<sr_i_index_entry_t *>(std::calloc(maximum_rows, sizeof(sr_i_index_entry_t)));
+  auto *p_packed = static_cast<uint32_t *>(std::calloc(maximum_rows, sizeof(uint32_t)));
+  if (p_fixed == nullptr || p_packed == nullptr) {
+    std::free(p_fixed);
+    std::free(p_packed);
+    return sr_i_raise_no_memory();
+  }
+  chain_free_entries(p_fixed, p_fixed + maximum_rows);
+  p_table->p_rows_fixed_index = p_fixed;
+  p_table->p_rows_packed_index = p_packed;
+  p_table->p_rows_free_chain = p_fixed;
+  p_table->maximum_rows = maximum_rows;
+  return 0;
+}
+
+int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows) {
+  const uint32_t old_rows = p_table->maximum_rows;
+  const uint64_t new_rows = uint64_t{old_rows} + total_new_rows;
+  if (new_rows > UINT32_MAX) {
+    return sr_i_raise_no_memory();
+  }
+  auto *p_packed = static_cast<uint32_t *>(
+      std::realloc(p_table->p_rows_packed_index, new_rows * sizeof(uint32_t)));
+  if (p_packed == nullptr) {
+    std::free(p_table->p_rows_packed_index);
+    p_table->p_rows_packed_index = nullptr;
+    return sr_i_raise_no_memory();
+  }
+  p_table->p_rows_packed_index = p_packed;
+  // Where the change entries point, as positions, for after a move.
+  const auto old_base = reinterpret_cast<uintptr_t>(p_table->p_rows_fixed_index);
+  auto *p_fixed = static_cast<sr_i_index_entry_t *>(
+      std::realloc(p_table->p_rows_fixed_index, new_rows * sizeof(sr_i_index_entry_t)));
+  if (p_fixed == nullptr) {
+    std::free(p_table->p_rows_fixed_index);
+    p_table->p_rows_fixed_index = nullptr;
+    return sr_i_raise_no_memory();
+  }
+  std::memset(static_cast<void *>(p_fixed + old_rows), 0,
+              total_new_rows * sizeof(sr_i_index_entry_t));
+  std::memset(p_packed + old_rows, 0, total_new_rows * sizeof(uint32_t));
+  chain_free_entries(p_fixed + old_rows, p_fixed + new_rows);
+  p_table->p_rows_free_chain = p_fixed + old_rows;
+  p_table->maximum_rows = static_cast<uint32_t>(new_rows);
+  if (reinterpret_cast<uintptr_t>(p_fixed) != old_base) {
+    for (sr_i_change_entry_t *p_list :
+         {p_table->p_rows_change_list, p_table->p_delete_rows_change_list}) {
+      for (sr_i_change_entry_t *p_change = p_list; p_change != nullptr;
+           p_change = p_change->p_next) {
+        const uintptr_t position =
+            (reinterpret_cast<uintptr_t>(p_change->p_index_entry) - old_base) /
+            sizeof(sr_i_index_entry_t);
+        p_change->p_index_entry = p_fixed + position;
+      }
+    }
+  }
+  p_table->p_rows_fixed_index = p_fixed;
+  return 0;
+}
+
+void sr_i_rows_free_chain_insert(sr_i_table_t *p_table, sr_i_index_entry_t *p_entry) {
+  *p_entry = sr_i_index_entry_t{};
+  sr_i_index_entry_t *p_previous = nullptr;
+  sr_i_index_entry_t *p_next = p_table->p_rows_free_chain;
+  while (p_next != nullptr && p_next < p_entry) {
+    p_previous = p_next;
+    p_next = next_free(p_next);
+  }
+  p_entry->p_pending_change = p_next;
+  if (p_previous == nullptr) {
+    p_table->p_rows_free_chain = p_entry;
+  } else {
+    p_previous->p_pending_change = p_entry;
+  }
+}
+
+sr_i_index_entry_t *sr_i_rows_free_chain_remove(sr_i_table_t *p_table) {
+  sr_i_index_entry_t *p_entry = p_table->p_rows_free_chain;
+  if (p_entry != nullptr) {
+    p_table->p_rows_free_chain = next_free(p_entry);
+    p_entry->p_pending_change = nullptr;
+  }
+  return p_entry;
+}
+
+void sr_i_free_change_lists(sr_i_table_t *p_table) {
+  free_change_list(p_table->p_rows_change_list);
+  free_change_list(p_table->p_delete_rows_change_list);
+  p_table->p_rows_change_list = nullptr;
+  p_table->p_rows_change_list_tail = nullptr;
+  p_table->p_delete_rows_change_list = nullptr;
+  p_table->p_delete_rows_change_list_tail = nullptr;
+}
+
+bool sr_i_record_contained_in_block(const sr_i_table_t *p_table, uint32_t offset, uint32_t length,
+                                    uint32_t &block) {
+  const uint64_t block_size = p_table->block_size;
+  if (block_size == 0) {  // a transient table has no blocks
+    block = 0;
+    return true;
+  }
+  block = static_cast<uint32_t>(offset / block_size);
+  return offset / block_size == (uint64_t{offset} + length) / block_size;
+}
+
+void sr_i_set_data_path(sr_i_table_t *p_table) {
+  p_table->p_file_path[p_table->file_path_length] = '\0';
+}
+
+void sr_i_set_rewrite_path(sr_i_table_t *p_table) {
+  p_table->p_file_path[p_table->file_path_length] = '.';
+}

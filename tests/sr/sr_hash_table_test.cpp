@@ -1,0 +1,239 @@
+// The key hash table: client and built-in hashing, the two key qualifiers,
+// unlinking by identity, bucket numbers out of range, the statistics, and a
+// random sequence of operations checked against a std::multimap.
+
+#include <gtest/gtest.h>
+
+#include <iterator>
+#include <map>
+#include <random>
+#include <string>
+
+#include "qv_cu.h"
+#include "sr_i_hash_table.h"
+
+namespace {
+
+constexpr uint32_t Buckets = 8;
+
+uint32_t key_modulo_buckets(const void *p_key) {
+  return *static_cast<const uint32_t *>(p_key) % Buckets;
+}
+uint32_t key_itself(const void *p_key) {
+  return *static_cast<const uint32_t *>(p_key);
+}
+int32_t compare_keys(const void *p_stored_key, const void *p_key) {
+  const uint32_t stored_key = *static_cast<const uint32_t *>(p_stored_key);
+  return stored_key == *static_cast<const uint32_t *>(p_key) ? 0 : 1;
+}
+
+int32_t last_error_code(std::string *p_text = nullptr) {
+  cu_error_t *p_error = nullptr;
+  EXPECT_EQ(cu_get_error_1(&p_error), 0);
+  const int32_t code = p_error->code;
+  if (p_text != nullptr) {
+    *p_text = p_error->p_text;
+  }
+  cu_rel_error_1(p_error);
+  return code;
+}
+
+// The row found for the key, or -1 for a clean 202 (returned, nothing raised).
+int64_t row_for(const sr_hash_table_t *p_table, const void *p_key) {
+  uint32_t row = 0;
+  cu_set_no_error_1();
+  const int32_t rc = sr_i_hash_table_get_index(p_table, p_key, &row, nullptr);
+  EXPECT_EQ(last_error_code(), 0);
+  if (rc == SR_E_NO_ROW_FOR_KEY) {
+    return -1;
+  }
+  EXPECT_EQ(rc, 0);
+  return row;
+}
+
+int64_t row_for(const sr_hash_table_t *p_table, uint32_t key) {
+  return row_for(p_table, &key);
+}
+
+struct ClientHashTable : ::testing::Test {
+  void SetUp() override {
+    ASSERT_EQ(sr_i_hash_table_open(Buckets, key_modulo_buckets, compare_keys, &p_table), 0);
+  }
+  void TearDown() override { EXPECT_EQ(sr_i_hash_table_close(p_table), 0); }
+  int32_t add(const uint32_t &key, uint32_t row, sr_qualifier_t qualifier) {
+    return sr_i_hash_table_add(p_table, &key, row, &bucket, &p_element, qualifier);
+  }
+  sr_hash_table_t *p_table = nullptr;
+  uint32_t bucket = 0;
+  sr_hash_table_element_t *p_element = nullptr;
+};
+
+TEST_F(ClientHashTable, PrimaryKeyRefusesAnEqualKeyAndReturnsTheExistingElement) {
+  const uint32_t three = 3, eleven = 11, three_again = 3;
+  ASSERT_EQ(add(three, 0, SR_PRIMARY_KEY), 0);
+  sr_hash_table_element_t *const p_first = p_element;
+  ASSERT_EQ(add(eleven, 1, SR_PRIMARY_KEY), 0);  // same bucket, different key
+  EXPECT_EQ(bucket, 3u);
+  cu_set_no_error_1();
+  // Modifier bits above the base qualifier do not turn the check off.
+  EXPECT_EQ(add(three_again, 2, static_cast<sr_qualifier_t>(SR_PRIMARY_KEY | SR_PROTECTED)),
+            SR_E_DUPLICATE_KEY);
+  EXPECT_EQ(last_error_code(), 0);
+  EXPECT_EQ(p_element, p_first);
+  EXPECT_EQ(row_for(p_table, 3), 0);
+  EXPECT_EQ(row_for(p_table, 11), 1);
+  EXPECT_EQ(row_for(p_table, 19), -1);
+}
+
+TEST_F(ClientHashTable, NoCheckKeepsEqualKeysAndTheLastAddedWins) {
+  const uint32_t first = 5, second = 5;
+  ASSERT_EQ(add(first, 1, SR_PRIMARY_KEY_NOCHECK), 0);
+  ASSERT_EQ(add(second, 2, SR_PRIMARY_KEY_NOCHECK), 0);
+  uint32_t row = 0;
+  const void **p_p_key = nullptr;
+  ASSERT_EQ(sr_i_hash_table_get_index(p_table, &first, &row, &p_p_key), 0);
+  EXPECT_EQ(row, 2u);
+  EXPECT_EQ(*p_p_key, &second);  // the field itself, so a caller can repoint it
+
+  ASSERT_EQ(sr_i_hash_table_remove(p_table, &first), 0);
+  EXPECT_EQ(row_for(p_table, 5), 1);
+  ASSERT_EQ(sr_i_hash_table_remove(p_table, &first), 0);
+  EXPECT_EQ(row_for(p_table, 5), -1);
+  EXPECT_EQ(sr_i_hash_table_remove(p_table, &first), SR_E_NO_ROW_FOR_KEY);
+  EXPECT_EQ(last_error_code(), SR_E_NO_ROW_FOR_KEY);
+}
+
+TEST_F(ClientHashTable, RemoveElementUnlinksThatElementFromTheMiddleOrTheHead) {
+  const uint32_t keys[] = {2, 10, 18};  // one bucket; the chain is 18, 10, 2
+  sr_hash_table_element_t *p_elements[3];
+  for (uint32_t at = 0; at < 3; ++at) {
+    ASSERT_EQ(add(keys[at], at, SR_PRIMARY_KEY), 0);
+    p_elements[at] = p_element;
+  }
+  std::string text;
+  EXPECT_EQ(sr_i_hash_table_remove_element(p_table, 3, p_elements[0]), SR_E_NO_ROW_FOR_KEY);
+  EXPECT_EQ(last_error_code(&text), SR_E_NO_ROW_FOR_KEY);
+  EXPECT_EQ(text, "2605-202 There is no row corresponding to the specified key value.\n");
+
+  ASSERT_EQ(sr_i_hash_table_remove_element(p_table, 2, p_elements[1]), 0);
+  EXPECT_EQ(row_for(p_table, 2), 0);
+  EXPECT_EQ(row_for(p_table, 10), -1);
+  EXPECT_EQ(row_for(p_table, 18), 2);
+  ASSERT_EQ(sr_i_hash_table_remove_element(p_table, 2, p_elements[2]), 0);
+  EXPECT_EQ(row_for(p_table, 2), 0);
+  EXPECT_EQ(row_for(p_table, 18), -1);
+  ASSERT_EQ(sr_i_hash_table_remove_element(p_table, 2, p_elements[0]), 0);
+  EXPECT_EQ(row_for(p_table, 2), -1);
+}
+
+TEST_F(ClientHashTable, StatisticsListNonEmptyBucketsThenTheTotals) {
+  const uint32_t keys[] = {1, 9, 6};
+  for (uint32_t at = 0; at < 3; ++at) {
+    ASSERT_EQ(add(keys[at], at, SR_PRIMARY_KEY), 0);
+  }
+  ::testing::internal::CaptureStdout();
+  sr_i_hash_table_output_stats(p_table);
+  EXPECT_EQ(::testing::internal::GetCapturedStdout(),
+            "1 2\n6 1\n"
+            "total hash buckets : 8\n"
+            "max_bucket_count   : 2\n"
+            "unused buckets     : 6\n");
+}
+
+TEST(HashTable, ClientBucketAtOrAboveTheCountIsRefusedWith15) {
+  sr_hash_table_t *p_table = nullptr;
+  ASSERT_EQ(sr_i_hash_table_open(Buckets, key_itself, compare_keys, &p_table), 0);
+  const uint32_t inside = Buckets - 1, outside = Buckets;
+  uint32_t bucket = 0, row = 0;
+  sr_hash_table_element_t *p_element = nullptr;
+  ASSERT_EQ(sr_i_hash_table_add(p_table, &inside, 4, &bucket, &p_element, SR_PRIMARY_KEY), 0);
+  EXPECT_EQ(sr_i_hash_table_add(p_table, &outside, 5, &bucket, &p_element, SR_PRIMARY_KEY),
+            SR_E_INTERNAL);
+  EXPECT_EQ(last_error_code(), SR_E_INTERNAL);
+  EXPECT_EQ(sr_i_hash_table_get_index(p_table, &outside, &row, nullptr), SR_E_INTERNAL);
+  EXPECT_EQ(sr_i_hash_table_remove(p_table, &outside), SR_E_INTERNAL);
+  EXPECT_EQ(sr_i_hash_table_remove_element(p_table, Buckets, p_element), SR_E_INTERNAL);
+  EXPECT_EQ(row_for(p_table, inside), 4);
+  EXPECT_EQ(sr_i_hash_table_close(p_table), 0);
+  EXPECT_EQ(sr_i_hash_table_close(nullptr), 0);
+}
+
+TEST(HashTable, BuiltInHashSharesABucketForHandlesDifferingAboveId4sLow14Bits) {
+  sr_hash_table_t *p_table = nullptr;
+  // The count and compare function given are replaced: this one would call every key equal.
+  ASSERT_EQ(sr_i_hash_table_open(
+                7, nullptr, [](const void *, const void *) { return 0; }, &p_table),
+            0);
+  EXPECT_EQ(p_table->total_hash_buckets, 16384u);
+  const qv_resource_handle_t first{1, {10, 20, 30, 0x00012345}};
+  const qv_resource_handle_t second{1, {11, 20, 30, 0xabcde345}};
+  const qv_resource_handle_t first_copy = first;
+  uint32_t first_bucket = 0, second_bucket = 0;
+  sr_hash_table_element_t *p_first = nullptr, *p_second = nullptr, *p_found = nullptr;
+  ASSERT_EQ(sr_i_hash_table_add(p_table, &first, 0, &first_bucket, &p_first, SR_PRIMARY_KEY), 0);
+  ASSERT_EQ(sr_i_hash_table_add(p_table, &second, 1, &second_bucket, &p_second, SR_PRIMARY_KEY), 0);
+  EXPECT_EQ(first_bucket, 0x2345u);
+  EXPECT_EQ(second_bucket, 0x2345u);
+  EXPECT_EQ(sr_i_hash_table_add(p_table, &first_copy, 2, &second_bucket, &p_found, SR_PRIMARY_KEY),
+            SR_E_DUPLICATE_KEY);
+  EXPECT_EQ(p_found, p_first);
+  EXPECT_EQ(row_for(p_table, &first_copy), 0);
+  EXPECT_EQ(row_for(p_table, &second), 1);
+  EXPECT_EQ(sr_i_hash_table_close(p_table), 0);
+}
+
+// Random adds under both qualifiers, removals by element and by key, and
+// lookups, against a multimap whose equal keys keep their insertion order.
+TEST_F(ClientHashTable, RandomOperationsAgreeWithAMultimap) {
+  struct entry {
+    uint32_t row, bucket;
+    sr_hash_table_element_t *p_element;
+  };
+  std::multimap<uint32_t, entry> model;
+  uint32_t keys[4000];
+  std::mt19937 random(20240517);
+  for (uint32_t row = 0; row < 4000; ++row) {
+    keys[row] = random() % 40;
+    const uint32_t key = keys[row];
+    const auto [begin, end] = model.equal_range(key);
+    switch (random() % 4) {
+      case 0:
+      case 1: {
+        const bool check = random() % 2 == 0;
+        const int32_t rc = add(keys[row], row, check ? SR_PRIMARY_KEY : SR_PRIMARY_KEY_NOCHECK);
+        if (check && begin != end) {
+          ASSERT_EQ(rc, SR_E_DUPLICATE_KEY);
+          ASSERT_EQ(p_element, std::prev(end)->second.p_element);
+        } else {
+          ASSERT_EQ(rc, 0);
+          ASSERT_EQ(bucket, key % Buckets);
+          model.insert(end, {key, entry{row, bucket, p_element}});
+        }
+        break;
+      }
+      case 2:
+        if (begin == end) {
+          ASSERT_EQ(sr_i_hash_table_remove(p_table, &key), SR_E_NO_ROW_FOR_KEY);
+        } else {  // an arbitrary one of the equal keys, by identity
+          auto victim = std::next(begin, random() % std::distance(begin, end));
+          ASSERT_EQ(sr_i_hash_table_remove_element(p_table, victim->second.bucket,
+                                                   victim->second.p_element),
+                    0);
+          model.erase(victim);
+        }
+        break;
+      default:
+        if (begin != end) {
+          ASSERT_EQ(sr_i_hash_table_remove(p_table, &key), 0);
+          model.erase(std::prev(end));
+        }
+    }
+    for (uint32_t probe = 0; probe < 40; ++probe) {
+      const auto [first, last] = model.equal_range(probe);
+      const int64_t newest_row = first == last ? int64_t{-1} : int64_t{std::prev(last)->second.row};
+      ASSERT_EQ(row_for(p_table, probe), newest_row);
+    }
+  }
+}
+
+}  // namespace

@@ -1,0 +1,340 @@
+// The record buffer pool: byte counts, block growth, splitting and merging,
+// the raised failures, and copying a pool with its address map. The
+// randomized cases walk every block after each step and check the whole
+// structure against a model of the live records and their contents.
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstring>
+#include <map>
+#include <random>
+#include <set>
+#include <vector>
+
+#include "qv_sr.h"
+#include "sr_i_record_buffer_pool.h"
+
+namespace {
+
+int32_t last_error_code() {
+  cu_error_t *p_error = nullptr;
+  EXPECT_EQ(cu_get_error_1(&p_error), 0);
+  const int32_t code = p_error->code;
+  cu_rel_error_1(p_error);
+  return code;
+}
+
+uint32_t page_size() {
+  return static_cast<uint32_t>(sysconf(_SC_PAGESIZE));
+}
+
+uintptr_t address(const void *p) {
+  return reinterpret_cast<uintptr_t>(p);
+}
+
+// A live record as the model knows it: the length asked for and the seed of
+// the bytes written into it.
+struct live_record {
+  uint32_t length;
+  uint8_t seed;
+};
+using model_t = std::map<void *, live_record>;
+
+void fill(void *p_data, live_record record) {
+  for (uint32_t at = 0; at < record.length; ++at) {
+    static_cast<uint8_t *>(p_data)[at] = static_cast<uint8_t>(record.seed + at);
+  }
+}
+
+bool holds_its_bytes(const void *p_data, live_record record) {
+  for (uint32_t at = 0; at < record.length; ++at) {
+    if (static_cast<const uint8_t *>(p_data)[at] != static_cast<uint8_t>(record.seed + at)) {
+      return false;
+    }
+  }
+  return true;
+}
+
+// Walks every block record by record and checks: the records fill each block
+// exactly; the live records are exactly the allocated ones, none lost, each
+// no more than 21 bytes longer than asked, with its bytes intact; the free
+// chain holds exactly the free records in ascending address order; no two
+// free records touch unless the second starts at one of `seams`; and both
+// byte counts agree with what the walk found.
+void check_pool(const sr_i_record_buffer_pool_t &pool, const model_t &live,
+                const std::set<uintptr_t> &seams = {}) {
+  uint64_t total_bytes = 0, used_bytes = 0;
+  std::vector<uintptr_t> free_records;
+  size_t allocated = 0;
+  const sr_i_record_buffer_t *p_last = nullptr;
+  for (const sr_i_record_buffer_t *p_block = pool.p_first_record_buffer; p_block != nullptr;
+       p_block = p_block->p_next) {
+    p_last = p_block;
+    total_bytes += p_block->total_bytes;
+    used_bytes += Sr_Record_Buffer_Header_Length;
+    const uintptr_t end = address(p_block) + p_block->total_bytes;
+    bool previous_free = false;
+    for (uintptr_t at = address(p_block->data); at != end;) {
+      auto *p_record = reinterpret_cast<sr_i_record_metadata_t *>(at);
+      ASSERT_GE(p_record->record_length, Sr_Record_Header_Length);
+      ASSERT_LE(at + p_record->record_length, end) << "a record runs past its block";
+      used_bytes += Sr_Record_Header_Length;
+      const uint32_t data_length = p_record->record_length - Sr_Record_Header_Length;
+      if (p_record->type == SR_I_RECORD_FREE) {
+        ASSERT_FALSE(previous_free && seams.count(at) == 0) << "free neighbours left unmerged";
+        free_records.push_back(at);
+      } else {
+        used_bytes += data_length;
+        ++allocated;
+        const auto found = live.find(sr_i_rb_record_data(p_record));
+        ASSERT_NE(found, live.end()) << "an allocated record the model does not know";
+        EXPECT_GE(data_length, found->second.length);
+        EXPECT_LT(data_length, found->second.length + Sr_Smallest_Split_Remainder);
+        EXPECT_TRUE(holds_its_bytes(found->first, found->second));
+      }
+      previous_free = p_record->type == SR_I_RECORD_FREE;
+      at += p_record->record_length;
+    }
+  }
+  EXPECT_EQ(pool.p_last_record_buffer, p_last);
+  EXPECT_EQ(allocated, live.size()) << "a live record was lost";
+  EXPECT_EQ(pool.total_bytes, total_bytes);
+  EXPECT_EQ(pool.used_bytes, used_bytes);
+  std::sort(free_records.begin(), free_records.end());
+  std::vector<uintptr_t> chain;
+  for (const sr_i_record_metadata_t *p = pool.p_free_chain; p != nullptr; p = p->p_next) {
+    ASSERT_LE(chain.size(), free_records.size()) << "the free chain runs on";
+    chain.push_back(address(p));
+  }
+  EXPECT_EQ(chain, free_records);
+}
+
+// The record first fit should choose for `length`, or null for a new block.
+void *first_fit(const sr_i_record_buffer_pool_t &pool, uint32_t length) {
+  for (sr_i_record_metadata_t *p = pool.p_free_chain; p != nullptr; p = p->p_next) {
+    if (p->record_length - Sr_Record_Header_Length >= length) {
+      return sr_i_rb_record_data(p);
+    }
+  }
+  return nullptr;
+}
+
+// Random reservations (now and then a large one) and frees, checked step
+// by step.
+void random_steps(sr_i_record_buffer_pool_t &pool, model_t &live, std::mt19937 &random, int steps,
+                  const std::set<uintptr_t> &seams = {}) {
+  for (int step = 0; step < steps; ++step) {
+    if (live.empty() || random() % 5 < 3) {
+      const uint32_t length = random() % 100 == 0 ? 65536 + random() % 5000 : random() % 300;
+      void *p_expected = first_fit(pool, length);
+      void *p_data = nullptr;
+      ASSERT_EQ(sr_i_reserve_record(&pool, length, SR_I_RECORD_ROW, &p_data), 0);
+      if (p_expected != nullptr) {
+        ASSERT_EQ(p_data, p_expected) << "not the first fit";
+      } else {
+        ASSERT_EQ(p_data, pool.p_last_record_buffer->data + Sr_Record_Header_Length);
+      }
+      const uint32_t data_area = sr_i_rb_record_header(p_data)->record_length - 20;
+      const auto *p_bytes = static_cast<const uint8_t *>(p_data);
+      ASSERT_TRUE(std::all_of(p_bytes, p_bytes + data_area, [](uint8_t b) { return b == 0; }))
+          << "reused data not cleared";
+      live[p_data] = {length, static_cast<uint8_t>(random())};
+      fill(p_data, live[p_data]);
+    } else {
+      auto victim = std::next(live.begin(), random() % live.size());
+      ASSERT_EQ(sr_i_rb_free_record(&pool, victim->first), 0);
+      live.erase(victim);
+    }
+    ASSERT_NO_FATAL_FAILURE(check_pool(pool, live, seams)) << "after step " << step;
+  }
+}
+
+TEST(RecordBufferPool, FirstRequestCountsBytesExactly) {
+  const uint32_t page = page_size(), data_area = page - 32;
+  struct {
+    uint32_t pages, length, total_bytes, used_bytes, free_record_length;
+  } const cases[] = {
+      {0, 10, 1032, 62, 990},  // a hundredfold block, the rest stays free
+      {0, 0, 32, 32, 0},
+      {0, 65535, 6553532, 32 + 65535 + 20, 6553532 - 12 - 65535 - 20},
+      {0, 65536, 65568, 32 + 65536, 0},                   // a large request gets its own size
+      {1, data_area - 21, page, 32 + data_area, 0},       // 21 bytes over: taken whole
+      {1, data_area - 22, page, 32 + data_area - 2, 22},  // 22 over: split
+      {3, 0, 3 * page, 52, 3 * page - 32},
+  };
+  for (const auto &c : cases) {
+    sr_i_record_buffer_pool_t pool{};
+    ASSERT_EQ(sr_i_rb_initialize_record_buffer_pool(c.pages, &pool), 0);
+    void *p_data = nullptr;
+    ASSERT_EQ(sr_i_reserve_record(&pool, c.length, SR_I_RECORD_METADATA, &p_data), 0);
+    EXPECT_EQ(sr_i_rb_record_header(p_data)->type, SR_I_RECORD_METADATA);
+    EXPECT_EQ(pool.total_bytes, c.total_bytes) << c.length;
+    EXPECT_EQ(pool.used_bytes, c.used_bytes) << c.length;
+    EXPECT_EQ(pool.p_free_chain == nullptr ? 0 : pool.p_free_chain->record_length,
+              c.free_record_length)
+        << c.length;
+    fill(p_data, {c.length, 1});
+    check_pool(pool, {{p_data, {c.length, 1}}});
+    sr_i_rb_uninitialize_record_buffer_pool(&pool);
+    EXPECT_EQ(pool.total_bytes + pool.used_bytes, 0u);
+    EXPECT_EQ(pool.p_first_record_buffer, nullptr);
+  }
+}
+
+TEST(RecordBufferPool, FreedNeighboursMergeAndGiveBackOneHeader) {
+  // Records A, B, C (10, 20 and 30 data bytes) then a guard D of 5, so that
+  // only the freed records can merge with each other.
+  struct {
+    std::vector<int> frees;
+    uint32_t used_bytes_drop;
+    std::vector<uint32_t> free_lengths;  // the chain before the block's rest
+  } const cases[] = {
+      {{0, 1}, 10 + 20 + 20, {70}},  // merges with the record below
+      {{1, 0}, 10 + 20 + 20, {70}},  // merges with the record above
+      {{0, 2, 1}, 60 + 40, {120}},   // one record joins both neighbours
+      {{2, 0}, 40, {30, 50}},        // not neighbours: no merge
+  };
+  for (const auto &c : cases) {
+    sr_i_record_buffer_pool_t pool{};
+    ASSERT_EQ(sr_i_rb_initialize_record_buffer_pool(1, &pool), 0);
+    void *p_records[4];
+    model_t live;
+    for (const uint32_t at : {0u, 1u, 2u, 3u}) {
+      const uint32_t length = at == 3 ? 5 : 10 * (at + 1);
+      ASSERT_EQ(sr_i_reserve_record(&pool, length, SR_I_RECORD_ROW, &p_records[at]), 0);
+      fill(p_records[at], live[p_records[at]] = {length, static_cast<uint8_t>(at)});
+    }
+    const uint32_t used_before = pool.used_bytes;
+    for (const int at : c.frees) {
+      ASSERT_EQ(sr_i_rb_free_record(&pool, p_records[at]), 0);
+      live.erase(p_records[at]);
+    }
+    EXPECT_EQ(used_before - pool.used_bytes, c.used_bytes_drop);
+    std::vector<uint32_t> free_lengths;
+    for (const sr_i_record_metadata_t *p = pool.p_free_chain; p->p_next != nullptr; p = p->p_next) {
+      free_lengths.push_back(p->record_length);
+    }
+    EXPECT_EQ(free_lengths, c.free_lengths);
+    check_pool(pool, live);
+    sr_i_rb_uninitialize_record_buffer_pool(&pool);
+  }
+}
+
+TEST(RecordBufferPool, RaisesAndLeavesThePoolAsItWas) {
+  sr_i_record_buffer_pool_t pool{};
+  ASSERT_EQ(sr_i_rb_initialize_record_buffer_pool(1, &pool), 0);
+  void *p_data = nullptr;
+  sr_i_record_metadata_t *p_previous = nullptr;
+  uint32_t actual = 0;
+  ASSERT_EQ(sr_i_rb_find_suitable_record(&pool, 100, &p_data, &p_previous, &actual), 0);
+  const sr_i_record_buffer_pool_t before = pool;
+
+  EXPECT_EQ(sr_i_rb_allocate_record(&pool, p_data, p_previous, actual + 1, 2), 15);
+  EXPECT_EQ(last_error_code(), 15);
+  sr_i_record_metadata_t *p_wrong_previous = sr_i_rb_record_header(p_data);
+  EXPECT_EQ(sr_i_rb_allocate_record(&pool, p_data, p_wrong_previous, 100, 2), 15);
+  // Blocks whose size does not fit the 32-bit counts cannot be had.
+  EXPECT_EQ(sr_i_reserve_record(&pool, UINT32_MAX - 16, 2, &p_data), 12);
+  EXPECT_EQ(last_error_code(), 12);
+  EXPECT_EQ(sr_i_rb_initialize_record_buffer_pool(UINT32_MAX, &pool), 12);
+
+  EXPECT_EQ(std::memcmp(&pool, &before, sizeof pool), 0);
+  check_pool(pool, {});
+  sr_i_rb_uninitialize_record_buffer_pool(&pool);
+}
+
+TEST(RecordBufferPool, RandomAllocationsAndFreesKeepThePoolConsistent) {
+  for (const uint32_t pages : {0u, 2u}) {
+    sr_i_record_buffer_pool_t pool{};
+    ASSERT_EQ(sr_i_rb_initialize_record_buffer_pool(pages, &pool), 0);
+    std::mt19937 random(pages + 7);
+    model_t live;
+    ASSERT_NO_FATAL_FAILURE(random_steps(pool, live, random, 1500));
+    for (const auto &[p_data, record] : live) {
+      ASSERT_EQ(sr_i_rb_free_record(&pool, p_data), 0);
+    }
+    live.clear();
+    check_pool(pool, live);  // every block is one free record again
+    sr_i_rb_uninitialize_record_buffer_pool(&pool);
+  }
+}
+
+TEST(RecordBufferPool, DuplicateCopiesEveryRecordIntoOneBlock) {
+  sr_i_record_buffer_pool_t source{};
+  std::mt19937 random(11);
+  model_t live;
+  ASSERT_NO_FATAL_FAILURE(random_steps(source, live, random, 800));
+  uint32_t blocks = 0;
+  for (auto *p = source.p_first_record_buffer; p != nullptr; p = p->p_next) {
+    ++blocks;
+  }
+  ASSERT_GE(blocks, 3u);
+
+  sr_i_record_buffer_pool_t copy{};
+  sr_i_record_buffer_pool_duplication_map_t *p_map = nullptr;
+  ASSERT_EQ(sr_i_rb_duplicate_record_buffer_pool(&source, &copy, &p_map), 0);
+  ASSERT_EQ(p_map->total, blocks);
+  EXPECT_EQ(copy.total_bytes, source.total_bytes - 12 * blocks + 12);
+  EXPECT_EQ(copy.used_bytes, source.used_bytes - 12 * blocks + 12);
+  ASSERT_EQ(copy.p_first_record_buffer, copy.p_last_record_buffer);
+  EXPECT_EQ(copy.p_first_record_buffer->p_next, nullptr);
+
+  model_t copied;
+  for (const auto &[p_data, record] : live) {
+    void *p_copy = sr_i_rb_map_duplicated_address(p_map, p_data);
+    ASSERT_NE(p_copy, nullptr);
+    EXPECT_EQ(sr_i_rb_record_header(p_copy)->type, SR_I_RECORD_ROW);
+    copied[p_copy] = record;
+  }
+  std::set<uintptr_t> seams;
+  for (uint32_t at = 1; at < p_map->total; ++at) {
+    seams.insert(address(sr_i_rb_map_duplicated_address(p_map, p_map->p_begin[at])));
+  }
+  // Every record, its bytes and the relinked free chain, in one walk.
+  ASSERT_NO_FATAL_FAILURE(check_pool(copy, copied, seams));
+  const int outside = 0;
+  EXPECT_EQ(sr_i_rb_map_duplicated_address(p_map, &outside), nullptr);
+  EXPECT_EQ(sr_i_rb_map_duplicated_address(p_map, p_map->p_end[0]), nullptr);
+
+  // The copy works as a pool of its own, and the source is untouched.
+  ASSERT_NO_FATAL_FAILURE(random_steps(copy, copied, random, 300, seams));
+  ASSERT_NO_FATAL_FAILURE(check_pool(source, live));
+  sr_i_rb_free_duplication_map(p_map);
+  sr_i_rb_uninitialize_record_buffer_pool(&copy);
+  sr_i_rb_uninitialize_record_buffer_pool(&source);
+}
+
+TEST(RecordBufferPool, MapsIntoACopyFarFromItsSource) {
+  // A copy this large is given its own memory mapping, usually gigabytes
+  // away from the small heap block it copies.
+  sr_i_record_buffer_pool_t source{}, copy{};
+  ASSERT_EQ(sr_i_rb_initialize_record_buffer_pool(1, &source), 0);
+  void *p_small = nullptr, *p_large = nullptr;
+  ASSERT_EQ(sr_i_reserve_record(&source, 100, SR_I_RECORD_ROW, &p_small), 0);
+  fill(p_small, {100, 9});
+  ASSERT_EQ(sr_i_reserve_record(&source, 64u << 20, SR_I_RECORD_ROW, &p_large), 0);
+  ASSERT_EQ(sr_i_rb_free_record(&source, p_large), 0);
+  sr_i_record_buffer_pool_duplication_map_t *p_map = nullptr;
+  ASSERT_EQ(sr_i_rb_duplicate_record_buffer_pool(&source, &copy, &p_map), 0);
+  void *p_copy = sr_i_rb_map_duplicated_address(p_map, p_small);
+  const uintptr_t copy_begin = address(copy.p_first_record_buffer->data);
+  ASSERT_GE(address(p_copy), copy_begin);
+  ASSERT_LT(address(p_copy), copy_begin + copy.total_bytes - 12);
+  EXPECT_TRUE(holds_its_bytes(p_copy, {100, 9}));
+  sr_i_rb_free_duplication_map(p_map);
+  sr_i_rb_uninitialize_record_buffer_pool(&copy);
+  sr_i_rb_uninitialize_record_buffer_pool(&source);
+}
+
+TEST(RecordBufferPool, DuplicatingAPoolWithoutBlocksGivesAnEmptyPool) {
+  sr_i_record_buffer_pool_t source{}, copy{};
+  sr_i_record_buffer_pool_duplication_map_t *p_map = nullptr;
+  ASSERT_EQ(sr_i_rb_duplicate_record_buffer_pool(&source, &copy, &p_map), 0);
+  EXPECT_EQ(p_map->total, 0u);
+  EXPECT_EQ(std::memcmp(&copy, &source, sizeof copy), 0);
+  sr_i_rb_free_duplication_map(p_map);
+}
+
+}  // namespace

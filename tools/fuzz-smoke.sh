@@ -10,7 +10,7 @@ if ! command -v clang++ >/dev/null 2>&1; then
 fi
 seconds=${FUZZ_SECONDS:-20}
 cmake --preset fuzz >/dev/null
-cmake --build build-fuzz -j"$(nproc)"
+cmake --build build-fuzz -j"$(nproc)" --target fuzz_all
 shopt -s nullglob
 targets=(build-fuzz/fuzz/fuzz_*)
 if [ ${#targets[@]} -eq 0 ]; then

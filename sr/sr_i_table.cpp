@@ -14,6 +14,7 @@
 #include <cstring>
 #include <new>
 
+#include "sr_i_application_metadata.h"
 #include "sr_i_errors.h"
 #include "sr_i_hash_table.h"
 
@@ -40,17 +41,22 @@ void free_change_list(sr_i_change_entry_t *p_entry) {
 
 }  // namespace
 
-sr_i_table_t *sr_i_new_table() {
+sr_i_table_t *sr_i_create_null_table() {
   auto *p_table = static_cast<sr_i_table_t *>(std::calloc(1, sizeof(sr_i_table_t)));
   if (p_table == nullptr) {
     sr_i_raise_no_memory();
     return nullptr;
   }
+  p_table->references = 1;
+  p_table->implicitly_controlled = 1;
   p_table->change_counter = 1;
-  p_table->applied_change_counter = 1;
   p_table->file_fd = -1;
   p_table->rewrite_file_fd = -1;
+  // Read each time a table object is made, so a program may switch it
+  // between tables; set to anything, even "", it is on.
+  p_table->uncommitted_updates_visible = std::getenv("SR_UNCOMMITTED_UPDATES_VISIBLE") ? 1 : 0;
   sr_i_rw_open(&p_table->lock);
+  sr_i_rb_initialize_record_buffer_pool(0, &p_table->record_buffer_pool);
   return p_table;
 }
 
@@ -67,6 +73,7 @@ void sr_i_close_table(sr_i_table_t *p_table) {
   std::free(p_table->p_name);
   std::free(p_table->p_file_path);
   std::free(p_table->p_persistent_table_registry_path);
+  sr_i_free_application_metadata(p_table->p_application_metadata);
   std::free(p_table);
 }
 

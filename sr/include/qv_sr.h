@@ -194,6 +194,72 @@ QV_SR_EXPORT int32_t sr_open_tree_1(sr_opaque_handle_t *tree_handle, uint32_t nu
  */
 QV_SR_EXPORT int32_t sr_close_tree_1(sr_opaque_handle_t tree_handle);
 
+/* ---- Tables ------------------------------------------------------------ */
+
+/*
+ * Creates the table `p_registry_path` with the `array_count` columns of
+ * `p_columns` and stores a handle in *p_result_table_handle (close it with
+ * sr_close_table_1). Exactly one column is the key (base qualifier
+ * SR_PRIMARY_KEY or SR_PRIMARY_KEY_NOCHECK, of a numeric type, QV_CHAR_PTR
+ * or QV_RSRC_HANDLE_PTR); it becomes column 0 of the table. The caller's
+ * array is not changed. `mode` 0 to 7: bit 4 makes the table explicitly
+ * controlled (the caller applies and commits); otherwise every change is
+ * applied and committed before its call returns. The table is always open
+ * for writing. A table whose key is a resource handle gets a key hash table.
+ * Returns 0; SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_INVALID_MODE;
+ * SR_E_INVALID_PATH; SR_E_NO_COLUMNS; SR_E_INVALID_COLUMN (a name, type,
+ * qualifier, missing structured-data definition or key type); SR_E_KEY_EXPECTED
+ * (no key); SR_E_DUPLICATE_KEY (two keys); SR_E_DUPLICATE_COLUMN;
+ * SR_E_TABLE_EXISTS; SR_E_LIBRARY_CALL (a default value cannot be encoded);
+ * SR_E_NO_MEMORY; SR_E_INTERNAL in a forked child, or for a path below a
+ * mount point (persistent tables are not supported by this release).
+ */
+QV_SR_EXPORT int32_t sr_create_table_1(sr_opaque_handle_t tree_handle, const char *p_registry_path,
+                                       sr_column_t *p_columns, uint32_t array_count, int32_t mode,
+                                       sr_opaque_handle_t *p_result_table_handle);
+
+/*
+ * As sr_create_table_1, with a key hash table of `total_hash_buckets`
+ * buckets, hashed by `p_hash_function` and compared by `p_compare_function`.
+ * SR_E_NULL_POINTER when the bucket count is 0 or a function is null.
+ */
+QV_SR_EXPORT int32_t sr_create_hashed_key_table_1(
+    sr_opaque_handle_t tree_handle, const char *p_registry_path, sr_column_t *p_columns,
+    uint32_t array_count, int32_t mode, uint32_t total_hash_buckets,
+    sr_hash_function_t p_hash_function, sr_hash_keys_compare_function_t p_compare_function,
+    sr_opaque_handle_t *p_result_table_handle);
+
+/*
+ * Opens the table `p_registry_path` of the tree. Every opening of a table
+ * in a tree shares one object. `mode`: 1 read only; 2 or 3 writable and
+ * implicitly controlled; 6 or 7 writable and explicitly controlled. The
+ * first writable opening decides the control kind; a writable opening of
+ * the other kind while it is open is refused. A read-only table opened for
+ * writing becomes writable for every handle.
+ * Returns 0; SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_INVALID_MODE;
+ * SR_E_INVALID_PATH; SR_E_NO_TABLE; SR_E_EXCLUSIVE_MODES; SR_E_INTERNAL for a
+ * path below a mount point (not supported by this release).
+ */
+QV_SR_EXPORT int32_t sr_open_table_1(sr_opaque_handle_t tree_handle, const char *p_registry_path,
+                                     int32_t mode, sr_opaque_handle_t *p_result_table_handle);
+
+/* As sr_open_table_1; the hash settings (checked as for
+ * sr_create_hashed_key_table_1) serve a table loaded from its file, while a
+ * table already in memory keeps its own. */
+QV_SR_EXPORT int32_t sr_open_hashed_key_table_1(sr_opaque_handle_t tree_handle,
+                                                const char *p_registry_path, int32_t mode,
+                                                uint32_t total_hash_buckets,
+                                                sr_hash_function_t p_hash_function,
+                                                sr_hash_keys_compare_function_t p_compare_function,
+                                                sr_opaque_handle_t *p_result_table_handle);
+
+/*
+ * Gives a handle back. A transient table keeps its rows in the tree after
+ * its last handle is closed and can be opened again; a result table without
+ * a name is freed at once. Returns 0 or SR_E_INVALID_HANDLE.
+ */
+QV_SR_EXPORT int32_t sr_close_table_1(sr_opaque_handle_t table_handle);
+
 /* ---- Mount points ------------------------------------------------------ */
 
 /*
@@ -225,6 +291,41 @@ QV_SR_EXPORT int32_t sr_mount_local_tree_1(sr_opaque_handle_t tree_handle,
  */
 QV_SR_EXPORT int32_t sr_unmount_local_tree_1(sr_opaque_handle_t tree_handle,
                                              const char *p_registry_path);
+
+/* ---- Application metadata --------------------------------------------- */
+
+/*
+ * A table carries one counted byte string of the application's own, changed
+ * like the table's rows: a set is seen by readers of uncommitted updates at
+ * once and by everyone after sr_commit_1; sr_abort_1 brings back the value
+ * last committed (or none). On an implicitly controlled table a set is
+ * committed before the call returns.
+ */
+
+/*
+ * Stores in *p_p_application_metadata a copy of the table's application
+ * metadata: the committed value, or the newest value when the table was
+ * opened with uncommitted updates visible. The copy is the caller's, one
+ * block freed with free(). *p_p_application_metadata is unchanged on failure.
+ * Returns 0; SR_E_INVALID_HANDLE for a null table handle; SR_E_NULL_POINTER
+ * for a null p_p_application_metadata; SR_E_NO_ROW_FOR_KEY when the table
+ * has no application metadata in that view (never set, or set and not yet
+ * committed); SR_E_NO_MEMORY; SR_E_SYSTEM_CALL when the table lock fails.
+ */
+QV_SR_EXPORT int32_t sr_get_application_metadata_1(sr_opaque_handle_t table_handle,
+                                                   qv_binary_t **p_p_application_metadata);
+
+/*
+ * Sets the table's application metadata to a copy of the `length` bytes of
+ * *p_application_metadata, replacing any earlier value; the caller keeps its
+ * block. Allowed while the table has applied but uncommitted updates.
+ * Returns 0; SR_E_INVALID_HANDLE for a null table handle; SR_E_NULL_POINTER
+ * for a null p_application_metadata; SR_E_ACCESS when the table was opened
+ * for reading only; SR_E_NO_MEMORY (the table is unchanged);
+ * SR_E_SYSTEM_CALL when the table lock fails; SR_E_INTERNAL in a forked child.
+ */
+QV_SR_EXPORT int32_t sr_set_application_metadata_1(sr_opaque_handle_t table_handle,
+                                                   const qv_binary_t *p_application_metadata);
 
 #ifdef __cplusplus
 }

@@ -109,11 +109,13 @@ typedef struct sr_i_table_struct_t {
 } sr_i_table_t;
 
 /*
- * A new table object with nothing in it: no name, no columns, no index, an
- * empty pool, change counters at 1, no files (descriptors -1), its lock
- * open. Null when memory runs out (12 raised). Free it with sr_i_close_table.
+ * The null table every table object starts from: one reference, implicitly
+ * controlled, change counter 1, no name, columns, index or files
+ * (descriptors -1), an empty pool, its lock open, and uncommitted updates
+ * visible when SR_UNCOMMITTED_UPDATES_VISIBLE is set in the environment.
+ * Null when memory runs out (12 raised). Free it with sr_i_close_table.
  */
-sr_i_table_t *sr_i_new_table();
+sr_i_table_t *sr_i_create_null_table();
 
 /* Frees the table and everything it owns, writing nothing: what is pending
  * or applied and not committed is dropped. Null is ignored. */

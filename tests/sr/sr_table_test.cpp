@@ -15,7 +15,7 @@ namespace {
 class TableObject : public ::testing::Test {
  protected:
   void SetUp() override {
-    p_table_ = sr_i_new_table();
+    p_table_ = sr_i_create_null_table();
     ASSERT_NE(p_table_, nullptr);
   }
   void TearDown() override { sr_i_close_table(p_table_); }

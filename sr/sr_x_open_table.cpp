@@ -1,0 +1,118 @@
+// sr_x_open_table.cpp - sr_open_table_1 and sr_open_hashed_key_table_1: a
+// handle on a table by its registry path. A named table exists once per
+// tree; every opening shares that object and counts a reference. The first
+// writable opening decides the control kind; later writable openings must
+// agree with it (211).
+
+#include "sr_i_frame.h"
+#include "sr_i_hash_table.h"
+#include "sr_i_paths.h"
+#include "sr_i_table.h"
+#include "sr_i_tree.h"
+
+namespace {
+
+constexpr sr_i_entry_point_t Open_Table{77, false};
+constexpr sr_i_entry_point_t Open_Hashed_Key_Table{79, false};
+
+constexpr int32_t Open_For_Reading = 1;
+constexpr int32_t Open_For_Writing = 2;
+constexpr int32_t Open_Explicit_Control = 4;
+
+// The accepted modes in their normal form (1, 2 or 6), or 0 for a refused one.
+int32_t normalised_open_mode(int32_t mode) {
+  switch (mode) {
+    case 1:
+      return Open_For_Reading;
+    case 2:
+    case 3:
+      return Open_For_Writing;
+    case 6:
+    case 7:
+      return Open_For_Writing | Open_Explicit_Control;
+    default:
+      return 0;
+  }
+}
+
+// Gives an open table the mode of a writable or read-only opening.
+void take_open_mode(sr_i_table_t *p_table, int32_t mode) {
+  p_table->implicitly_controlled = (mode & Open_Explicit_Control) ? 0 : 1;
+  p_table->mode = (mode & Open_For_Writing) ? Sr_Mode_Writable : Sr_Mode_Read_Only;
+}
+
+int32_t do_open_table(sr_opaque_handle_t tree_handle, const char *p_registry_path, int32_t mode,
+                      sr_opaque_handle_t *p_result_table_handle) {
+  if (tree_handle == nullptr) {
+    return sr_i_raise(SR_E_INVALID_HANDLE);
+  }
+  if (p_result_table_handle == nullptr) {
+    return sr_i_raise(SR_E_NULL_POINTER);
+  }
+  mode = normalised_open_mode(mode);
+  if (mode == 0) {
+    return sr_i_raise(SR_E_INVALID_MODE);
+  }
+  auto *p_tree = static_cast<sr_i_tree_t *>(tree_handle);
+  sr_i_write_guard tree_lock(&p_tree->lock);
+  if (tree_lock.result() != 0) {
+    return tree_lock.result();
+  }
+  std::string key;
+  uint32_t block_size = 0;
+  if (const int32_t rc = sr_i_resolve_path(p_tree, p_registry_path, key, block_size); rc != 0) {
+    return rc;
+  }
+  const auto found = p_tree->tables.find(key);
+  if (found == p_tree->tables.end()) {
+    // Persistent tables are loaded by the file layer, which this build does
+    // not have.
+    return block_size != 0 ? sr_i_raise_internal() : sr_i_raise(SR_E_NO_TABLE);
+  }
+  sr_i_table_t *p_table = found->second;
+  sr_i_write_guard table_lock(&p_table->lock);
+  if (table_lock.result() != 0) {
+    return table_lock.result();
+  }
+  ++p_table->references;
+  const bool writing = (mode & Open_For_Writing) != 0;
+  if (p_table->references == 1) {
+    take_open_mode(p_table, mode);  // present in the tree but not open
+  } else if (writing && p_table->mode == Sr_Mode_Writable) {
+    const bool explicit_request = (mode & Open_Explicit_Control) != 0;
+    if (explicit_request == (p_table->implicitly_controlled != 0)) {
+      --p_table->references;
+      return sr_i_raise(SR_E_EXCLUSIVE_MODES);
+    }
+  } else if (writing) {
+    take_open_mode(p_table, mode);  // a read-only transient table turns writable
+  }
+  *p_result_table_handle = p_table;
+  return 0;
+}
+
+}  // namespace
+
+extern "C" int32_t sr_open_table_1(sr_opaque_handle_t tree_handle, const char *p_registry_path,
+                                   int32_t mode, sr_opaque_handle_t *p_result_table_handle) {
+  return sr_i_run_entry_point(Open_Table, [&] {
+    return do_open_table(tree_handle, p_registry_path, mode, p_result_table_handle);
+  });
+}
+
+extern "C" int32_t sr_open_hashed_key_table_1(sr_opaque_handle_t tree_handle,
+                                              const char *p_registry_path, int32_t mode,
+                                              uint32_t total_hash_buckets,
+                                              sr_hash_function_t p_hash_function,
+                                              sr_hash_keys_compare_function_t p_compare_function,
+                                              sr_opaque_handle_t *p_result_table_handle) {
+  return sr_i_run_entry_point(Open_Hashed_Key_Table, [&]() -> int32_t {
+    if (total_hash_buckets == 0 || p_hash_function == nullptr || p_compare_function == nullptr) {
+      return sr_i_raise(SR_E_NULL_POINTER);
+    }
+    // A table already in memory keeps the hash table it was built with; the
+    // caller's settings would serve a table loaded now, which only the file
+    // layer does.
+    return do_open_table(tree_handle, p_registry_path, mode, p_result_table_handle);
+  });
+}

@@ -1,0 +1,268 @@
+// Creating, opening and closing transient tables through the exported
+// calls: column validation and its order, the key moved first without
+// touching the caller's array, defaults kept in the metadata record, modes,
+// shared objects and their references, and many threads at once.
+
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "qv_pmsg.h"
+#include "sr_i_hash_table.h"
+#include "sr_i_table.h"
+#include "sr_i_tree.h"
+
+namespace {
+
+sr_column_t column(const char *p_name, qv_data_type_t type, uint32_t qualifier) {
+  sr_column_t definition{};
+  definition.name = const_cast<char *>(p_name);
+  definition.type = type;
+  definition.qualifier = static_cast<sr_qualifier_t>(qualifier);
+  return definition;
+}
+
+class Tables : public ::testing::Test {
+ protected:
+  void SetUp() override { ASSERT_EQ(sr_open_tree_1(&tree_, 0, 0), 0); }
+  void TearDown() override { EXPECT_EQ(sr_close_tree_1(tree_), 0); }
+
+  int32_t create(const char *p_path, std::vector<sr_column_t> columns, int32_t mode = 0,
+                 sr_opaque_handle_t *p_table = nullptr) {
+    sr_opaque_handle_t table = nullptr;
+    return sr_create_table_1(tree_, p_path, columns.data(), static_cast<uint32_t>(columns.size()),
+                             mode, p_table ? p_table : &table);
+  }
+  static sr_i_table_t *object(sr_opaque_handle_t handle) {
+    return static_cast<sr_i_table_t *>(handle);
+  }
+
+  sr_opaque_handle_t tree_ = nullptr;
+};
+
+TEST_F(Tables, KeyColumnComesFirstAndTheCallersArrayIsUntouched) {
+  std::vector<sr_column_t> columns = {column("a", QV_INT32, SR_STANDARD),
+                                      column("k", QV_CHAR_PTR, SR_PRIMARY_KEY)};
+  const std::vector<sr_column_t> before = columns;
+  sr_opaque_handle_t table = nullptr;
+  ASSERT_EQ(sr_create_table_1(tree_, "/cfg/t", columns.data(), 2, 0, &table), 0);
+  EXPECT_STREQ(object(table)->p_columns[0].name, "k");
+  EXPECT_STREQ(object(table)->p_columns[1].name, "a");
+  EXPECT_EQ(std::memcmp(columns.data(), before.data(), sizeof(sr_column_t) * 2), 0);
+  // The failure path leaves it untouched too.
+  EXPECT_EQ(sr_create_table_1(tree_, "/cfg/t", columns.data(), 2, 0, &table), SR_E_TABLE_EXISTS);
+  EXPECT_EQ(std::memcmp(columns.data(), before.data(), sizeof(sr_column_t) * 2), 0);
+}
+
+TEST_F(Tables, EveryColumnIsCheckedBeforeTheKeysAreCounted) {
+  const std::string longest(255, 'n');
+  const std::string too_long(256, 'n');
+  struct refusal {
+    std::vector<sr_column_t> columns;
+    int32_t code;
+  } cases[] = {
+      {{}, SR_E_NO_COLUMNS},
+      {{column("k", QV_INT32, SR_PRIMARY_KEY), column("j", QV_INT32, SR_PRIMARY_KEY),
+        column("bad-name", QV_INT32, SR_STANDARD)},
+       SR_E_INVALID_COLUMN},
+      {{column("k", QV_INT32, SR_PRIMARY_KEY), column("j", QV_INT32, SR_PRIMARY_KEY_NOCHECK)},
+       SR_E_DUPLICATE_KEY},
+      {{column("a", QV_INT32, SR_STANDARD)}, SR_E_KEY_EXPECTED},
+      {{column("k", QV_INT32, SR_PRIMARY_KEY), column("k", QV_INT64, SR_STANDARD)},
+       SR_E_DUPLICATE_COLUMN},
+      {{column("k", QV_BINARY_PTR, SR_PRIMARY_KEY)}, SR_E_INVALID_COLUMN},
+      {{column("k", QV_SD_PTR, SR_PRIMARY_KEY)}, SR_E_INVALID_COLUMN},
+      {{column("k", QV_INT32, SR_PRIMARY_KEY), column("s", QV_SD_PTR, SR_STANDARD)},
+       SR_E_INVALID_COLUMN},
+      {{column("k", QV_INT32, SR_PRIMARY_KEY), column("n", QV_NONE, SR_STANDARD)},
+       SR_E_INVALID_COLUMN},
+      {{column("k", QV_INT32, SR_PRIMARY_KEY),
+        column("n", static_cast<qv_data_type_t>(23), SR_STANDARD)},
+       SR_E_INVALID_COLUMN},
+      {{column("k", QV_INT32, SR_SYSTEM)}, SR_E_INVALID_COLUMN},
+      {{column("k", QV_INT32, SR_PRIMARY_KEY), column(too_long.c_str(), QV_INT32, SR_STANDARD)},
+       SR_E_INVALID_COLUMN},
+      {{column("k", QV_INT32, SR_PRIMARY_KEY), column("9lives", QV_INT32, SR_STANDARD)},
+       SR_E_INVALID_COLUMN},
+      {{column("k", QV_INT32, SR_PRIMARY_KEY), column("_x", QV_INT32, SR_STANDARD)},
+       SR_E_INVALID_COLUMN},
+      {{column("k", QV_INT32, SR_PRIMARY_KEY), column("a b", QV_INT32, SR_STANDARD)},
+       SR_E_INVALID_COLUMN},
+  };
+  for (const refusal &refused : cases) {
+    EXPECT_EQ(create("/t", refused.columns), refused.code);
+  }
+  EXPECT_TRUE(static_cast<sr_i_tree_t *>(tree_)->tables.empty());
+  EXPECT_EQ(create("/t", {column("k", QV_INT32, SR_PRIMARY_KEY),
+                          column(longest.c_str(), QV_INT32, SR_STANDARD | SR_PROTECTED)}),
+            0);
+}
+
+TEST_F(Tables, DefinitionsAndDefaultsLiveInTheMetadataRecord) {
+  sr_sd_def_t *p_definition =
+      static_cast<sr_sd_def_t *>(std::malloc(sizeof(sr_sd_def_t) + 2 * sizeof(sr_sd_field_def_t)));
+  p_definition->number_of_fields = 2;
+  p_definition->field_def[0] = {QV_UINT32, const_cast<char *>("port")};
+  p_definition->field_def[1] = {QV_CHAR_PTR, const_cast<char *>("host")};
+  std::vector<sr_column_t> columns = {
+      column("k", QV_INT64, SR_PRIMARY_KEY),     column("name", QV_CHAR_PTR, SR_STANDARD),
+      column("empty", QV_CHAR_PTR, SR_STANDARD), column("count", QV_INT32, SR_STANDARD),
+      column("peer", QV_SD_PTR, SR_STANDARD),    column("plain", QV_INT32, SR_STANDARD)};
+  columns[1].default_value.ptr_char = const_cast<char *>("hello");
+  columns[3].default_value.val_int32 = -7;
+  columns[4].sd_defn = p_definition;
+  columns[5].sd_defn = p_definition;  // ignored for a column that is not structured
+  sr_opaque_handle_t handle = nullptr;
+  ASSERT_EQ(create("/defaults", columns, 0, &handle), 0);
+  std::free(p_definition);
+
+  const sr_i_table_t *p_table = object(handle);
+  ASSERT_EQ(p_table->total_columns, 6u);
+  EXPECT_EQ(p_table->total_variable_length_columns, 3u);
+  EXPECT_EQ(p_table->p_columns[3].default_value.val_int32, -7);
+  EXPECT_EQ(p_table->p_columns[5].sd_defn, nullptr);
+  // The packed structured-data definition: count, then type and name.
+  const auto *p_packed = reinterpret_cast<const unsigned char *>(p_table->p_columns[4].sd_defn);
+  uint32_t words[2];
+  std::memcpy(words, p_packed, sizeof words);
+  EXPECT_EQ(words[0], 2u);
+  EXPECT_EQ(words[1], static_cast<uint32_t>(QV_UINT32));
+  EXPECT_STREQ(reinterpret_cast<const char *>(p_packed + 8), "port");
+  // Variable-length defaults decode from their anchors behind the columns.
+  const void *p_defaults = p_table->p_columns + p_table->total_columns;
+  for (const auto &[position, expected] : {std::pair{1, "hello"}, std::pair{2, ""}}) {
+    qv_value_t value{};
+    qv_pmsg_value_t slot;
+    std::memcpy(&slot, &p_table->p_columns[position].default_value, sizeof slot);
+    ASSERT_EQ(qv_pmsg_build_conv_packed_client_value_1(nullptr, 0, QV_CHAR_PTR, &value, &slot,
+                                                       p_defaults, 0xFFFFFFFFu),
+              0);
+    EXPECT_STREQ(value.ptr_char, expected);
+    std::free(value.ptr_char);
+  }
+}
+
+TEST_F(Tables, ModesDecideControlAndAreAlwaysWritable) {
+  sr_opaque_handle_t implicit = nullptr, explicit_table = nullptr;
+  EXPECT_EQ(create("/m8", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 8), SR_E_INVALID_MODE);
+  EXPECT_EQ(create("/m-1", {column("k", QV_INT32, SR_PRIMARY_KEY)}, -1), SR_E_INVALID_MODE);
+  ASSERT_EQ(create("/m1", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 1, &implicit), 0);
+  ASSERT_EQ(create("/m5", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 5, &explicit_table), 0);
+  EXPECT_EQ(object(implicit)->mode, Sr_Mode_Writable);
+  EXPECT_EQ(object(implicit)->implicitly_controlled, 1u);
+  EXPECT_EQ(object(explicit_table)->mode, Sr_Mode_Writable);
+  EXPECT_EQ(object(explicit_table)->implicitly_controlled, 0u);
+}
+
+TEST_F(Tables, ResourceHandleKeysGetTheBuiltInHashTable) {
+  sr_opaque_handle_t handle_keyed = nullptr, int_keyed = nullptr;
+  ASSERT_EQ(create("/h", {column("k", QV_RSRC_HANDLE_PTR, SR_PRIMARY_KEY)}, 0, &handle_keyed), 0);
+  ASSERT_EQ(create("/i", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 0, &int_keyed), 0);
+  EXPECT_NE(object(handle_keyed)->p_rows_hash_table, nullptr);
+  EXPECT_EQ(object(int_keyed)->p_rows_hash_table, nullptr);
+  sr_column_t key = column("k", QV_INT32, SR_PRIMARY_KEY);
+  sr_opaque_handle_t table = nullptr;
+  const auto hash = [](const void *) -> uint32_t { return 0; };
+  const auto compare = [](const void *, const void *) -> int32_t { return 0; };
+  EXPECT_EQ(sr_create_hashed_key_table_1(tree_, "/x", &key, 1, 0, 0, hash, compare, &table),
+            SR_E_NULL_POINTER);
+  EXPECT_EQ(sr_create_hashed_key_table_1(tree_, "/x", &key, 1, 0, 8, nullptr, compare, &table),
+            SR_E_NULL_POINTER);
+  ASSERT_EQ(sr_create_hashed_key_table_1(tree_, "/x", &key, 1, 0, 8, hash, compare, &table), 0);
+  EXPECT_EQ(object(table)->p_rows_hash_table->total_hash_buckets, 8u);
+}
+
+TEST_F(Tables, UncommittedVisibilityFollowsTheEnvironment) {
+  setenv("SR_UNCOMMITTED_UPDATES_VISIBLE", "", 1);
+  sr_opaque_handle_t visible = nullptr, hidden = nullptr;
+  ASSERT_EQ(create("/v", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 0, &visible), 0);
+  unsetenv("SR_UNCOMMITTED_UPDATES_VISIBLE");
+  ASSERT_EQ(create("/h", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 0, &hidden), 0);
+  EXPECT_EQ(object(visible)->uncommitted_updates_visible, 1u);
+  EXPECT_EQ(object(hidden)->uncommitted_updates_visible, 0u);
+}
+
+TEST_F(Tables, PathsBelowAMountPointAreRefusedWithoutWritingAFile) {
+  const auto directory =
+      std::filesystem::temp_directory_path() / ("sr_create_" + std::to_string(getpid()));
+  ASSERT_EQ(sr_mount_local_tree_1(tree_, "/disk", directory.c_str(), 0), 0);
+  EXPECT_EQ(create("/disk/t", {column("k", QV_INT32, SR_PRIMARY_KEY)}), SR_E_INTERNAL);
+  EXPECT_TRUE(std::filesystem::is_empty(directory));
+  // A transient table's own path cannot become a mount point.
+  ASSERT_EQ(create("/cfg", {column("k", QV_INT32, SR_PRIMARY_KEY)}), 0);
+  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/cfg", directory.c_str(), 0), SR_E_TABLE_EXISTS);
+  std::filesystem::remove_all(directory);
+}
+
+TEST_F(Tables, OpeningSharesOneObjectAndControlKindsMustAgree) {
+  sr_opaque_handle_t created = nullptr, first = nullptr, second = nullptr, other = nullptr;
+  ASSERT_EQ(create("/shared", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 0, &created), 0);
+  EXPECT_EQ(sr_open_table_1(tree_, "/missing", 2, &other), SR_E_NO_TABLE);
+  for (int32_t refused : {0, 4, 5, 8, -1}) {
+    EXPECT_EQ(sr_open_table_1(tree_, "/shared", refused, &other), SR_E_INVALID_MODE) << refused;
+  }
+  ASSERT_EQ(sr_open_table_1(tree_, "/shared", 2, &first), 0);
+  ASSERT_EQ(sr_open_table_1(tree_, "/shared", 3, &second), 0);
+  EXPECT_EQ(first, created);
+  EXPECT_EQ(second, created);
+  EXPECT_EQ(object(created)->references, 3u);
+  EXPECT_EQ(sr_open_table_1(tree_, "/shared", 6, &other), SR_E_EXCLUSIVE_MODES);
+  EXPECT_EQ(object(created)->references, 3u);
+  ASSERT_EQ(sr_open_table_1(tree_, "/shared", 1, &other), 0);  // reading is always allowed
+  for (sr_opaque_handle_t handle : {created, first, second, other}) {
+    EXPECT_EQ(sr_close_table_1(handle), 0);
+  }
+  // Closed but kept: the next opening starts afresh and may choose anew.
+  EXPECT_EQ(object(created)->references, 0u);
+  ASSERT_EQ(sr_open_table_1(tree_, "/shared", 1, &first), 0);
+  EXPECT_EQ(first, created);
+  EXPECT_EQ(object(first)->mode, Sr_Mode_Read_Only);
+  ASSERT_EQ(sr_open_table_1(tree_, "/shared", 6, &second), 0);
+  EXPECT_EQ(object(first)->mode, Sr_Mode_Writable);  // both handles now write
+  EXPECT_EQ(object(first)->implicitly_controlled, 0u);
+  EXPECT_EQ(sr_close_table_1(nullptr), SR_E_INVALID_HANDLE);
+}
+
+TEST_F(Tables, ManyThreadsCreateOpenAndCloseTablesOfOneTree) {
+  constexpr int Threads = 4;
+  constexpr int Rounds = 100;
+  std::atomic<int> failures{0};
+  std::vector<std::thread> threads;
+  for (int thread = 0; thread < Threads; ++thread) {
+    threads.emplace_back([&, thread] {
+      for (int round = 0; round < Rounds; ++round) {
+        const std::string own = "/t" + std::to_string(thread) + "_" + std::to_string(round);
+        sr_column_t key = column("k", QV_INT32, SR_PRIMARY_KEY);
+        sr_opaque_handle_t created = nullptr, opened = nullptr, common = nullptr;
+        if (sr_create_table_1(tree_, own.c_str(), &key, 1, 0, &created) != 0 ||
+            sr_open_table_1(tree_, own.c_str(), 1, &opened) != 0 || opened != created ||
+            sr_close_table_1(opened) != 0 || sr_close_table_1(created) != 0) {
+          ++failures;
+        }
+        // All threads race for one path: exactly one creates it each round.
+        const std::string shared = "/common" + std::to_string(round);
+        const int32_t rc = sr_create_table_1(tree_, shared.c_str(), &key, 1, 0, &common);
+        if (rc != 0 && rc != SR_E_TABLE_EXISTS) {
+          ++failures;
+        }
+        if (sr_open_table_1(tree_, shared.c_str(), 2, &common) != 0 ||
+            sr_close_table_1(common) != 0) {
+          ++failures;
+        }
+      }
+    });
+  }
+  for (std::thread &thread : threads) {
+    thread.join();
+  }
+  EXPECT_EQ(failures, 0);
+  EXPECT_EQ(static_cast<sr_i_tree_t *>(tree_)->tables.size(),
+            static_cast<size_t>(Threads * Rounds + Rounds));
+}
+
+}  // namespace

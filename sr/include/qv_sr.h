@@ -260,6 +260,35 @@ QV_SR_EXPORT int32_t sr_open_hashed_key_table_1(sr_opaque_handle_t tree_handle,
  */
 QV_SR_EXPORT int32_t sr_close_table_1(sr_opaque_handle_t table_handle);
 
+/* ---- Table metadata ---------------------------------------------------- */
+
+/* A description of an open table, allocated for the caller; every pointer
+ * in it is a separate allocation released by sr_free_table_metadata_1. */
+typedef struct sr_table_metadata_struct_t {
+  char *name;                      /* registry path, or "" for an unnamed table */
+  uint32_t number_of_rows;         /* applied rows when uncommitted updates are visible, else committed */
+  uint32_t number_of_columns;      /* entries of column_definitions, or the table's column count */
+  uint64_t table_change_counter;
+  int32_t properties;              /* always 0 */
+  sr_column_t *column_definitions; /* null unless asked for */
+} sr_table_metadata_t;
+
+/*
+ * Describes a table. `all_metadata` 0: no column definitions; -1: all
+ * columns; any other value: the columns not qualified SR_INVISIBLE, in
+ * order. Each column copy has its own name, structured-data definition and,
+ * for a variable-length type, its decoded default value.
+ * Returns 0; SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_NO_MEMORY;
+ * SR_E_LIBRARY_CALL when a default value cannot be decoded.
+ */
+QV_SR_EXPORT int32_t sr_get_table_metadata_1(sr_opaque_handle_t table_handle,
+                                             int32_t all_metadata,
+                                             sr_table_metadata_t **p_p_metadata);
+
+/* Releases a description; SR_E_NULL_POINTER for null. Freeing one twice is
+ * the caller's error. */
+QV_SR_EXPORT int32_t sr_free_table_metadata_1(sr_table_metadata_t *p_metadata);
+
 /* ---- Mount points ------------------------------------------------------ */
 
 /*

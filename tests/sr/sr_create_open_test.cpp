@@ -228,6 +228,52 @@ TEST_F(Tables, OpeningSharesOneObjectAndControlKindsMustAgree) {
   EXPECT_EQ(sr_close_table_1(nullptr), SR_E_INVALID_HANDLE);
 }
 
+TEST_F(Tables, MetadataDescribesColumnsWithOrWithoutInvisibleOnes) {
+  sr_sd_def_t *p_definition =
+      static_cast<sr_sd_def_t *>(std::malloc(sizeof(sr_sd_def_t) + sizeof(sr_sd_field_def_t)));
+  p_definition->number_of_fields = 1;
+  p_definition->field_def[0] = {QV_FLOAT64, const_cast<char *>("weight")};
+  std::vector<sr_column_t> columns = {column("k", QV_CHAR_PTR, SR_PRIMARY_KEY),
+                                      column("secret", QV_INT32, SR_STANDARD | SR_INVISIBLE),
+                                      column("label", QV_CHAR_PTR, SR_STANDARD),
+                                      column("shape", QV_SD_PTR, SR_STANDARD)};
+  columns[1].properties = 42;
+  columns[2].default_value.ptr_char = const_cast<char *>("none");
+  columns[3].sd_defn = p_definition;
+  sr_opaque_handle_t table = nullptr;
+  ASSERT_EQ(create("/meta/t", columns, 0, &table), 0);
+  std::free(p_definition);
+
+  sr_table_metadata_t *p_metadata = nullptr;
+  ASSERT_EQ(sr_get_table_metadata_1(table, 0, &p_metadata), 0);
+  EXPECT_STREQ(p_metadata->name, "/meta/t");
+  EXPECT_EQ(p_metadata->number_of_columns, 4u);
+  EXPECT_EQ(p_metadata->column_definitions, nullptr);
+  EXPECT_EQ(p_metadata->table_change_counter, 1u);
+  ASSERT_EQ(sr_free_table_metadata_1(p_metadata), 0);
+
+  ASSERT_EQ(sr_get_table_metadata_1(table, 1, &p_metadata), 0);
+  ASSERT_EQ(p_metadata->number_of_columns, 3u);
+  EXPECT_STREQ(p_metadata->column_definitions[1].name, "label");
+  EXPECT_STREQ(p_metadata->column_definitions[1].default_value.ptr_char, "none");
+  EXPECT_STREQ(p_metadata->column_definitions[0].default_value.ptr_char, "");
+  const sr_sd_def_t *p_copy = p_metadata->column_definitions[2].sd_defn;
+  ASSERT_NE(p_copy, nullptr);
+  ASSERT_EQ(p_copy->number_of_fields, 1u);
+  EXPECT_EQ(p_copy->field_def[0].type, QV_FLOAT64);
+  EXPECT_STREQ(p_copy->field_def[0].name, "weight");
+  ASSERT_EQ(sr_free_table_metadata_1(p_metadata), 0);
+
+  ASSERT_EQ(sr_get_table_metadata_1(table, -1, &p_metadata), 0);
+  ASSERT_EQ(p_metadata->number_of_columns, 4u);
+  EXPECT_STREQ(p_metadata->column_definitions[1].name, "secret");
+  EXPECT_EQ(p_metadata->column_definitions[1].properties, 42);
+  ASSERT_EQ(sr_free_table_metadata_1(p_metadata), 0);
+
+  EXPECT_EQ(sr_free_table_metadata_1(nullptr), SR_E_NULL_POINTER);
+  EXPECT_EQ(sr_get_table_metadata_1(nullptr, 0, &p_metadata), SR_E_INVALID_HANDLE);
+}
+
 TEST_F(Tables, ManyThreadsCreateOpenAndCloseTablesOfOneTree) {
   constexpr int Threads = 4;
   constexpr int Rounds = 100;

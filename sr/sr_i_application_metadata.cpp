@@ -264,39 +264,39 @@ int32_t sr_i_get_application_metadata_element_binary(
   return 0;
 }
 
-int32_t sr_i_commit_application_metadata_buffer_updates(
-    sr_i_application_metadata_t *p_application_metadata) {
+namespace {
+
+// Makes one view of every element the other: commit keeps the applied
+// values, abort the committed ones. The value given up is freed unless the
+// two views share it, and an element the kept view lacks is removed.
+void settle_views(sr_i_application_metadata_t *p_application_metadata,
+                  qv_binary_t *element_t::*kept, qv_binary_t *element_t::*dropped) {
   uint32_t position = 0;
   while (position < p_application_metadata->total_elements) {
     element_t &element = p_application_metadata->p_index[position];
-    if (element.p_committed != element.p_applied) {
-      std::free(element.p_committed);
+    if (element.*dropped != element.*kept) {
+      std::free(element.*dropped);
     }
-    if (element.p_applied == nullptr) {
+    if (element.*kept == nullptr) {
       remove_element(p_application_metadata, position);  // the next one moved here
       continue;
     }
-    element.p_committed = element.p_applied;
+    element.*dropped = element.*kept;
     ++position;
   }
+}
+
+}  // namespace
+
+int32_t sr_i_commit_application_metadata_buffer_updates(
+    sr_i_application_metadata_t *p_application_metadata) {
+  settle_views(p_application_metadata, &element_t::p_applied, &element_t::p_committed);
   return 0;
 }
 
 int32_t sr_i_abort_application_metadata_buffer_updates(
     sr_i_application_metadata_t *p_application_metadata) {
-  uint32_t position = 0;
-  while (position < p_application_metadata->total_elements) {
-    element_t &element = p_application_metadata->p_index[position];
-    if (element.p_applied != element.p_committed) {
-      std::free(element.p_applied);
-    }
-    if (element.p_committed == nullptr) {
-      remove_element(p_application_metadata, position);  // the next one moved here
-      continue;
-    }
-    element.p_applied = element.p_committed;
-    ++position;
-  }
+  settle_views(p_application_metadata, &element_t::p_committed, &element_t::p_applied);
   return 0;
 }
 

@@ -6,6 +6,7 @@ include(CMakePackageConfigHelpers)
 set(QV_PUBLIC_HEADERS
   ${PROJECT_SOURCE_DIR}/cu/include/qv_types.h
   ${PROJECT_SOURCE_DIR}/cu/include/qv_cu.h
+  ${PROJECT_SOURCE_DIR}/cu/include/qv_cu_expression.h
   ${PROJECT_SOURCE_DIR}/tr/include/qv_tr.h
   ${PROJECT_SOURCE_DIR}/pmsg/include/qv_pmsg.h
   ${PROJECT_SOURCE_DIR}/sr/include/qv_sr.h)

@@ -169,4 +169,7 @@ QV_CU_EXPORT int32_t cu_iconv_close_1(cu_iconv_t *p_handle);
 }
 #endif
 
+/* The selection expression language: compiler and evaluator. */
+#include "qv_cu_expression.h"
+
 #endif /* QV_CU_H */

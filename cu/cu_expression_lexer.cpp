@@ -21,19 +21,6 @@ bool is_digit(char character) {
   return character >= '0' && character <= '9';
 }
 
-int hex_digit_value(char character) {
-  if (is_digit(character)) {
-    return character - '0';
-  }
-  if (character >= 'a' && character <= 'f') {
-    return character - 'a' + 10;
-  }
-  if (character >= 'A' && character <= 'F') {
-    return character - 'A' + 10;
-  }
-  return -1;
-}
-
 bool starts_name(char character) {
   return (character >= 'a' && character <= 'z') || (character >= 'A' && character <= 'Z') ||
          character == '_' || static_cast<unsigned char>(character) >= 0x80;
@@ -142,10 +129,10 @@ void cu_i_lexer::read_number(cu_i_token &token) {
   if (p_text[position_] == '0' && position_ + 1 < size &&
       (p_text[position_ + 1] == 'x' || p_text[position_ + 1] == 'X')) {
     position_ += 2;
-    if (position_ == size || hex_digit_value(p_text[position_]) < 0) {
+    if (position_ == size || cu_i_hex_digit_value(p_text[position_]) < 0) {
       fail(CU_RESULT_SYNTAX_ERROR);
     }
-    for (int digit; position_ < size && (digit = hex_digit_value(p_text[position_])) >= 0;
+    for (int digit; position_ < size && (digit = cu_i_hex_digit_value(p_text[position_])) >= 0;
          ++position_) {
       if (magnitude > (UINT64_MAX >> 4)) {
         fail(CU_RESULT_BAD_LITERAL);
@@ -244,9 +231,9 @@ void cu_i_lexer::read_single_quoted(cu_i_token &token) {
           break;
         case 'x': {
           const int high =
-              position_ + 1 < source_.size() ? hex_digit_value(source_[position_ + 1]) : -1;
+              position_ + 1 < source_.size() ? cu_i_hex_digit_value(source_[position_ + 1]) : -1;
           const int low =
-              position_ + 2 < source_.size() ? hex_digit_value(source_[position_ + 2]) : -1;
+              position_ + 2 < source_.size() ? cu_i_hex_digit_value(source_[position_ + 2]) : -1;
           if (high < 0 || low < 0 || (high == 0 && low == 0)) {
             fail(CU_RESULT_SYNTAX_ERROR);
           }

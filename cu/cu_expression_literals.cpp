@@ -19,19 +19,6 @@
 
 namespace {
 
-int hex_digit_value(char character) {
-  if (character >= '0' && character <= '9') {
-    return character - '0';
-  }
-  if (character >= 'a' && character <= 'f') {
-    return character - 'a' + 10;
-  }
-  if (character >= 'A' && character <= 'F') {
-    return character - 'A' + 10;
-  }
-  return -1;
-}
-
 bool has_hex_prefix(std::string_view text) {
   return text.size() >= 2 && text[0] == '0' && (text[1] == 'x' || text[1] == 'X');
 }
@@ -48,7 +35,7 @@ bool read_group(std::string_view group, uint32_t &value) {
   }
   value = 0;
   for (size_t at = 2; at < group.size(); ++at) {
-    const int digit = hex_digit_value(group[at]);
+    const int digit = cu_i_hex_digit_value(group[at]);
     if (digit < 0) {
       return false;
     }
@@ -227,8 +214,8 @@ bool cu_i_binary_from_text(std::string_view text, std::string &bytes) {
   }
   bytes.clear();
   for (size_t at = 2; at < text.size(); at += 2) {
-    const int high = hex_digit_value(text[at]);
-    const int low = hex_digit_value(text[at + 1]);
+    const int high = cu_i_hex_digit_value(text[at]);
+    const int low = cu_i_hex_digit_value(text[at + 1]);
     if (high < 0 || low < 0) {
       return false;
     }

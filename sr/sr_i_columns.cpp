@@ -25,11 +25,6 @@ constexpr size_t Longest_Column_Name = 255;
 constexpr uint32_t Metadata_Header_Bytes = 16;
 constexpr size_t First_Packing_Buffer = 4096;
 
-bool is_variable_length(qv_data_type_t type) {
-  const auto number = static_cast<uint32_t>(type);
-  return number < QV_DATA_TYPE_LIMIT && (cu_dtc_table_1[number] & CU_DTC_POINTER) != 0;
-}
-
 bool is_structured(qv_data_type_t type) {
   return type == QV_SD_PTR || type == QV_SD_PTR_ARRAY;
 }
@@ -108,7 +103,7 @@ void sr_i_swap_columns(sr_column_t *p_first, sr_column_t *p_second) {
 }
 
 qv_value_t sr_i_value_or_empty(qv_data_type_t type, qv_value_t value) {
-  if (!is_variable_length(type) || value.ptr_char != nullptr) {
+  if (!sr_i_is_variable_length(type) || value.ptr_char != nullptr) {
     return value;
   }
   switch (type) {
@@ -174,7 +169,7 @@ int32_t sr_i_pack_variable_length_default_values(cu_iconv_t *p_conversion, sr_co
   total_variable_length_columns = 0;
   for (uint32_t column = 0; column < total_columns; ++column) {
     sr_column_t &definition = p_columns[column];
-    if (!is_variable_length(definition.type)) {
+    if (!sr_i_is_variable_length(definition.type)) {
       continue;
     }
     ++total_variable_length_columns;

@@ -8,6 +8,7 @@
 #include <cstring>
 
 #include "qv_pmsg.h"
+#include "sr_i_columns.h"
 #include "sr_i_frame.h"
 #include "sr_i_table.h"
 #include "sr_i_tree.h"
@@ -16,11 +17,6 @@ namespace {
 
 constexpr sr_i_entry_point_t Get_Table_Metadata{65, false};
 constexpr sr_i_entry_point_t Free_Table_Metadata{37, false};
-
-bool has_variable_data(qv_data_type_t type) {
-  const auto number = static_cast<uint32_t>(type);
-  return number < QV_DATA_TYPE_LIMIT && (cu_dtc_table_1[number] & CU_DTC_POINTER) != 0;
-}
 
 // Frees what a column copy owns.
 void free_column(sr_column_t &column) {
@@ -31,7 +27,7 @@ void free_column(sr_column_t &column) {
     }
     std::free(column.sd_defn);
   }
-  if (has_variable_data(column.type)) {
+  if (sr_i_is_variable_length(column.type)) {
     std::free(column.default_value.ptr_char);
   }
 }
@@ -68,7 +64,7 @@ int32_t copy_column(const sr_i_table_t *p_table, const sr_column_t &stored, sr_c
   copy.qualifier = stored.qualifier;
   copy.properties = stored.properties;
   copy.default_value = stored.default_value;
-  if (has_variable_data(stored.type)) {
+  if (sr_i_is_variable_length(stored.type)) {
     copy.default_value.ptr_char = nullptr;  // owned only once decoded
   }
   if ((copy.name = strdup(stored.name)) == nullptr) {
@@ -79,7 +75,7 @@ int32_t copy_column(const sr_i_table_t *p_table, const sr_column_t &stored, sr_c
       return rc;
     }
   }
-  if (has_variable_data(stored.type)) {
+  if (sr_i_is_variable_length(stored.type)) {
     qv_pmsg_value_t slot;
     std::memcpy(&slot, &stored.default_value, sizeof slot);
     const void *p_defaults = p_table->p_columns + p_table->total_columns;

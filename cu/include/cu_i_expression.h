@@ -193,4 +193,18 @@ inline bool cu_i_is_true(const cu_i_value &value) {
   return value.number == cu_i_number::floating ? value.floating != 0.0 : value.integer != 0;
 }
 
+/* The value of a hexadecimal digit, or -1 for any other character. */
+constexpr int cu_i_hex_digit_value(char character) {
+  if (character >= '0' && character <= '9') {
+    return character - '0';
+  }
+  if (character >= 'a' && character <= 'f') {
+    return character - 'a' + 10;
+  }
+  if (character >= 'A' && character <= 'F') {
+    return character - 'A' + 10;
+  }
+  return -1;
+}
+
 #endif  // CU_I_EXPRESSION_H

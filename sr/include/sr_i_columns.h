@@ -12,6 +12,12 @@
 #include "qv_sr.h"
 #include "sr_i_table.h"
 
+/* Whether values of `type` keep their data outside the 8-byte slot. */
+inline bool sr_i_is_variable_length(qv_data_type_t type) {
+  const auto number = static_cast<uint32_t>(type);
+  return number < QV_DATA_TYPE_LIMIT && (cu_dtc_table_1[number] & CU_DTC_POINTER) != 0;
+}
+
 /* A column name: 1 to 255 bytes, a letter, then letters, digits and "_". */
 bool sr_i_valid_column_name(const char *p_name);
 

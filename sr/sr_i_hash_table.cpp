@@ -11,6 +11,7 @@
 #include "sr_i_hash_table.h"
 
 #include <cstdio>
+#include <cstring>
 #include <new>
 
 #include "qv_cu.h"
@@ -20,9 +21,18 @@ namespace {
 
 constexpr uint32_t Resource_Handle_Bucket_Mask = Sr_Resource_Handle_Hash_Buckets - 1;
 
+// Keys inside row records are not aligned: the handles are read through
+// copies.
+qv_resource_handle_t resource_handle_at(const void *p_key) {
+  qv_resource_handle_t handle;
+  std::memcpy(&handle, p_key, sizeof handle);
+  return handle;
+}
+
 int32_t compare_resource_handles(const void *p_stored_key, const void *p_key) {
-  return cu_rsrc_hndl_cmp_1(static_cast<const qv_resource_handle_t *>(p_stored_key),
-                            static_cast<const qv_resource_handle_t *>(p_key));
+  const qv_resource_handle_t stored = resource_handle_at(p_stored_key);
+  const qv_resource_handle_t wanted = resource_handle_at(p_key);
+  return cu_rsrc_hndl_cmp_1(&stored, &wanted);
 }
 
 }  // namespace
@@ -74,8 +84,7 @@ int32_t sr_i_hash_table_bucket(const sr_hash_table_t *p_hash_table, const void *
                                uint32_t *p_hash_index) {
   uint32_t bucket = 0;
   if (p_hash_table->p_hash_function == nullptr) {
-    bucket = static_cast<const qv_resource_handle_t *>(p_key_value)->id.id4 &
-             Resource_Handle_Bucket_Mask;
+    bucket = resource_handle_at(p_key_value).id.id4 & Resource_Handle_Bucket_Mask;
   } else {
     bucket = p_hash_table->p_hash_function(p_key_value);
   }

@@ -98,3 +98,7 @@ int32_t sr_i_raise_invalid_path(const char *p_path, std::source_location where) 
   return raise(SR_E_INVALID_PATH, SR_I_MESSAGE_INVALID_PATH, site_of(where),
                p_path ? p_path : "<NULL POINTER>");
 }
+
+int32_t sr_i_raise_invalid_criteria(const char *p_criteria, std::source_location where) {
+  return raise(SR_E_INVALID_CRITERIA, SR_I_MESSAGE_INVALID_CRITERIA, site_of(where), p_criteria);
+}

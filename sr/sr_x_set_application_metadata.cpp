@@ -5,8 +5,8 @@
 
 #include "sr_i_application_metadata.h"
 #include "sr_i_frame.h"
-#include "sr_i_read_write_lock.h"
 #include "sr_i_table.h"
+#include "sr_i_transaction.h"
 
 namespace {
 constexpr sr_i_entry_point_t Set_Application_Metadata{91, true};
@@ -21,31 +21,15 @@ extern "C" int32_t sr_set_application_metadata_1(sr_opaque_handle_t table_handle
     if (p_application_metadata == nullptr) {
       return sr_i_raise(SR_E_NULL_POINTER);
     }
-    auto *p_table = static_cast<sr_i_table_t *>(table_handle);
-    sr_i_write_guard table_lock(&p_table->lock);
-    if (table_lock.result() != 0) {
-      return table_lock.result();
-    }
-    if ((p_table->mode & Sr_Mode_Writable) == 0) {
-      return sr_i_raise(SR_E_ACCESS);
-    }
-    // Every table is made with its container; a table without one is broken.
-    if (p_table->p_application_metadata == nullptr) {
-      return sr_i_raise_internal();
-    }
-    if (const int32_t rc = sr_i_set_application_metadata(p_table->p_application_metadata, 0,
-                                                         p_application_metadata->length,
-                                                         p_application_metadata->data);
-        rc != 0) {
-      return rc;
-    }
-    // An implicitly controlled table commits every change before the call
-    // returns. Until the table-wide apply and commit take over that step,
-    // the container is committed here, so the new value is in the committed
-    // view at once.
-    if (p_table->implicitly_controlled != 0) {
-      return sr_i_commit_application_metadata_buffer_updates(p_table->p_application_metadata);
-    }
-    return 0;
+    return sr_i_change_table(table_handle, [&](sr_i_table_t *p_table) -> int32_t {
+      // Every table is made with its container; a table without one is
+      // broken.
+      if (p_table->p_application_metadata == nullptr) {
+        return sr_i_raise_internal();
+      }
+      return sr_i_set_application_metadata(p_table->p_application_metadata, 0,
+                                           p_application_metadata->length,
+                                           p_application_metadata->data);
+    });
   });
 }

@@ -265,9 +265,9 @@ QV_SR_EXPORT int32_t sr_close_table_1(sr_opaque_handle_t table_handle);
 /* A description of an open table, allocated for the caller; every pointer
  * in it is a separate allocation released by sr_free_table_metadata_1. */
 typedef struct sr_table_metadata_struct_t {
-  char *name;                      /* registry path, or "" for an unnamed table */
-  uint32_t number_of_rows;         /* applied rows when uncommitted updates are visible, else committed */
-  uint32_t number_of_columns;      /* entries of column_definitions, or the table's column count */
+  char *name;              /* registry path, or "" for an unnamed table */
+  uint32_t number_of_rows; /* applied rows when uncommitted updates are visible, else committed */
+  uint32_t number_of_columns; /* entries of column_definitions, or the table's column count */
   uint64_t table_change_counter;
   int32_t properties;              /* always 0 */
   sr_column_t *column_definitions; /* null unless asked for */
@@ -281,8 +281,7 @@ typedef struct sr_table_metadata_struct_t {
  * Returns 0; SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_NO_MEMORY;
  * SR_E_LIBRARY_CALL when a default value cannot be decoded.
  */
-QV_SR_EXPORT int32_t sr_get_table_metadata_1(sr_opaque_handle_t table_handle,
-                                             int32_t all_metadata,
+QV_SR_EXPORT int32_t sr_get_table_metadata_1(sr_opaque_handle_t table_handle, int32_t all_metadata,
                                              sr_table_metadata_t **p_p_metadata);
 
 /* Releases a description; SR_E_NULL_POINTER for null. Freeing one twice is
@@ -355,6 +354,162 @@ QV_SR_EXPORT int32_t sr_get_application_metadata_1(sr_opaque_handle_t table_hand
  */
 QV_SR_EXPORT int32_t sr_set_application_metadata_1(sr_opaque_handle_t table_handle,
                                                    const qv_binary_t *p_application_metadata);
+
+/* ---- Rows ---------------------------------------------------------------
+ *
+ * A row is named by its packed index (its place, from 0, among the rows of
+ * the applied view; it moves as rows come and go), by its fixed index (its
+ * position in the table's row index, stable while the row lives) or by its
+ * key (the value of column 0). A change is pending until sr_apply_1 and
+ * sr_commit_1; on an implicitly controlled table each successful change is
+ * applied and committed before the call returns (and, when the apply fails,
+ * every pending change of the table is aborted).
+ *
+ * Readers see the committed view, or the applied view (pending changes
+ * included) when the table was opened with uncommitted updates visible or
+ * the call's `uncommitted_updates_visible` is non-zero. A variable-length
+ * value read is one new block that the caller frees with free().
+ *
+ * Every changing call below returns SR_E_INTERNAL at once in a forked child,
+ * SR_E_INVALID_HANDLE for a null table handle and SR_E_ACCESS on a table
+ * opened for reading; every call may return SR_E_SYSTEM_CALL when the table
+ * lock fails and SR_E_NO_MEMORY.
+ */
+
+/*
+ * Adds a row: the `total_values` columns named in p_column_names take the
+ * values p_p_fields points at (a null string is stored as "", a null
+ * resource handle as the invalid handle); the others take their defaults.
+ * Returns 0; SR_E_APPLIED_UNCOMMITTED; SR_E_KEY_EXPECTED when the key column
+ * is not named or its value pointer is null; SR_E_NO_COLUMNS when a name is
+ * unknown or given twice; SR_E_DUPLICATE_KEY under SR_PRIMARY_KEY;
+ * SR_E_LIBRARY_CALL when a value cannot be encoded. The table is unchanged
+ * after a failure.
+ */
+QV_SR_EXPORT int32_t sr_add_row_1(sr_opaque_handle_t table_handle,
+                                  const char *const *p_column_names, qv_value_t *const *p_p_fields,
+                                  uint32_t total_values);
+
+/*
+ * Read one value (field) or several (fields, `array_count` names and result
+ * pointers) of one row. The `_and_visibility` forms also store the row's
+ * state in *p_row_state when it is not null. Returns 0;
+ * SR_E_NO_ROW_FOR_INDEX for an index out of range (a negative one too);
+ * SR_E_INVALID_COLUMN for an unknown column name (values read before it stay
+ * filled); SR_E_ROW_DELETED when the row has no record in the view read;
+ * SR_E_NO_ROW_FOR_KEY when no row has the key; SR_E_LIBRARY_CALL when a
+ * value cannot be decoded.
+ */
+QV_SR_EXPORT int32_t sr_get_field_by_index_1(sr_opaque_handle_t table_handle, int32_t row_index,
+                                             const char *column_name, qv_value_t *result);
+QV_SR_EXPORT int32_t sr_get_field_by_index_and_visibility_1(
+    sr_opaque_handle_t table_handle, int32_t row_index, const char *column_name, qv_value_t *result,
+    uint32_t uncommitted_updates_visible, sr_row_state_t *p_row_state);
+QV_SR_EXPORT int32_t sr_get_field_by_fixed_index_and_visibility_1(
+    sr_opaque_handle_t table_handle, int32_t fixed_row_index, const char *column_name,
+    qv_value_t *result, uint32_t uncommitted_updates_visible, sr_row_state_t *p_row_state);
+QV_SR_EXPORT int32_t sr_get_field_by_key_1(sr_opaque_handle_t table_handle, qv_value_t row_key,
+                                           const char *column_name, qv_value_t *result);
+QV_SR_EXPORT int32_t sr_get_field_by_key_and_visibility_1(
+    sr_opaque_handle_t table_handle, qv_value_t row_key, const char *column_name,
+    qv_value_t *result, uint32_t uncommitted_updates_visible, sr_row_state_t *p_row_state);
+QV_SR_EXPORT int32_t sr_get_fields_by_index_1(sr_opaque_handle_t table_handle, int32_t row_index,
+                                              const char *const *column_names,
+                                              qv_value_t *const *result, uint32_t array_count);
+QV_SR_EXPORT int32_t sr_get_fields_by_index_and_visibility_1(
+    sr_opaque_handle_t table_handle, int32_t row_index, const char *const *column_names,
+    qv_value_t *const *result, uint32_t array_count, uint32_t uncommitted_updates_visible,
+    sr_row_state_t *p_row_state);
+QV_SR_EXPORT int32_t sr_get_fields_by_fixed_index_and_visibility_1(
+    sr_opaque_handle_t table_handle, int32_t fixed_row_index, const char *const *column_names,
+    qv_value_t *const *result, uint32_t array_count, uint32_t uncommitted_updates_visible,
+    sr_row_state_t *p_row_state);
+QV_SR_EXPORT int32_t sr_get_fields_by_key_1(sr_opaque_handle_t table_handle, qv_value_t row_key,
+                                            const char *const *column_names,
+                                            qv_value_t *const *result, uint32_t array_count);
+QV_SR_EXPORT int32_t sr_get_fields_by_key_and_visibility_1(
+    sr_opaque_handle_t table_handle, qv_value_t row_key, const char *const *column_names,
+    qv_value_t *const *result, uint32_t array_count, uint32_t uncommitted_updates_visible,
+    sr_row_state_t *p_row_state);
+
+/* Stores the fixed index of the row holding `key_value` (deleted rows of
+ * the applied view included). Returns 0; SR_E_NULL_POINTER;
+ * SR_E_NO_ROW_FOR_KEY. */
+QV_SR_EXPORT int32_t sr_get_fixed_row_index_for_key_1(sr_opaque_handle_t table_handle,
+                                                      qv_value_t key_value,
+                                                      uint32_t *p_fixed_row_index);
+
+/*
+ * Set one value (field) or several (fields) of one row as a pending change.
+ * Columns not named keep their values, except those qualified
+ * SR_SET_TO_DEFAULT_WHEN_UNSPECIFIED, which return to their defaults.
+ * Setting the key column does not move the row in the key hash table.
+ * Returns 0; SR_E_APPLIED_UNCOMMITTED; SR_E_NO_ROW_FOR_INDEX;
+ * SR_E_NO_ROW_FOR_KEY; SR_E_ROW_DELETED; SR_E_INVALID_COLUMN for a protected
+ * column, or a name unknown or given twice; SR_E_LIBRARY_CALL.
+ */
+QV_SR_EXPORT int32_t sr_set_field_by_index_1(sr_opaque_handle_t table_handle, int32_t row_index,
+                                             const char *column_name, const qv_value_t *new_field);
+QV_SR_EXPORT int32_t sr_set_field_by_fixed_index_1(sr_opaque_handle_t table_handle,
+                                                   int32_t fixed_row_index, const char *column_name,
+                                                   const qv_value_t *new_field);
+QV_SR_EXPORT int32_t sr_set_field_by_key_1(sr_opaque_handle_t table_handle, qv_value_t row_key,
+                                           const char *column_name, const qv_value_t *new_field);
+QV_SR_EXPORT int32_t sr_set_fields_by_index_1(sr_opaque_handle_t table_handle, int32_t row_index,
+                                              const char *const *column_names,
+                                              qv_value_t *const *new_fields, uint32_t array_count);
+QV_SR_EXPORT int32_t sr_set_fields_by_fixed_index_1(sr_opaque_handle_t table_handle,
+                                                    int32_t fixed_row_index,
+                                                    const char *const *column_names,
+                                                    qv_value_t *const *new_fields,
+                                                    uint32_t array_count);
+QV_SR_EXPORT int32_t sr_set_fields_by_key_1(sr_opaque_handle_t table_handle, qv_value_t row_key,
+                                            const char *const *column_names,
+                                            qv_value_t *const *new_values, uint32_t array_count);
+
+/*
+ * Deletes the row at packed index `row_index` from the applied view; its
+ * committed version stays readable in the committed view until commit.
+ * Returns 0; SR_E_NO_ROW_FOR_INDEX; SR_E_ROW_DELETED when the row at that
+ * packed index is deleted already.
+ */
+QV_SR_EXPORT int32_t sr_delete_row_by_index_1(sr_opaque_handle_t table_handle, uint32_t row_index);
+
+/*
+ * Deletes every row of the applied view (null `selection_criteria`), or the
+ * rows the criteria select. The criteria are an expression over the
+ * table's column names that may hold replacement variables, each filled
+ * from the further arguments in order: $i int32_t, $l int64_t, $ui uint32_t,
+ * $ul uint64_t, $f and $d double, $s const char *, $b const qv_binary_t *,
+ * $rh const qv_resource_handle_t *. Returns 0 (also when no row matches);
+ * SR_E_APPLIED_UNCOMMITTED; SR_E_NO_ROWS when the applied view has no row;
+ * SR_E_INVALID_CRITERIA for an unknown replacement variable;
+ * SR_E_LIBRARY_CALL when the criteria do not compile or cannot be
+ * evaluated (rows deleted before the failure stay deleted, pending);
+ * SR_E_INTERNAL for criteria on a table outside a tree.
+ */
+QV_SR_EXPORT int32_t sr_delete_rows_1(sr_opaque_handle_t table_handle,
+                                      const char *selection_criteria, ...);
+
+/* ---- Transactions -------------------------------------------------------- */
+
+/*
+ * Applies the pending changes: readers of uncommitted updates see them, and
+ * the table refuses further changes until sr_commit_1 or sr_abort_1. The
+ * applied state carries `change_counter`, or the committed counter plus 1
+ * when it is 0 or the table is implicitly controlled. Applying with nothing
+ * pending is allowed. Returns 0; SR_E_APPLIED_UNCOMMITTED when changes are
+ * applied already.
+ */
+QV_SR_EXPORT int32_t sr_apply_1(sr_opaque_handle_t table_handle, uint64_t change_counter);
+
+/* Makes the applied changes the committed state. Returns 0 (also with
+ * nothing applied and nothing pending); SR_E_NOT_APPLIED when changes are
+ * pending but not applied. */
+QV_SR_EXPORT int32_t sr_commit_1(sr_opaque_handle_t table_handle);
+
+/* Throws away every pending and applied change. Returns 0. */
+QV_SR_EXPORT int32_t sr_abort_1(sr_opaque_handle_t table_handle);
 
 #ifdef __cplusplus
 }

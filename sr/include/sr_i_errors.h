@@ -75,6 +75,10 @@ int32_t sr_i_raise_internal(std::source_location where = std::source_location::c
 /* 102: `p_path` may be null. */
 int32_t sr_i_raise_invalid_path(const char *p_path,
                                 std::source_location where = std::source_location::current());
+/* 109: a replacement variable of the criteria format `p_criteria` (the
+ * whole format is the insert) has no known type. */
+int32_t sr_i_raise_invalid_criteria(const char *p_criteria,
+                                    std::source_location where = std::source_location::current());
 
 /*
  * 16: a write found the filesystem full. Names the filesystem holding

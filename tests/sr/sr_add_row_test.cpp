@@ -1,0 +1,221 @@
+// Adding rows: the order of the checks, a failed add leaving no trace,
+// values stored as given (null pointers as empty values, long values in
+// rebuilt records), key checks by scan and by hash, revival of a deleted
+// key at its old position, and the row index growing under pending changes.
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <string>
+
+#include "qv_cu.h"
+#include "sr_i_rows.h"
+#include "sr_row_test_support.h"
+
+namespace {
+
+using namespace sr_test;
+
+class AddRow : public RowTables {};
+
+// What a failed add must leave exactly as it was.
+struct footprint {
+  uint32_t applied_rows, deletions, used_bytes;
+  const void *p_changes;
+  explicit footprint(const sr_i_table_t *p)
+      : applied_rows(p->total_applied_rows),
+        deletions(p->applied_deletions),
+        used_bytes(p->record_buffer_pool.used_bytes),
+        p_changes(p->p_rows_change_list) {}
+  bool operator==(const footprint &) const = default;
+};
+
+TEST_F(AddRow, ChecksComeInTheirOrderAndAFailureLeavesNoTrace) {
+  sr_opaque_handle_t table = create_named_counts("/add/order", Explicit);
+  ASSERT_EQ(add_named(table, "a", 1), 0);
+  const footprint before(object(table));
+
+  qv_value_t name = string_value("b"), number = int32_value(2);
+  {  // The key column left out: 107 even though every other column is named.
+    qv_value_t note = string_value("x");
+    const char *names[] = {"count", "note"};
+    qv_value_t *values[] = {&number, &note};
+    EXPECT_EQ(sr_add_row_1(table, names, values, 2), SR_E_KEY_EXPECTED);
+  }
+  {  // A name given twice, or unknown: 104, and it wins over a null key.
+    const char *twice[] = {"name", "count", "count"};
+    qv_value_t *values[] = {&name, &number, &number};
+    EXPECT_EQ(sr_add_row_1(table, twice, values, 3), SR_E_NO_COLUMNS);
+    const char *unknown[] = {"name", "bogus"};
+    qv_value_t *null_key[] = {nullptr, &number};
+    EXPECT_EQ(sr_add_row_1(table, unknown, null_key, 2), SR_E_NO_COLUMNS);
+    const char *key_only[] = {"name"};
+    EXPECT_EQ(sr_add_row_1(table, key_only, null_key, 1), SR_E_KEY_EXPECTED);
+  }
+  EXPECT_EQ(add_named(table, "a", 9), SR_E_DUPLICATE_KEY);
+  EXPECT_TRUE(footprint(object(table)) == before);
+
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  EXPECT_EQ(add_named(table, "c", 3), SR_E_APPLIED_UNCOMMITTED);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  EXPECT_EQ(add_named(table, "c", 3), 0);
+}
+
+TEST_F(AddRow, TheHandleAndTheOpenModeAreCheckedFirst) {
+  EXPECT_EQ(add_numbered(nullptr, 1, 1), SR_E_INVALID_HANDLE);
+  ASSERT_EQ(sr_close_table_1(create_numbered("/add/readonly", Explicit)), 0);
+  sr_opaque_handle_t reader = nullptr;
+  ASSERT_EQ(sr_open_table_1(tree_, "/add/readonly", 1, &reader), 0);
+  EXPECT_EQ(add_numbered(reader, 1, 1), SR_E_ACCESS);
+  EXPECT_EQ(object(reader)->total_applied_rows, 0u);
+}
+
+TEST_F(AddRow, UnnamedColumnsTakeDefaultsAndNullValuesBecomeEmpty) {
+  sr_opaque_handle_t table = create_named_counts("/add/defaults", Implicit);
+  qv_value_t name = string_value("k");
+  qv_value_t null_note{};
+  const char *names[] = {"name", "note"};
+  qv_value_t *values[] = {&name, &null_note};
+  ASSERT_EQ(sr_add_row_1(table, names, values, 2), 0);
+  EXPECT_EQ(count_of(table, "k", 0), 7);
+  EXPECT_EQ(string_at_fixed(table, fixed_index_of(table, "k"), "note", 0), "");
+
+  std::vector<sr_column_t> columns = {column("handle", QV_RSRC_HANDLE_PTR, SR_PRIMARY_KEY)};
+  sr_opaque_handle_t handles = nullptr;
+  ASSERT_EQ(sr_create_table_1(tree_, "/add/handles", columns.data(), 1, Implicit, &handles), 0);
+  qv_value_t null_handle{};
+  const char *handle_name[] = {"handle"};
+  qv_value_t *handle_value[] = {&null_handle};
+  ASSERT_EQ(sr_add_row_1(handles, handle_name, handle_value, 1), 0);
+  qv_value_t read{};
+  ASSERT_EQ(sr_get_field_by_index_1(handles, 0, "handle", &read), 0);
+  EXPECT_EQ(cu_rsrc_hndl_cmp_1(read.ptr_rsrc_handle, cu_ptr_invld_rsrc_hndl_1), 0);
+  std::free(read.ptr_rsrc_handle);
+}
+
+TEST_F(AddRow, LongValuesAreStoredWhole) {
+  sr_opaque_handle_t table = create_named_counts("/add/long", Implicit);
+  for (const size_t length : {31u, 32u, 33u, 200u, 5000u}) {
+    const std::string key(length, 'k');
+    const std::string note(length * 2, 'n');
+    qv_value_t name = string_value(key.c_str()), text = string_value(note.c_str());
+    const char *names[] = {"name", "note"};
+    qv_value_t *values[] = {&name, &text};
+    ASSERT_EQ(sr_add_row_1(table, names, values, 2), 0) << length;
+    const uint32_t fixed = fixed_index_of(table, key.c_str());
+    EXPECT_EQ(string_at_fixed(table, fixed, "note", 0), note) << length;
+    EXPECT_EQ(string_at_fixed(table, fixed, "name", 0), key) << length;
+  }
+}
+
+TEST_F(AddRow, PrimaryKeyByScanRefusesWhenTheNewRowLiesBeforeTheLastLiveRow) {
+  sr_opaque_handle_t table = create_named_counts("/add/scan", Explicit);
+  for (const char *p_name : {"a", "b", "c"}) {
+    ASSERT_EQ(add_named(table, p_name, 1), 0);
+  }
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  ASSERT_EQ(sr_delete_row_by_index_1(table, 0), 0);
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  // Position 0 is free again and lies before "c": the key check meets the
+  // new row itself.
+  EXPECT_EQ(add_named(table, "d", 1), SR_E_DUPLICATE_KEY);
+  EXPECT_EQ(object(table)->total_applied_rows, 2u);
+
+  sr_opaque_handle_t nocheck =
+      create_named_counts("/add/nocheck", Explicit, SR_PRIMARY_KEY_NOCHECK);
+  EXPECT_EQ(add_named(nocheck, "same", 1), 0);
+  EXPECT_EQ(add_named(nocheck, "same", 2), 0);
+  EXPECT_EQ(object(nocheck)->total_applied_rows, 2u);
+}
+
+TEST_F(AddRow, ADeletedKeyComesBackAtItsOldPosition) {
+  std::vector<sr_column_t> columns = {column("handle", QV_RSRC_HANDLE_PTR, SR_PRIMARY_KEY),
+                                      column("count", QV_INT32, SR_STANDARD)};
+  sr_opaque_handle_t table = nullptr;
+  ASSERT_EQ(sr_create_table_1(tree_, "/add/revive", columns.data(), 2, Explicit, &table), 0);
+  ASSERT_NE(object(table)->p_rows_hash_table, nullptr);
+  qv_resource_handle_t handles[3] = {};
+  for (uint32_t at = 0; at < 3; ++at) {
+    handles[at].id.id4 = at + 1;
+    qv_value_t key{}, count = int32_value(static_cast<int32_t>(at));
+    key.ptr_rsrc_handle = &handles[at];
+    const char *names[] = {"handle", "count"};
+    qv_value_t *values[] = {&key, &count};
+    ASSERT_EQ(sr_add_row_1(table, names, values, 2), 0);
+  }
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+
+  qv_value_t key{};
+  key.ptr_rsrc_handle = &handles[1];
+  uint32_t fixed_before = 0;
+  ASSERT_EQ(sr_get_fixed_row_index_for_key_1(table, key, &fixed_before), 0);
+  ASSERT_EQ(
+      sr_delete_row_by_index_1(table, object(table)->p_rows_fixed_index[fixed_before].packed_index),
+      0);
+  EXPECT_EQ(object(table)->applied_deletions, 1u);
+
+  qv_value_t count = int32_value(42);
+  const char *names[] = {"handle", "count"};
+  qv_value_t *values[] = {&key, &count};
+  ASSERT_EQ(sr_add_row_1(table, names, values, 2), 0);
+  uint32_t fixed_after = 0;
+  ASSERT_EQ(sr_get_fixed_row_index_for_key_1(table, key, &fixed_after), 0);
+  EXPECT_EQ(fixed_after, fixed_before);
+  EXPECT_EQ(object(table)->applied_deletions, 0u);
+  EXPECT_EQ(object(table)->total_applied_rows, 3u);
+  EXPECT_EQ(sr_i_get_row_state_for_fixed_index(object(table), fixed_after), SR_ROW_STATE_UPDATED);
+  // A live key is still a duplicate.
+  EXPECT_EQ(sr_add_row_1(table, names, values, 2), SR_E_DUPLICATE_KEY);
+
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  qv_value_t read{};
+  ASSERT_EQ(sr_get_field_by_key_1(table, key, "count", &read), 0);
+  EXPECT_EQ(read.val_int32, 42);
+}
+
+TEST_F(AddRow, TheIndexDoublesAndPendingChangesFollowTheirRows) {
+  sr_opaque_handle_t table = create_numbered("/add/grow", Explicit);
+  EXPECT_EQ(object(table)->maximum_rows, 100u);
+  for (int32_t id = 0; id < 101; ++id) {
+    ASSERT_EQ(add_numbered(table, id, id * 10), 0);
+  }
+  EXPECT_EQ(object(table)->maximum_rows, 200u);
+  uint32_t listed = 0;
+  for (auto *p_change = object(table)->p_rows_change_list; p_change != nullptr;
+       p_change = p_change->p_next, ++listed) {
+    const sr_i_index_entry_t *p_entry = p_change->p_index_entry;
+    ASSERT_GE(p_entry, object(table)->p_rows_fixed_index);
+    ASSERT_LT(p_entry, object(table)->p_rows_fixed_index + 200);
+    EXPECT_EQ(p_entry->p_pending_change, p_change);
+  }
+  EXPECT_EQ(listed, 101u);
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  for (int32_t id = 0; id < 101; ++id) {
+    qv_value_t read{};
+    ASSERT_EQ(sr_get_field_by_key_1(table, int32_value(id), "count", &read), 0);
+    EXPECT_EQ(read.val_int32, id * 10);
+  }
+}
+
+TEST_F(AddRow, ANewRowTakesTheLowestFreePosition) {
+  sr_opaque_handle_t table = create_named_counts("/add/lowest", Explicit, SR_PRIMARY_KEY_NOCHECK);
+  for (int32_t row = 0; row < 10; ++row) {
+    ASSERT_EQ(add_named(table, std::to_string(row).c_str(), row), 0);
+  }
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  const uint32_t fifth = fixed_index_of(table, "5");
+  ASSERT_EQ(sr_delete_row_by_index_1(table, object(table)->p_rows_fixed_index[fifth].packed_index),
+            0);
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  ASSERT_EQ(add_named(table, "new", 1), 0);
+  EXPECT_EQ(fixed_index_of(table, "new"), fifth);
+}
+
+}  // namespace

@@ -110,9 +110,17 @@ extern "C" int32_t sr_open_hashed_key_table_1(sr_opaque_handle_t tree_handle,
     if (total_hash_buckets == 0 || p_hash_function == nullptr || p_compare_function == nullptr) {
       return sr_i_raise(SR_E_NULL_POINTER);
     }
-    // A table already in memory keeps the hash table it was built with; the
-    // caller's settings would serve a table loaded now, which only the file
-    // layer does.
-    return do_open_table(tree_handle, p_registry_path, mode, p_result_table_handle);
+    // The hash table is built first so that a table loaded by this opening
+    // gets it; a table already in memory keeps the one it has, and the new
+    // one is dropped.
+    sr_hash_table_t *p_hash_table = nullptr;
+    if (const int32_t rc = sr_i_hash_table_open(total_hash_buckets, p_hash_function,
+                                                p_compare_function, &p_hash_table);
+        rc != 0) {
+      return rc;
+    }
+    const int32_t rc = do_open_table(tree_handle, p_registry_path, mode, p_result_table_handle);
+    sr_i_hash_table_close(p_hash_table);
+    return rc;
   });
 }

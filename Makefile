@@ -14,8 +14,8 @@ deps:
 
 run: deps
 	cmake --preset default
-	cmake --build build -j$(JOBS) --target open_tree
-	build/examples/open_tree
+	cmake --build build -j$(JOBS) --target configuration
+	build/examples/configuration
 
 test: deps
 	cmake --preset default

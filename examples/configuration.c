@@ -1,0 +1,135 @@
+/*
+ * configuration.c - a small configuration table kept in the registry.
+ *
+ * The table "/example/services" holds one row per service: its name (the
+ * key), a port, an enabled flag, a weight and the list of hosts it runs on.
+ * The program adds three services, commits, then changes one, deletes
+ * another and adds a fourth in one explicit transaction. Before the commit
+ * it prints both views of the table: the committed one, which other readers
+ * see, and the applied one, with the transaction's changes. Then it commits
+ * and prints the result.
+ */
+#include <stdio.h>
+#include <stdlib.h>
+
+#include <qv_sr.h>
+
+/* Prints the thread's error information for a failed call and exits. */
+static void check(int32_t rc, const char *p_call) {
+  if (rc == 0) {
+    return;
+  }
+  cu_error_t *p_error = NULL;
+  cu_get_error_1(&p_error);
+  fprintf(stderr, "%s failed (%d): %s", p_call, rc, p_error ? p_error->p_text : "\n");
+  cu_rel_error_1(p_error);
+  exit(1);
+}
+
+static sr_column_t column(const char *p_name, qv_data_type_t type, sr_qualifier_t qualifier) {
+  sr_column_t definition = {0};
+  definition.name = (char *)p_name;
+  definition.type = type;
+  definition.qualifier = qualifier;
+  return definition;
+}
+
+/* Adds a service; `hosts` is a NULL-terminated list. */
+static void add_service(sr_opaque_handle_t table, const char *p_name, int32_t port,
+                        uint32_t enabled, double weight, const char *const *hosts) {
+  uint32_t count = 0;
+  while (hosts[count] != NULL) {
+    ++count;
+  }
+  qv_array_t *p_hosts = malloc(sizeof(qv_array_t) + count * sizeof(qv_value_t));
+  p_hosts->element_count = count;
+  p_hosts->pad = 0;
+  for (uint32_t at = 0; at < count; ++at) {
+    p_hosts->elements[at].ptr_char = (char *)hosts[at];
+  }
+  qv_value_t name = {.ptr_char = (char *)p_name}, port_value = {.val_int32 = port},
+             enabled_value = {.val_uint32 = enabled}, weight_value = {.val_float64 = weight},
+             hosts_value = {.ptr_array = p_hosts};
+  const char *names[] = {"name", "port", "enabled", "weight", "hosts"};
+  qv_value_t *values[] = {&name, &port_value, &enabled_value, &weight_value, &hosts_value};
+  check(sr_add_row_1(table, names, values, 5), "sr_add_row_1");
+  free(p_hosts);
+}
+
+/* Prints every row of one view: the committed one, or the applied one. */
+static void print_table(sr_opaque_handle_t table, uint32_t uncommitted, const char *p_title) {
+  static const char *const state_names[] = {"committed", "added", "updated", "deleted", "none"};
+  sr_table_metadata_t *p_metadata = NULL;
+  check(sr_get_table_metadata_1(table, 0, &p_metadata), "sr_get_table_metadata_1");
+  printf("%s (%u rows, change counter %llu)\n", p_title, p_metadata->number_of_rows,
+         (unsigned long long)p_metadata->table_change_counter);
+  sr_free_table_metadata_1(p_metadata);
+
+  const char *names[] = {"name", "port", "enabled", "weight", "hosts"};
+  for (int32_t row = 0;; ++row) {
+    qv_value_t name, port, enabled, weight, hosts;
+    qv_value_t *results[] = {&name, &port, &enabled, &weight, &hosts};
+    sr_row_state_t state;
+    const int32_t rc = sr_get_fields_by_index_and_visibility_1(table, row, names, results, 5,
+                                                               uncommitted, &state);
+    if (rc == SR_E_NO_ROW_FOR_INDEX) {
+      break; /* past the last row */
+    }
+    if (rc == SR_E_ROW_DELETED) {
+      continue; /* not in this view */
+    }
+    check(rc, "sr_get_fields_by_index_and_visibility_1");
+    printf("  %-8s port %-5d %-8s weight %.2f hosts", name.ptr_char, port.val_int32,
+           enabled.val_uint32 ? "enabled" : "disabled", weight.val_float64);
+    for (uint32_t at = 0; at < hosts.ptr_array->element_count; ++at) {
+      printf(" %s", hosts.ptr_array->elements[at].ptr_char);
+    }
+    printf("  [%s]\n", state_names[state]);
+    free(name.ptr_char);
+    free(hosts.ptr_array);
+  }
+}
+
+int main(void) {
+  sr_opaque_handle_t tree = NULL, table = NULL;
+  check(sr_open_tree_1(&tree, 0, 0), "sr_open_tree_1");
+
+  sr_column_t columns[] = {
+      column("name", QV_CHAR_PTR, SR_PRIMARY_KEY), column("port", QV_INT32, SR_STANDARD),
+      column("enabled", QV_UINT32, SR_STANDARD), column("weight", QV_FLOAT64, SR_STANDARD),
+      column("hosts", QV_CHAR_PTR_ARRAY, SR_STANDARD)};
+  columns[2].default_value.val_uint32 = 1;
+  columns[3].default_value.val_float64 = 1.0;
+  const int32_t explicit_control = 4;
+  check(sr_create_table_1(tree, "/example/services", columns, 5, explicit_control, &table),
+        "sr_create_table_1");
+
+  const char *const web_hosts[] = {"alpha", "beta", NULL};
+  const char *const db_hosts[] = {"gamma", NULL};
+  const char *const cache_hosts[] = {"alpha", "delta", "epsilon", NULL};
+  add_service(table, "web", 8080, 1, 2.5, web_hosts);
+  add_service(table, "db", 5432, 1, 1.0, db_hosts);
+  add_service(table, "cache", 6379, 0, 0.5, cache_hosts);
+  check(sr_apply_1(table, 0), "sr_apply_1");
+  check(sr_commit_1(table), "sr_commit_1");
+
+  /* One transaction: move web to another port, enable the cache, drop db
+   * (the row at packed index 1) and add a queue. */
+  qv_value_t key = {.ptr_char = "web"}, port = {.val_int32 = 8443};
+  check(sr_set_field_by_key_1(table, key, "port", &port), "sr_set_field_by_key_1");
+  qv_value_t cache = {.ptr_char = "cache"}, enabled = {.val_uint32 = 1};
+  check(sr_set_field_by_key_1(table, cache, "enabled", &enabled), "sr_set_field_by_key_1");
+  check(sr_delete_row_by_index_1(table, 1), "sr_delete_row_by_index_1");
+  const char *const queue_hosts[] = {"beta", NULL};
+  add_service(table, "queue", 5672, 1, 1.5, queue_hosts);
+  check(sr_apply_1(table, 0), "sr_apply_1");
+
+  print_table(table, 0, "Committed view, before the commit");
+  print_table(table, 1, "Applied view, before the commit");
+  check(sr_commit_1(table), "sr_commit_1");
+  print_table(table, 0, "After the commit");
+
+  check(sr_close_table_1(table), "sr_close_table_1");
+  check(sr_close_tree_1(tree), "sr_close_tree_1");
+  return 0;
+}

@@ -5,8 +5,9 @@
 //
 // The metadata record is one block: a 16-byte header (byte order, 0, column
 // count, variable-length column count), the column array, the packed default
-// values, the column names, then the structured-data definitions in packed
-// form (field count, then per field its type and NUL-terminated name). The
+// values, then per column its name, followed for a structured-data column by
+// its definition in packed form (field count, then per field its type and
+// NUL-terminated name). The
 // columns point into the record, so the table needs no other allocation
 // for its schema.
 
@@ -56,7 +57,7 @@ bool valid_column(const sr_column_t &column) {
 }
 
 uint32_t structured_definition_bytes(const sr_sd_def_t *p_definition) {
-  uint32_t bytes = 8;
+  uint32_t bytes = 4;
   for (uint32_t field = 0; field < p_definition->number_of_fields; ++field) {
     bytes += 4 + static_cast<uint32_t>(std::strlen(p_definition->field_def[field].name)) + 1;
   }
@@ -229,11 +230,11 @@ int32_t sr_i_build_metadata_record(sr_i_table_t *p_table, const sr_column_t *p_c
     std::memcpy(p_cursor, packed_defaults.data(), packed_defaults.size());
     p_cursor += packed_defaults.size();
   }
-  for (uint32_t column = 0; column < total_columns; ++column) {
-    p_stored_columns[column].name = put_string(p_cursor, p_columns[column].name);
-  }
+  // Each name is followed by its column's structured-data definition, the
+  // order the table file keeps them in.
   for (uint32_t column = 0; column < total_columns; ++column) {
     sr_column_t &stored = p_stored_columns[column];
+    stored.name = put_string(p_cursor, p_columns[column].name);
     if (!is_structured(stored.type)) {
       stored.sd_defn = nullptr;
       continue;

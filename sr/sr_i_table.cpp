@@ -13,9 +13,11 @@
 #include <cstdlib>
 #include <cstring>
 #include <new>
+#include <utility>
 
 #include "sr_i_application_metadata.h"
 #include "sr_i_errors.h"
+#include "sr_i_file_system.h"
 #include "sr_i_hash_table.h"
 
 namespace {
@@ -72,6 +74,13 @@ void sr_i_close_table(sr_i_table_t *p_table) {
   sr_i_free_change_lists(p_table);
   std::free(p_table->p_name);
   std::free(p_table->p_file_path);
+  // Closing the descriptors also ends their file locks.
+  if (p_table->file_fd >= 0) {
+    Sr_File_System.close(p_table->file_fd);
+  }
+  if (p_table->rewrite_file_fd >= 0) {
+    Sr_File_System.close(p_table->rewrite_file_fd);
+  }
   std::free(p_table->p_persistent_table_registry_path);
   sr_i_free_application_metadata(p_table->p_application_metadata);
   std::free(p_table);
@@ -193,4 +202,16 @@ void sr_i_set_data_path(sr_i_table_t *p_table) {
 
 void sr_i_set_rewrite_path(sr_i_table_t *p_table) {
   p_table->p_file_path[p_table->file_path_length] = '.';
+}
+
+void sr_i_swap_table_contents(sr_i_table_t *p_open, sr_i_table_t *p_other) {
+  // Everything moves but what makes the open object what it is to its
+  // holders: its lock, its reference count and its place in the tree.
+  sr_i_table_t kept = *p_open;
+  *p_open = *p_other;
+  *p_other = kept;
+  std::swap(p_open->lock, p_other->lock);
+  std::swap(p_open->references, p_other->references);
+  std::swap(p_open->p_tree, p_other->p_tree);
+  std::swap(p_open->p_next, p_other->p_next);
 }

@@ -23,6 +23,7 @@
 #include "sr_i_application_metadata.h"
 #include "sr_i_hash_table.h"
 #include "sr_i_rows.h"
+#include "sr_i_table_file.h"
 #include "sr_i_trace.h"
 
 namespace {
@@ -98,6 +99,24 @@ class cancellation_held_off {
   int old_ = PTHREAD_CANCEL_ENABLE;
 };
 
+// After a rewrite every row lies somewhere new in the file, not only the
+// changed ones.
+void take_rewritten_offsets(sr_i_table_t *p_table) {
+  uint32_t seen = 0;
+  for (uint32_t position = 0;
+       position < p_table->maximum_rows && seen < p_table->total_committed_rows; ++position) {
+    sr_i_index_entry_t &entry = p_table->p_rows_fixed_index[position];
+    if (entry.p_committed == nullptr) {
+      continue;
+    }
+    ++seen;
+    if (entry.applied_file_offset != 0) {
+      entry.file_offset = entry.applied_file_offset;
+      entry.applied_file_offset = 0;
+    }
+  }
+}
+
 }  // namespace
 
 uint32_t sr_i_rewrite_wanted(const sr_i_table_t *p_table) {
@@ -117,14 +136,14 @@ int32_t sr_i_apply(sr_i_table_t *p_table, uint32_t rewrite, uint64_t change_coun
   p_table->applied_change_counter = (change_counter == 0 || p_table->implicitly_controlled != 0)
                                         ? p_table->change_counter + 1
                                         : change_counter;
-  if (p_table->p_file_path != nullptr) {
-    // Tables with files are written by the file layer, which this build
-    // does not have: no such table can be opened.
-    return sr_i_raise_internal();
+  int32_t rc = 0;
+  if (p_table->p_file_path == nullptr) {
+    p_table->ready_for_commit = Sr_Applied_In_Place;
+  } else {
+    rc = sr_i_apply_to_file(p_table, rewrite);
   }
-  p_table->ready_for_commit = Sr_Applied_In_Place;
   trace_apply(p_table, rewrite);
-  return 0;
+  return rc;
 }
 
 int32_t sr_i_commit_in_memory(sr_i_table_t *p_table, sr_i_change_entry_t *p_first) {
@@ -178,12 +197,22 @@ int32_t sr_i_commit(sr_i_table_t *p_table) {
     return sr_i_raise(SR_E_NOT_APPLIED);
   }
   cancellation_held_off no_cancellation;
+  const bool rewritten = p_table->ready_for_commit == Sr_Applied_By_Rewrite;
+  if (p_table->p_file_path != nullptr) {
+    if (const int32_t rc = sr_i_commit_file(p_table); rc != 0) {
+      trace_step("COM", p_table);
+      return rc;
+    }
+  }
   sr_i_commit_in_memory(p_table, p_table->p_rows_change_list);
   sr_i_commit_in_memory(p_table, p_table->p_delete_rows_change_list);
   p_table->change_counter = p_table->applied_change_counter;
   p_table->disk_commit_record_offset = p_table->disk_applied_commit_record_offset;
   p_table->disk_commit_record_length = p_table->disk_applied_commit_record_length;
   p_table->total_committed_rows = p_table->total_applied_rows;
+  if (rewritten) {
+    take_rewritten_offsets(p_table);
+  }
   sr_i_commit_application_metadata_buffer_updates(p_table->p_application_metadata);
   settle(p_table);
   trace_step("COM", p_table);
@@ -192,6 +221,9 @@ int32_t sr_i_commit(sr_i_table_t *p_table) {
 
 int32_t sr_i_abort(sr_i_table_t *p_table) {
   trace_step("ABT", p_table);
+  if (p_table->p_file_path != nullptr) {
+    sr_i_abort_file(p_table);
+  }
   p_table->applied_commit_record_offset = 0;
   p_table->applied_commit_record_length = 0;
   sr_i_abort_in_memory(p_table, p_table->p_rows_change_list);

@@ -1,12 +1,14 @@
 // sr_x_create_table.cpp - sr_create_table_1 and sr_create_hashed_key_table_1,
 // and the dispatcher they share: argument checks, path resolution, and the
-// transient table entered into its tree.
+// new table (transient, or persistent with its first file) entered into its
+// tree.
 
 #include <memory>
 
 #include "sr_i_create_table.h"
 #include "sr_i_frame.h"
 #include "sr_i_paths.h"
+#include "sr_i_table_file.h"
 #include "sr_i_tree.h"
 
 namespace {
@@ -48,18 +50,17 @@ int32_t sr_x_create_table(sr_opaque_handle_t tree_handle, const char *p_registry
   if (const int32_t rc = sr_i_resolve_path(p_tree, p_registry_path, key, block_size); rc != 0) {
     return rc;
   }
-  if (block_size != 0) {
-    // Persistent tables are made by the file layer, which this build does
-    // not have: refuse before anything is written.
-    return sr_i_raise_internal();
-  }
   if (p_tree->tables.contains(key)) {
     return sr_i_raise(SR_E_TABLE_EXISTS);
   }
   sr_i_table_t *p_table = nullptr;
-  if (const int32_t rc = sr_i_create_transient_table(p_tree, key.c_str(), p_columns, array_count,
-                                                     mode, hash_table.release(), &p_table);
-      rc != 0) {
+  const int32_t rc = block_size != 0
+                         ? sr_i_create_persistent_table(p_tree, p_registry_path, key.c_str(),
+                                                        p_columns, array_count, mode, block_size,
+                                                        hash_table.release(), &p_table)
+                         : sr_i_create_transient_table(p_tree, key.c_str(), p_columns, array_count,
+                                                       mode, hash_table.release(), &p_table);
+  if (rc != 0) {
     return rc;
   }
   try {

@@ -4,10 +4,13 @@
 // writable opening decides the control kind; later writable openings must
 // agree with it (211).
 
+#include <utility>
+
 #include "sr_i_frame.h"
 #include "sr_i_hash_table.h"
 #include "sr_i_paths.h"
 #include "sr_i_table.h"
+#include "sr_i_table_file.h"
 #include "sr_i_tree.h"
 
 namespace {
@@ -41,7 +44,28 @@ void take_open_mode(sr_i_table_t *p_table, int32_t mode) {
   p_table->mode = (mode & Open_For_Writing) ? Sr_Mode_Writable : Sr_Mode_Read_Only;
 }
 
+// Loads a persistent table again with a writable mode, and moves the new
+// contents into the open object, so that every handle on it sees the
+// writable table; the old contents are freed.
+int32_t reload_writable(sr_i_table_t *p_table, const char *p_registry_path, int32_t mode,
+                        uint32_t block_size, sr_hash_table_t *&p_rows_hash_table) {
+  sr_i_table_t *p_loaded = nullptr;
+  sr_hash_table_t *p_offered = std::exchange(p_rows_hash_table, nullptr);
+  if (const int32_t rc =
+          sr_i_open_persistent_table(p_table->p_tree, p_registry_path, p_table->p_name, mode,
+                                     block_size, p_offered, &p_loaded);
+      rc != 0) {
+    return rc;
+  }
+  sr_i_swap_table_contents(p_table, p_loaded);
+  sr_i_close_table(p_loaded);
+  return 0;
+}
+
+// `p_rows_hash_table` is taken (and set to null) when the table is loaded
+// from its file now; otherwise it stays the caller's.
 int32_t do_open_table(sr_opaque_handle_t tree_handle, const char *p_registry_path, int32_t mode,
+                      sr_hash_table_t *&p_rows_hash_table,
                       sr_opaque_handle_t *p_result_table_handle) {
   if (tree_handle == nullptr) {
     return sr_i_raise(SR_E_INVALID_HANDLE);
@@ -65,9 +89,24 @@ int32_t do_open_table(sr_opaque_handle_t tree_handle, const char *p_registry_pat
   }
   const auto found = p_tree->tables.find(key);
   if (found == p_tree->tables.end()) {
-    // Persistent tables are loaded by the file layer, which this build does
-    // not have.
-    return block_size != 0 ? sr_i_raise_internal() : sr_i_raise(SR_E_NO_TABLE);
+    if (block_size == 0) {
+      return sr_i_raise(SR_E_NO_TABLE);
+    }
+    sr_i_table_t *p_loaded = nullptr;
+    if (const int32_t rc =
+            sr_i_open_persistent_table(p_tree, p_registry_path, key.c_str(), mode, block_size,
+                                       std::exchange(p_rows_hash_table, nullptr), &p_loaded);
+        rc != 0) {
+      return rc;
+    }
+    try {
+      p_tree->tables.emplace(std::move(key), p_loaded);
+    } catch (const std::bad_alloc &) {
+      sr_i_close_table(p_loaded);
+      return sr_i_raise_no_memory();
+    }
+    *p_result_table_handle = p_loaded;
+    return 0;
   }
   sr_i_table_t *p_table = found->second;
   sr_i_write_guard table_lock(&p_table->lock);
@@ -85,7 +124,16 @@ int32_t do_open_table(sr_opaque_handle_t tree_handle, const char *p_registry_pat
       return sr_i_raise(SR_E_EXCLUSIVE_MODES);
     }
   } else if (writing) {
-    take_open_mode(p_table, mode);  // a read-only transient table turns writable
+    // A read-only table turns writable; one with a file must be read again
+    // under the writer's lock, since another process may have changed it.
+    if (p_table->p_file_path != nullptr) {
+      if (const int32_t rc =
+              reload_writable(p_table, p_registry_path, mode, block_size, p_rows_hash_table);
+          rc != 0) {
+        return rc;
+      }
+    }
+    take_open_mode(p_table, mode);
   }
   *p_result_table_handle = p_table;
   return 0;
@@ -96,7 +144,9 @@ int32_t do_open_table(sr_opaque_handle_t tree_handle, const char *p_registry_pat
 extern "C" int32_t sr_open_table_1(sr_opaque_handle_t tree_handle, const char *p_registry_path,
                                    int32_t mode, sr_opaque_handle_t *p_result_table_handle) {
   return sr_i_run_entry_point(Open_Table, [&] {
-    return do_open_table(tree_handle, p_registry_path, mode, p_result_table_handle);
+    sr_hash_table_t *p_no_hash_table = nullptr;
+    return do_open_table(tree_handle, p_registry_path, mode, p_no_hash_table,
+                         p_result_table_handle);
   });
 }
 
@@ -111,7 +161,7 @@ extern "C" int32_t sr_open_hashed_key_table_1(sr_opaque_handle_t tree_handle,
       return sr_i_raise(SR_E_NULL_POINTER);
     }
     // The hash table is built first so that a table loaded by this opening
-    // gets it; a table already in memory keeps the one it has, and the new
+    // takes it; a table already in memory keeps the one it has, and the new
     // one is dropped.
     sr_hash_table_t *p_hash_table = nullptr;
     if (const int32_t rc = sr_i_hash_table_open(total_hash_buckets, p_hash_function,
@@ -119,8 +169,9 @@ extern "C" int32_t sr_open_hashed_key_table_1(sr_opaque_handle_t tree_handle,
         rc != 0) {
       return rc;
     }
-    const int32_t rc = do_open_table(tree_handle, p_registry_path, mode, p_result_table_handle);
-    sr_i_hash_table_close(p_hash_table);
+    const int32_t rc =
+        do_open_table(tree_handle, p_registry_path, mode, p_hash_table, p_result_table_handle);
+    sr_i_hash_table_close(p_hash_table);  // null when the loaded table took it
     return rc;
   });
 }

@@ -74,6 +74,11 @@ extern "C" {
 #define SR_E_NOT_APPLIED 210         /* the call needs pending updates applied first */
 #define SR_E_EXCLUSIVE_MODES 211     /* a table was opened in mutually exclusive modes */
 #define SR_E_APPLIED_UNCOMMITTED 212 /* the table has applied but uncommitted updates */
+/* A table file whose committed state cannot be rebuilt (each reported with
+ * the text of 2605-202): */
+#define SR_E_NO_REPLACED_ROW 213  /* a row record replaces no current row record */
+#define SR_E_NO_DELETED_ROW 214   /* a deletion record names no current row record */
+#define SR_E_NO_COMMIT_RECORD 215 /* no live commit record */
 
 /* The built-in texts of message set 1 of "qv_sr.cat", indexed by message
  * number (not by code: codes 16 and 213 have the last two numbers). */

@@ -36,10 +36,10 @@ enum sr_i_message_number : int32_t {
 /* The message number of a code whose message has no insert, or 0 when the
  * code has inserts (and needs its own raising function) or is unknown. */
 constexpr int32_t sr_i_plain_message_number(int32_t code) {
-  constexpr int32_t codes[] = {13,  14,  100, 101, 103, 104, 105, 106, 107, 108, 200, 201,
-                               202, 203, 204, 205, 206, 207, 208, 209, 210, 211, 212};
-  constexpr int32_t numbers[] = {4,  5,  7,  8,  10, 11, 12, 13, 14, 15, 17, 18,
-                                 19, 20, 21, 22, 23, 24, 25, 26, 27, 28, 29};
+  constexpr int32_t codes[] = {13,  14,  100, 101, 103, 104, 105, 106, 107, 108, 200, 201, 202,
+                               203, 204, 205, 206, 207, 208, 209, 210, 211, 212, 213, 214, 215};
+  constexpr int32_t numbers[] = {4,  5,  7,  8,  10, 11, 12, 13, 14, 15, 17, 18, 19,
+                                 20, 21, 22, 23, 24, 25, 26, 27, 28, 29, 19, 19, 19};
   for (size_t at = 0; at < sizeof codes / sizeof codes[0]; ++at) {
     if (codes[at] == code) {
       return numbers[at];

@@ -145,6 +145,11 @@ void sr_i_free_change_lists(sr_i_table_t *p_table);
 bool sr_i_record_contained_in_block(const sr_i_table_t *p_table, uint32_t offset, uint32_t length,
                                     uint32_t &block);
 
+/* Exchanges the contents of two table objects, except the open object's
+ * identity: its lock, reference count, tree and link stay. Neither lock may
+ * be held by another thread; the caller may hold `p_open`'s. */
+void sr_i_swap_table_contents(sr_i_table_t *p_open, sr_i_table_t *p_other);
+
 /* Make p_file_path name the data file, or the rewrite file. */
 void sr_i_set_data_path(sr_i_table_t *p_table);
 void sr_i_set_rewrite_path(sr_i_table_t *p_table);

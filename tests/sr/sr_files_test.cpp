@@ -1,0 +1,312 @@
+// The input and output primitives of table files: bounded retries of
+// interrupted calls, the codes of a full disk and of other failures, short
+// and partial writes and reads, the diagnostic file of a failed flush,
+// close-on-exec opens, and the per-descriptor file lock.
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <climits>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <regex>
+#include <sstream>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "qv_sr.h"
+#include "sr_i_file_system.h"
+#include "sr_i_files.h"
+
+namespace {
+
+// What the scripted calls do: the first `interruptions` attempts fail with
+// EINTR, the next `good_attempts` reach the C library (moving at most
+// `most_bytes`), and every later one fails with `failure`.
+struct script_t {
+  int interruptions = 0;
+  int good_attempts = INT_MAX;
+  int failure = 0;
+  size_t most_bytes = SIZE_MAX;
+  int attempts = 0;
+  int pauses = 0;
+  std::vector<std::pair<const iovec *, int>> vectors{};  // what each writev got
+};
+script_t Script;
+
+bool scripted_failure() {
+  ++Script.attempts;
+  if (Script.attempts <= Script.interruptions) {
+    errno = EINTR;
+    return true;
+  }
+  if (Script.attempts - Script.interruptions > Script.good_attempts) {
+    errno = Script.failure;
+    return true;
+  }
+  return false;
+}
+
+int counting_usleep(useconds_t microseconds) {
+  EXPECT_EQ(microseconds, 10000u);
+  ++Script.pauses;
+  return 0;
+}
+int scripted_open(const char *p_path, int flags, mode_t mode) {
+  return scripted_failure() ? -1 : Sr_Default_File_System.open(p_path, flags, mode);
+}
+ssize_t scripted_write(int fd, const void *p_buffer, size_t length) {
+  return scripted_failure() ? -1 : ::write(fd, p_buffer, std::min(length, Script.most_bytes));
+}
+ssize_t scripted_read(int fd, void *p_buffer, size_t length) {
+  return scripted_failure() ? -1 : ::read(fd, p_buffer, std::min(length, Script.most_bytes));
+}
+int scripted_fsync(int fd) {
+  return scripted_failure() ? -1 : ::fsync(fd);
+}
+
+// Writes the first `most_bytes` of the vector, the way a short writev does.
+ssize_t scripted_writev(int fd, const iovec *p_io_vector, int count) {
+  Script.vectors.emplace_back(p_io_vector, count);
+  if (scripted_failure()) {
+    return -1;
+  }
+  std::string bytes;
+  for (int at = 0; at < count; ++at) {
+    bytes.append(static_cast<const char *>(p_io_vector[at].iov_base), p_io_vector[at].iov_len);
+  }
+  return ::write(fd, bytes.data(), std::min(bytes.size(), Script.most_bytes));
+}
+
+struct last_error {
+  int32_t code;
+  std::string text;
+};
+last_error read_last_error() {
+  cu_error_t *p_error = nullptr;
+  EXPECT_EQ(cu_get_error_1(&p_error), 0);
+  last_error copy{p_error->code, p_error->p_text};
+  cu_rel_error_1(p_error);
+  return copy;
+}
+
+class Files : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    Script = script_t{};
+    Sr_File_System.usleep = counting_usleep;
+    directory_ = std::filesystem::temp_directory_path() /
+                 ("sr_files_" + std::to_string(getpid()) + "_" +
+                  ::testing::UnitTest::GetInstance()->current_test_info()->name());
+    std::filesystem::remove_all(directory_);
+    std::filesystem::create_directory(directory_);
+    // A failed flush leaves its diagnostic file in the working directory.
+    previous_directory_ = std::filesystem::current_path();
+    std::filesystem::current_path(directory_);
+    fd_ = sr_i_open_file(path().c_str(), O_RDWR | O_CREAT, Sr_File_Mode);
+    ASSERT_GE(fd_, 0);
+    cu_set_no_error_1();
+  }
+  void TearDown() override {
+    Sr_File_System = Sr_Default_File_System;
+    ::close(fd_);
+    std::filesystem::current_path(previous_directory_);
+    std::filesystem::remove_all(directory_);
+  }
+  std::string path(const char *p_name = "table") const { return (directory_ / p_name).string(); }
+  static std::string contents(const std::string &file) {
+    std::ifstream stream(file);
+    std::stringstream text;
+    text << stream.rdbuf();
+    return text.str();
+  }
+
+  std::filesystem::path directory_;
+  std::filesystem::path previous_directory_;
+  int fd_ = -1;
+};
+
+// One primitive driven through the door entry it depends on.
+struct primitive_t {
+  const char *p_call;
+  const char *p_function;
+  std::function<void()> script_door;
+  std::function<int32_t(int fd)> run;
+};
+
+std::vector<primitive_t> primitives() {
+  static char buffer[8] = "abcdefg";
+  static iovec vector[1];
+  static uint32_t counter;
+  return {
+      {"write", "sr_i_write", [] { Sr_File_System.write = scripted_write; },
+       [](int fd) { return sr_i_write(fd, buffer, 7); }},
+      {"writev", "sr_i_writev", [] { Sr_File_System.writev = scripted_writev; },
+       [](int fd) {
+         vector[0] = {buffer, 7};
+         return sr_i_writev(fd, vector, 1, 7, &counter);
+       }},
+      {"fdatasync", "sr_i_fdatasync", [] { Sr_File_System.fsync = scripted_fsync; },
+       [](int fd) { return sr_i_fdatasync(fd); }},
+      {"read", "sr_i_read", [] { Sr_File_System.read = scripted_read; },
+       [](int fd) { return sr_i_read(fd, buffer, 7, &counter); }},
+  };
+}
+
+TEST_F(Files, InterruptedCallsAreRetried100TimesThenRaise10) {
+  for (const primitive_t &primitive : primitives()) {
+    for (const int interruptions : {100, INT_MAX}) {
+      SCOPED_TRACE(std::string(primitive.p_call) + " " + std::to_string(interruptions));
+      Script = script_t{.interruptions = interruptions};
+      primitive.script_door();
+      cu_set_no_error_1();
+      const int32_t rc = primitive.run(fd_);
+      EXPECT_EQ(Script.attempts, 101);
+      EXPECT_EQ(Script.pauses, 100);
+      const std::string message = std::string("2605-010 The ") + primitive.p_call +
+                                  " system call unexpectedly returned an errno of 4 to the " +
+                                  primitive.p_function + " function near line ";
+      const bool gave_up = interruptions != 100;
+      EXPECT_EQ(rc, gave_up ? SR_E_SYSTEM_CALL : 0);
+      EXPECT_EQ(read_last_error().text.starts_with(message), gave_up);
+    }
+  }
+}
+
+TEST_F(Files, FullDiskReturns16QuietlyAndOtherFailuresRaise10) {
+  for (const primitive_t &primitive : primitives()) {
+    for (const int failure : {ENOSPC, EIO}) {
+      const bool quiet = failure == ENOSPC && primitive.p_call != std::string("read");
+      SCOPED_TRACE(std::string(primitive.p_call) + " " + std::to_string(failure));
+      Script = script_t{.good_attempts = 0, .failure = failure};
+      primitive.script_door();
+      cu_set_no_error_1();
+      EXPECT_EQ(primitive.run(fd_), quiet ? SR_E_FILESYSTEM_FULL : SR_E_SYSTEM_CALL);
+      EXPECT_EQ(Script.attempts, 1);
+      EXPECT_EQ(Script.pauses, 0);
+      const std::string inserts = std::string(primitive.p_call) + " system call unexpectedly " +
+                                  "returned an errno of " + std::to_string(failure) + " to the " +
+                                  primitive.p_function + " function";
+      EXPECT_EQ(read_last_error().text.find(inserts) != std::string::npos, !quiet);
+    }
+  }
+}
+
+TEST_F(Files, ShortWritesAndReadsMoveEveryByte) {
+  Sr_File_System.write = scripted_write;
+  Sr_File_System.read = scripted_read;
+  Script.most_bytes = 3;
+  ASSERT_EQ(sr_i_write(fd_, "0123456789", 10), 0);
+  EXPECT_EQ(contents(path()), "0123456789");
+  EXPECT_EQ(Script.attempts, 4);
+
+  ASSERT_EQ(::lseek(fd_, 0, SEEK_SET), 0);
+  char buffer[8];
+  uint32_t bytes_read = 99;
+  ASSERT_EQ(sr_i_read(fd_, buffer, 8, &bytes_read), 0);
+  EXPECT_EQ(std::string(buffer, bytes_read), "01234567");
+  ASSERT_EQ(sr_i_read(fd_, buffer, 8, &bytes_read), 0);
+  EXPECT_EQ(std::string(buffer, bytes_read), "89");  // fewer only at the end of the file
+}
+
+TEST_F(Files, PartialWritevResumesInsideTheVectorAndCountsEveryByte) {
+  Sr_File_System.writev = scripted_writev;
+  Script.most_bytes = 3;
+  char abc[] = "abc", defg[] = "defg", hij[] = "hij";
+  iovec vector[] = {{abc, 3}, {defg, 4}, {nullptr, 0}, {hij, 3}};
+  uint32_t counter = 5;
+  ASSERT_EQ(sr_i_writev(fd_, vector, 4, 10, &counter), 0);
+  EXPECT_EQ(contents(path()), "abcdefghij");
+  EXPECT_EQ(counter, 15u);
+  // "abc" ends the first entry exactly: the next call still starts with it.
+  const std::vector<std::pair<const iovec *, int>> expected = {
+      {&vector[0], 4}, {&vector[0], 4}, {&vector[1], 3}, {&vector[3], 1}};
+  EXPECT_EQ(Script.vectors, expected);
+  EXPECT_EQ(vector[0].iov_len, 0u);
+
+  // Bytes written before a failure stay written and counted.
+  Script = script_t{.good_attempts = 1, .failure = ENOSPC, .most_bytes = 4};
+  iovec rest[] = {{abc, 3}, {defg, 4}};
+  counter = 0;
+  EXPECT_EQ(sr_i_writev(fd_, rest, 2, 7, &counter), SR_E_FILESYSTEM_FULL);
+  EXPECT_EQ(counter, 4u);
+  EXPECT_EQ(contents(path()), "abcdefghijabcd");
+}
+
+TEST_F(Files, EveryFailedFlushRewritesTheDiagnosticFile) {
+  Sr_File_System.fsync = scripted_fsync;
+  const std::string diagnostic = "reginfo_pid." + std::to_string(getpid());
+  const std::regex line_format(
+      "function\\(fdatasync\\) errno\\(([0-9]+)\\) line\\([0-9]+\\) sccsid\\([^)]+\\)\n");
+  std::smatch match;
+
+  Script.interruptions = 1;  // recorded although the retry succeeds
+  EXPECT_EQ(sr_i_fdatasync(fd_), 0);
+  std::string text = contents(diagnostic);
+  ASSERT_TRUE(std::regex_match(text, match, line_format)) << text;
+  EXPECT_EQ(match[1], "4");
+
+  Script = script_t{.good_attempts = 0, .failure = EIO};
+  EXPECT_EQ(sr_i_fdatasync(fd_), SR_E_SYSTEM_CALL);
+  text = contents(diagnostic);
+  ASSERT_TRUE(std::regex_match(text, match, line_format)) << text;  // one line: truncated
+  EXPECT_EQ(match[1], "5");
+}
+
+TEST_F(Files, OpenIsCloseOnExecCreates0644AndGivesUpOnEndlessInterrupts) {
+  const mode_t previous_mask = ::umask(022);
+  const int fd = sr_i_open_file(path("new").c_str(), O_RDWR | O_CREAT, Sr_File_Mode);
+  ::umask(previous_mask);
+  ASSERT_GE(fd, 0);
+  EXPECT_TRUE(::fcntl(fd, F_GETFD) & FD_CLOEXEC);
+  struct stat status {};
+  ASSERT_EQ(::fstat(fd, &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0644u);
+  ::close(fd);
+
+  Sr_File_System.open = scripted_open;
+  Script.interruptions = INT_MAX;
+  errno = 0;
+  EXPECT_EQ(sr_i_open_file(path().c_str(), O_RDONLY, 0), -1);
+  EXPECT_EQ(errno, EINTR);
+  EXPECT_EQ(Script.attempts, 101);
+  EXPECT_EQ(read_last_error().code, 0);  // the caller reports
+}
+
+bool refused(int locked) {
+  return locked == -1 && (errno == EAGAIN || errno == EACCES);
+}
+
+TEST_F(Files, TheLockBelongsToTheDescriptorThatTookIt) {
+  ASSERT_EQ(sr_i_lock_file(fd_, false), 0);
+  const int second = sr_i_open_file(path().c_str(), O_RDWR, 0);
+  ASSERT_GE(second, 0);
+  EXPECT_TRUE(refused(sr_i_lock_file(second, false)));
+
+  // A process-wide lock would vanish here; this one stays with fd_.
+  ::close(sr_i_open_file(path().c_str(), O_RDWR, 0));
+  EXPECT_TRUE(refused(sr_i_lock_file(second, false)));
+
+  const pid_t child = ::fork();
+  ASSERT_NE(child, -1);
+  if (child == 0) {
+    const int own = ::open(path().c_str(), O_RDWR);
+    ::_exit(refused(sr_i_lock_file(own, false)) ? 0 : 1);
+  }
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+
+  ::close(fd_);
+  fd_ = -1;
+  EXPECT_EQ(sr_i_lock_file(second, true), 0);
+  ::close(second);
+}
+
+}  // namespace

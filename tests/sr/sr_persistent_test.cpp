@@ -1,0 +1,287 @@
+// Persistent tables: the first file of a new table, rows surviving the
+// tree that wrote them, append and rewrite applies with their commits and
+// aborts, the writer's file lock, and damaged files refused with a clear
+// code.
+
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <string>
+#include <vector>
+
+#include "sr_i_files.h"
+#include "sr_i_transaction.h"
+#include "sr_row_test_support.h"
+
+namespace {
+
+using namespace sr_test;
+
+std::vector<unsigned char> file_bytes(const std::string &path) {
+  std::ifstream in(path, std::ios::binary);
+  return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+}
+
+void write_bytes(const std::string &path, const std::vector<unsigned char> &bytes) {
+  std::ofstream out(path, std::ios::binary | std::ios::trunc);
+  out.write(reinterpret_cast<const char *>(bytes.data()),
+            static_cast<std::streamsize>(bytes.size()));
+}
+
+uint32_t word_at(const std::vector<unsigned char> &bytes, size_t offset) {
+  uint32_t word;
+  std::memcpy(&word, bytes.data() + offset, 4);
+  return word;
+}
+
+class Persistent : public RowTables {
+ protected:
+  void SetUp() override {
+    RowTables::SetUp();
+    char pattern[] = "/tmp/qv_persistent_XXXXXX";
+    ASSERT_NE(mkdtemp(pattern), nullptr);
+    directory_ = pattern;
+    ASSERT_EQ(sr_mount_local_tree_1(tree_, "/disk", directory_.c_str(), 0), 0);
+  }
+  void TearDown() override {
+    RowTables::TearDown();
+    std::filesystem::remove_all(directory_);
+  }
+
+  // A fresh tree with the same mount point: a second program.
+  sr_opaque_handle_t second_tree() {
+    sr_opaque_handle_t tree = nullptr;
+    EXPECT_EQ(sr_open_tree_1(&tree, 0, 0), 0);
+    EXPECT_EQ(sr_mount_local_tree_1(tree, "/disk", directory_.c_str(), 0), 0);
+    return tree;
+  }
+
+  std::string path(const char *p_name) const { return directory_ + "/" + p_name; }
+
+  std::string directory_;
+};
+
+TEST_F(Persistent, ANewTableIsItsMetadataAndAnEmptyCommitRecord) {
+  sr_opaque_handle_t table = create_named_counts("/disk/cfg/services", Explicit);
+  ASSERT_NE(table, nullptr);
+  const std::string file = path("cfg,services");
+  const std::vector<unsigned char> bytes = file_bytes(file);
+  const uint32_t metadata_length = word_at(bytes, 0);
+  ASSERT_EQ(bytes.size(), metadata_length + 24u);
+  EXPECT_EQ(word_at(bytes, 8), 1u);
+  EXPECT_EQ(word_at(bytes, metadata_length + 8), 0xFFFFFFFFu);
+  EXPECT_EQ(object(table)->disk_commit_record_offset, metadata_length);
+  EXPECT_FALSE(std::filesystem::exists(file + ".rewrite"));
+
+  struct stat status {};
+  ASSERT_EQ(stat(file.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 0777, 0644u);
+  EXPECT_EQ(fcntl(object(table)->file_fd, F_GETFD) & FD_CLOEXEC, FD_CLOEXEC);
+
+  // The file exists: another tree cannot create the table again, and the
+  // file is left as it was.
+  sr_opaque_handle_t other = second_tree();
+  std::vector<sr_column_t> columns = {column("name", QV_CHAR_PTR, SR_PRIMARY_KEY)};
+  sr_opaque_handle_t again = nullptr;
+  EXPECT_EQ(sr_create_table_1(other, "/disk/cfg/services", columns.data(), 1, 0, &again),
+            SR_E_TABLE_EXISTS);
+  EXPECT_EQ(file_bytes(file), bytes);
+  EXPECT_EQ(sr_close_tree_1(other), 0);
+}
+
+TEST_F(Persistent, CommittedRowsOutliveTheirTree) {
+  sr_opaque_handle_t table = create_named_counts("/disk/t", Implicit);
+  ASSERT_EQ(add_named(table, "a", 1), 0);
+  ASSERT_EQ(add_named(table, "b", 2), 0);
+  ASSERT_EQ(sr_delete_row_by_index_1(table, 0), 0);
+  qv_value_t three = int32_value(3);
+  ASSERT_EQ(sr_set_field_by_key_1(table, string_value("b"), "count", &three), 0);
+  std::vector<unsigned char> metadata(4, 'm');
+  auto *p_metadata = static_cast<qv_binary_t *>(std::malloc(sizeof(qv_binary_t) + 4));
+  p_metadata->length = 4;
+  std::memcpy(p_metadata->data, "meta", 4);
+  ASSERT_EQ(sr_set_application_metadata_1(table, p_metadata), 0);
+  std::free(p_metadata);
+  const uint64_t counter = object(table)->change_counter;
+
+  sr_opaque_handle_t reader_tree = second_tree();
+  sr_opaque_handle_t reader = nullptr;
+  ASSERT_EQ(sr_open_table_1(reader_tree, "/disk/t", 1, &reader), 0);
+  EXPECT_EQ(count_of(reader, "a", 0), -1);
+  EXPECT_EQ(count_of(reader, "b", 0), 3);
+  EXPECT_EQ(object(reader)->change_counter, counter);
+  qv_binary_t *p_read = nullptr;
+  ASSERT_EQ(sr_get_application_metadata_1(reader, &p_read), 0);
+  EXPECT_EQ(std::string(reinterpret_cast<char *>(p_read->data), p_read->length), "meta");
+  std::free(p_read);
+  EXPECT_EQ(sr_close_tree_1(reader_tree), 0);
+}
+
+TEST_F(Persistent, AnAppliedButUncommittedTailIsIgnoredAndAbortCutsItOff) {
+  sr_opaque_handle_t table = create_named_counts("/disk/t", Explicit);
+  ASSERT_EQ(add_named(table, "a", 1), 0);
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  const auto committed = file_bytes(path("t"));
+  ASSERT_EQ(add_named(table, "b", 2), 0);
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  EXPECT_GT(file_bytes(path("t")).size(), committed.size());
+
+  // Another program sees the committed state only.
+  sr_opaque_handle_t other = second_tree();
+  sr_opaque_handle_t reader = nullptr;
+  ASSERT_EQ(sr_open_table_1(other, "/disk/t", 1, &reader), 0);
+  EXPECT_EQ(count_of(reader, "a", 0), 1);
+  EXPECT_EQ(count_of(reader, "b", 0), -1);
+  ASSERT_EQ(sr_close_table_1(reader), 0);
+
+  ASSERT_EQ(sr_abort_1(table), 0);
+  EXPECT_EQ(file_bytes(path("t")), committed);
+  ASSERT_EQ(add_named(table, "c", 3), 0);
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  ASSERT_EQ(sr_open_table_1(other, "/disk/t", 1, &reader), 0);
+  EXPECT_EQ(count_of(reader, "c", 0), 3);
+  EXPECT_EQ(count_of(reader, "b", 0), -1);
+  EXPECT_EQ(sr_close_tree_1(other), 0);
+}
+
+TEST_F(Persistent, ARewriteLeavesOnlyTheLiveRows) {
+  sr_opaque_handle_t table = create_named_counts("/disk/big", Explicit, SR_PRIMARY_KEY_NOCHECK);
+  const std::string note(300, 'n');
+  for (int row = 0; row < 100; ++row) {
+    qv_value_t name = string_value(std::to_string(row).c_str()), text = string_value(note.c_str());
+    const std::string key = std::to_string(row);
+    name = string_value(key.c_str());
+    const char *names[] = {"name", "note"};
+    qv_value_t *values[] = {&name, &text};
+    ASSERT_EQ(sr_add_row_1(table, names, values, 2), 0);
+  }
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  for (int row = 0; row < 90; ++row) {
+    ASSERT_EQ(sr_delete_row_by_index_1(table, static_cast<uint32_t>(row)), 0);
+  }
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  const size_t before = file_bytes(path("big")).size();
+  ASSERT_GT(before, 16384u);
+  ASSERT_EQ(sr_i_rewrite_wanted(object(table)), 1u);
+
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  EXPECT_EQ(object(table)->ready_for_commit, Sr_Applied_By_Rewrite);
+  EXPECT_TRUE(std::filesystem::exists(path("big.rewrite")));
+  ASSERT_EQ(sr_commit_1(table), 0);
+  EXPECT_FALSE(std::filesystem::exists(path("big.rewrite")));
+  EXPECT_LT(file_bytes(path("big")).size(), before / 4);
+
+  // The rewritten file is a committed state of its own, and appends go on
+  // from it.
+  ASSERT_EQ(add_named(table, "new", 7), 0);
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  sr_opaque_handle_t other = second_tree();
+  sr_opaque_handle_t reader = nullptr;
+  ASSERT_EQ(sr_open_table_1(other, "/disk/big", 1, &reader), 0);
+  EXPECT_EQ(object(reader)->total_committed_rows, 11u);
+  EXPECT_EQ(count_of(reader, "new", 0), 7);
+  EXPECT_EQ(string_at_fixed(reader, fixed_index_of(reader, "95"), "note", 0), note);
+  EXPECT_EQ(sr_close_tree_1(other), 0);
+}
+
+TEST_F(Persistent, AReadOnlyTableOpenedForWritingIsReadAgain) {
+  ASSERT_EQ(sr_close_table_1(create_named_counts("/disk/t", Implicit)), 0);
+  sr_opaque_handle_t reader = nullptr;
+  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 1, &reader), 0);
+  // Meanwhile another program adds a row.
+  sr_opaque_handle_t other = second_tree();
+  sr_opaque_handle_t writer = nullptr;
+  ASSERT_EQ(sr_open_table_1(other, "/disk/t", 2, &writer), 0);
+  ASSERT_EQ(add_named(writer, "late", 5), 0);
+  ASSERT_EQ(sr_close_tree_1(other), 0);
+
+  EXPECT_EQ(count_of(reader, "late", 0), -1);
+  sr_opaque_handle_t upgraded = nullptr;
+  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 2, &upgraded), 0);
+  EXPECT_EQ(upgraded, reader);
+  EXPECT_EQ(object(reader)->references, 2u);
+  EXPECT_EQ(count_of(reader, "late", 0), 5);
+  EXPECT_EQ(add_named(reader, "mine", 6), 0);
+}
+
+TEST_F(Persistent, AWritersLockOutlivesOtherDescriptorsOfItsFile) {
+  sr_opaque_handle_t writer = create_named_counts("/disk/t", Implicit);
+  // Another tree of this process opens and closes the same file.
+  sr_opaque_handle_t other = second_tree();
+  sr_opaque_handle_t reader = nullptr;
+  ASSERT_EQ(sr_open_table_1(other, "/disk/t", 1, &reader), 0);
+  ASSERT_EQ(sr_close_tree_1(other), 0);
+
+  const std::string file = path("t");
+  const pid_t child = fork();
+  if (child == 0) {
+    const int fd = sr_i_open_file(file.c_str(), O_RDWR, 0644);
+    _exit(fd >= 0 && sr_i_lock_file(fd, false) != 0 ? 0 : 1);
+  }
+  int status = 0;
+  ASSERT_EQ(waitpid(child, &status, 0), child);
+  EXPECT_EQ(WEXITSTATUS(status), 0) << "the child took the writer's lock";
+  ASSERT_EQ(sr_close_table_1(writer), 0);
+}
+
+TEST_F(Persistent, DamagedFilesAreRefusedWithACode) {
+  sr_opaque_handle_t table = create_named_counts("/disk/t", Implicit);
+  ASSERT_EQ(add_named(table, "a", 1), 0);
+  ASSERT_EQ(add_named(table, "b", 2), 0);
+  ASSERT_EQ(sr_delete_row_by_index_1(table, 0), 0);
+  ASSERT_EQ(sr_close_table_1(table), 0);
+  const std::vector<unsigned char> good = file_bytes(path("t"));
+  const uint32_t metadata_length = word_at(good, 0);
+  const uint32_t first_row = metadata_length + 24;  // behind the first commit record
+
+  auto open_with = [&](const std::vector<unsigned char> &bytes) {
+    write_bytes(path("t"), bytes);
+    sr_opaque_handle_t opened = nullptr;
+    const int32_t rc = sr_open_table_1(tree_, "/disk/t", 1, &opened);
+    if (rc == 0) {
+      sr_close_table_1(opened);
+    }
+    return rc;
+  };
+  auto with_word = [&](size_t offset, uint32_t word) {
+    std::vector<unsigned char> bad = good;
+    std::memcpy(bad.data() + offset, &word, 4);
+    return bad;
+  };
+  EXPECT_EQ(open_with({good.begin(), good.begin() + 12}), SR_E_TABLE_UNREADABLE);
+  EXPECT_EQ(open_with({good.begin(), good.begin() + metadata_length}), SR_E_NO_COMMIT_RECORD);
+  EXPECT_EQ(open_with(with_word(first_row, 0)), SR_E_TABLE_UNREADABLE);
+  EXPECT_EQ(open_with(with_word(first_row + 8, 9)), SR_E_TABLE_UNREADABLE);
+  EXPECT_EQ(open_with(with_word(0, 0xFFFF)), SR_E_TABLE_UNREADABLE);
+  // A row record replacing something that is not a current row.
+  EXPECT_EQ(open_with(with_word(first_row + 12, 5)), SR_E_NO_REPLACED_ROW);
+  // Every single-byte corruption opens or fails cleanly.
+  for (size_t at = 0; at < good.size(); ++at) {
+    std::vector<unsigned char> bad = good;
+    bad[at] ^= 0x5A;
+    const int32_t rc = open_with(bad);
+    EXPECT_TRUE(rc == 0 || rc == SR_E_TABLE_UNREADABLE || rc == SR_E_NO_REPLACED_ROW ||
+                rc == SR_E_NO_DELETED_ROW || rc == SR_E_NO_COMMIT_RECORD ||
+                rc == SR_E_DUPLICATE_KEY)
+        << "byte " << at << " gave " << rc;
+  }
+  write_bytes(path("t"), good);
+  sr_opaque_handle_t opened = nullptr;
+  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 1, &opened), 0);
+  EXPECT_EQ(count_of(opened, "b", 0), 2);
+}
+
+}  // namespace

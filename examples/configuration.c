@@ -3,14 +3,19 @@
  *
  * The table "/example/services" holds one row per service: its name (the
  * key), a port, an enabled flag, a weight and the list of hosts it runs on.
- * The program adds three services, commits, then changes one, deletes
- * another and adds a fourth in one explicit transaction. Before the commit
- * it prints both views of the table: the committed one, which other readers
- * see, and the applied one, with the transaction's changes. Then it commits
- * and prints the result.
+ * It is persistent: "/example" is mounted on a directory (by default
+ * "qv_registry" below the working directory, or the first argument), so
+ * every run starts from what the previous run committed.
+ *
+ * The first run creates the table with three services. Every run then
+ * changes one service, deletes "db" while it exists and adds a queue, in one
+ * explicit transaction. Before the commit it prints both views of the
+ * table: the committed one, which other readers see, and the applied one,
+ * with the transaction's changes. Then it commits and prints the result.
  */
 #include <stdio.h>
 #include <stdlib.h>
+#include <string.h>
 
 #include <qv_sr.h>
 
@@ -70,8 +75,8 @@ static void print_table(sr_opaque_handle_t table, uint32_t uncommitted, const ch
     qv_value_t name, port, enabled, weight, hosts;
     qv_value_t *results[] = {&name, &port, &enabled, &weight, &hosts};
     sr_row_state_t state;
-    const int32_t rc = sr_get_fields_by_index_and_visibility_1(table, row, names, results, 5,
-                                                               uncommitted, &state);
+    const int32_t rc =
+        sr_get_fields_by_index_and_visibility_1(table, row, names, results, 5, uncommitted, &state);
     if (rc == SR_E_NO_ROW_FOR_INDEX) {
       break; /* past the last row */
     }
@@ -90,10 +95,48 @@ static void print_table(sr_opaque_handle_t table, uint32_t uncommitted, const ch
   }
 }
 
-int main(void) {
-  sr_opaque_handle_t tree = NULL, table = NULL;
-  check(sr_open_tree_1(&tree, 0, 0), "sr_open_tree_1");
+/* The packed index of the row named `p_name` in the applied view, or -1. */
+static int32_t find_row(sr_opaque_handle_t table, const char *p_name) {
+  for (int32_t row = 0;; ++row) {
+    qv_value_t name;
+    const int32_t rc = sr_get_field_by_index_and_visibility_1(table, row, "name", &name, 1, NULL);
+    if (rc == SR_E_NO_ROW_FOR_INDEX) {
+      return -1;
+    }
+    if (rc == SR_E_ROW_DELETED) {
+      continue;
+    }
+    check(rc, "sr_get_field_by_index_and_visibility_1");
+    const int found = strcmp(name.ptr_char, p_name) == 0;
+    free(name.ptr_char);
+    if (found) {
+      return row;
+    }
+  }
+}
 
+/*
+ * Rows are found by name through a hash table of 64 buckets. Without one, a
+ * table keyed by strings checks a new key by comparing it with every live
+ * row in row order, which also compares a row that reuses the place of a
+ * deleted one with itself and refuses it.
+ */
+enum { Name_Buckets = 64 };
+
+static uint32_t hash_name(const void *p_key) {
+  uint32_t hash = 2166136261u; /* FNV-1a */
+  for (const unsigned char *p = p_key; *p != 0; ++p) {
+    hash = (hash ^ *p) * 16777619u;
+  }
+  return hash % Name_Buckets;
+}
+
+static int32_t compare_names(const void *p_stored_key, const void *p_key) {
+  return strcmp(p_stored_key, p_key);
+}
+
+/* Creates the table with its first three services. */
+static sr_opaque_handle_t create_services(sr_opaque_handle_t tree) {
   sr_column_t columns[] = {
       column("name", QV_CHAR_PTR, SR_PRIMARY_KEY), column("port", QV_INT32, SR_STANDARD),
       column("enabled", QV_UINT32, SR_STANDARD), column("weight", QV_FLOAT64, SR_STANDARD),
@@ -101,9 +144,10 @@ int main(void) {
   columns[2].default_value.val_uint32 = 1;
   columns[3].default_value.val_float64 = 1.0;
   const int32_t explicit_control = 4;
-  check(sr_create_table_1(tree, "/example/services", columns, 5, explicit_control, &table),
-        "sr_create_table_1");
-
+  sr_opaque_handle_t table = NULL;
+  check(sr_create_hashed_key_table_1(tree, "/example/services", columns, 5, explicit_control,
+                                     Name_Buckets, hash_name, compare_names, &table),
+        "sr_create_hashed_key_table_1");
   const char *const web_hosts[] = {"alpha", "beta", NULL};
   const char *const db_hosts[] = {"gamma", NULL};
   const char *const cache_hosts[] = {"alpha", "delta", "epsilon", NULL};
@@ -112,16 +156,47 @@ int main(void) {
   add_service(table, "cache", 6379, 0, 0.5, cache_hosts);
   check(sr_apply_1(table, 0), "sr_apply_1");
   check(sr_commit_1(table), "sr_commit_1");
+  return table;
+}
 
-  /* One transaction: move web to another port, enable the cache, drop db
-   * (the row at packed index 1) and add a queue. */
-  qv_value_t key = {.ptr_char = "web"}, port = {.val_int32 = 8443};
-  check(sr_set_field_by_key_1(table, key, "port", &port), "sr_set_field_by_key_1");
+int main(int argc, char **argv) {
+  /* The registry's files live in this directory; a second run finds the
+   * state the first one committed. */
+  const char *p_directory = argc > 1 ? argv[1] : "qv_registry";
+  sr_opaque_handle_t tree = NULL, table = NULL;
+  check(sr_open_tree_1(&tree, 0, 0), "sr_open_tree_1");
+  check(sr_mount_local_tree_1(tree, "/example", p_directory, 1), "sr_mount_local_tree_1");
+  const int32_t explicit_writer = 6;
+  const int32_t rc = sr_open_hashed_key_table_1(tree, "/example/services", explicit_writer,
+                                                Name_Buckets, hash_name, compare_names, &table);
+  if (rc == SR_E_NO_TABLE) {
+    table = create_services(tree);
+  } else {
+    check(rc, "sr_open_hashed_key_table_1");
+  }
+  printf("Table /example/services in %s/services\n", p_directory);
+  print_table(table, 0, "Committed at start");
+
+  /* One transaction: move web to the next port, enable the cache, drop db
+   * when it is still there, and add a queue named after the change counter. */
+  qv_value_t web = {.ptr_char = "web"}, port;
+  check(sr_get_field_by_key_1(table, web, "port", &port), "sr_get_field_by_key_1");
+  port.val_int32 += 1;
+  check(sr_set_field_by_key_1(table, web, "port", &port), "sr_set_field_by_key_1");
   qv_value_t cache = {.ptr_char = "cache"}, enabled = {.val_uint32 = 1};
   check(sr_set_field_by_key_1(table, cache, "enabled", &enabled), "sr_set_field_by_key_1");
-  check(sr_delete_row_by_index_1(table, 1), "sr_delete_row_by_index_1");
+  const int32_t db = find_row(table, "db");
+  if (db >= 0) {
+    check(sr_delete_row_by_index_1(table, (uint32_t)db), "sr_delete_row_by_index_1");
+  }
+  sr_table_metadata_t *p_metadata = NULL;
+  check(sr_get_table_metadata_1(table, 0, &p_metadata), "sr_get_table_metadata_1");
+  char queue_name[32];
+  snprintf(queue_name, sizeof queue_name, "queue-%llu",
+           (unsigned long long)p_metadata->table_change_counter);
+  sr_free_table_metadata_1(p_metadata);
   const char *const queue_hosts[] = {"beta", NULL};
-  add_service(table, "queue", 5672, 1, 1.5, queue_hosts);
+  add_service(table, queue_name, 5672, 1, 1.5, queue_hosts);
   check(sr_apply_1(table, 0), "sr_apply_1");
 
   print_table(table, 0, "Committed view, before the commit");

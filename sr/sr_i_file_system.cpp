@@ -36,6 +36,7 @@ constexpr sr_i_file_system_calls_t C_Library_Calls = {
     .rename = ::rename,
     .unlink = ::unlink,
     .stat = ::stat,
+    .fstat = ::fstat,
     .lock = lock_record,
     .usleep = ::usleep,
 };

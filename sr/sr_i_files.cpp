@@ -101,8 +101,9 @@ int32_t sr_i_write(int fd, const void *p_buffer, uint32_t length) {
   while (length > 0) {
     const ssize_t written =
         call_retrying_interrupts([&] { return Sr_File_System.write(fd, p_next, length); }, retries);
-    if (written == -1) {
-      rc = write_failure("write", errno);
+    // A write that moves nothing would be tried for ever.
+    if (written <= 0) {
+      rc = write_failure("write", written == 0 ? EIO : errno);
       break;
     }
     p_next += written;
@@ -120,8 +121,8 @@ int32_t sr_i_writev(int fd, struct iovec *p_io_vector, int count, uint32_t total
   for (;;) {
     const ssize_t written = call_retrying_interrupts(
         [&] { return Sr_File_System.writev(fd, p_io_vector, count); }, retries);
-    if (written == -1) {
-      rc = write_failure("writev", errno);
+    if (written <= 0) {
+      rc = write_failure("writev", written == 0 ? EIO : errno);
       break;
     }
     *p_bytes_written += static_cast<uint32_t>(written);

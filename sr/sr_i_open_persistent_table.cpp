@@ -47,28 +47,48 @@ struct table_closer {
   ~table_closer() { sr_i_close_table(p_table); }
 };
 
+// Whether the descriptor still refers to the file at the table's path. A
+// writer that waited for the lock may find that the holder replaced the
+// file (a rewrite renames a new file over it) while it waited.
+bool still_the_table_file(const sr_i_table_t *p_table, int fd) {
+  struct stat opened {};
+  struct stat current {};
+  return Sr_File_System.fstat(fd, &opened) == 0 &&
+         Sr_File_System.stat(p_table->p_file_path, &current) == 0 &&
+         opened.st_dev == current.st_dev && opened.st_ino == current.st_ino;
+}
+
 // Opens (and for writing locks) the table file.
 int32_t open_table_file(sr_i_table_t *p_table, bool writable) {
-  const int fd = sr_i_open_file(p_table->p_file_path, writable ? O_RDWR : O_RDONLY, Sr_File_Mode);
-  if (fd < 0) {
-    const int error_number = errno;
-    switch (error_number) {
-      case ENOENT:
-        return sr_i_raise(SR_E_NO_TABLE);
-      case EACCES:
-        return sr_i_raise(SR_E_ACCESS);
-      case ENOSPC:
-        return trace_filesystem_full_for_path(p_table->p_file_path);
-      default:
-        return sr_i_raise_system_call("open", error_number);
+  for (;;) {
+    const int fd = sr_i_open_file(p_table->p_file_path, writable ? O_RDWR : O_RDONLY, Sr_File_Mode);
+    if (fd < 0) {
+      const int error_number = errno;
+      switch (error_number) {
+        case ENOENT:
+          return sr_i_raise(SR_E_NO_TABLE);
+        case EACCES:
+          return sr_i_raise(SR_E_ACCESS);
+        case ENOSPC:
+          return trace_filesystem_full_for_path(p_table->p_file_path);
+        default:
+          return sr_i_raise_system_call("open", error_number);
+      }
     }
+    p_table->file_fd = fd;
+    if (!writable) {
+      return 0;
+    }
+    // A writer waits here for another process's writer to close the table.
+    if (sr_i_lock_file(fd, true) != 0) {
+      return sr_i_raise_system_call("lockf", errno);
+    }
+    if (still_the_table_file(p_table, fd)) {
+      return 0;
+    }
+    Sr_File_System.close(fd);
+    p_table->file_fd = -1;
   }
-  p_table->file_fd = fd;
-  // A writer waits here for another process's writer to close the table.
-  if (writable && sr_i_lock_file(fd, true) != 0) {
-    return sr_i_raise_system_call("lockf", errno);
-  }
-  return 0;
 }
 
 // Reads the whole file; a read that fills the buffer means the file grew

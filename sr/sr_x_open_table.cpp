@@ -1,8 +1,9 @@
-// sr_x_open_table.cpp - sr_open_table_1 and sr_open_hashed_key_table_1: a
-// handle on a table by its registry path. A named table exists once per
-// tree; every opening shares that object and counts a reference. The first
-// writable opening decides the control kind; later writable openings must
-// agree with it (211).
+// sr_x_open_table.cpp - sr_open_table_1, sr_open_hashed_key_table_1 and
+// sr_i_open_table_vorel_format: a handle on a table by its registry path. A
+// named table exists once per tree; every opening shares that object and
+// counts a reference. A persistent table is loaded from its file on its
+// first opening. The first writable opening decides the control kind;
+// later writable openings must agree with it (211).
 
 #include <utility>
 
@@ -173,5 +174,17 @@ extern "C" int32_t sr_open_hashed_key_table_1(sr_opaque_handle_t tree_handle,
         do_open_table(tree_handle, p_registry_path, mode, p_hash_table, p_result_table_handle);
     sr_i_hash_table_close(p_hash_table);  // null when the loaded table took it
     return rc;
+  });
+}
+
+// Files of the older layout have the same column descriptors, so one reader
+// serves both.
+extern "C" int32_t sr_i_open_table_vorel_format(sr_opaque_handle_t tree_handle,
+                                                const char *p_registry_path, int32_t mode,
+                                                sr_hash_table_t *p_rows_hash_table,
+                                                sr_opaque_handle_t *p_result_table_handle) {
+  return sr_i_run_entry_point(Open_Table, [&] {
+    return do_open_table(tree_handle, p_registry_path, mode, p_rows_hash_table,
+                         p_result_table_handle);
   });
 }

@@ -176,6 +176,9 @@ typedef int32_t (*sr_hash_keys_compare_function_t)(const void *p_stored_key, con
 /* A tree or table handle. */
 typedef void *sr_opaque_handle_t;
 
+/* A key hash table of the library's internal interface (opaque here). */
+struct sr_hash_table_struct_t;
+
 /* ---- Trees ------------------------------------------------------------- */
 
 /*
@@ -515,6 +518,33 @@ QV_SR_EXPORT int32_t sr_commit_1(sr_opaque_handle_t table_handle);
 
 /* Throws away every pending and applied change. Returns 0. */
 QV_SR_EXPORT int32_t sr_abort_1(sr_opaque_handle_t table_handle);
+
+/* ---- Maintenance ---------------------------------------------------------- */
+
+/*
+ * Removes the side files ("<table file>.rewrite") that a crash during an
+ * apply or a creation may have left beside the persistent tables named by
+ * the `total_paths` registry paths; transient paths are skipped and a
+ * missing side file is not an error. Table files are never touched. Meant
+ * for a time when no other process uses the tables; it also works in a
+ * forked child. Returns 0 (also for a count of 0, whatever the array);
+ * SR_E_INVALID_HANDLE; SR_E_NULL_POINTER for a null array; SR_E_INVALID_PATH
+ * for a path that cannot be resolved (the paths before it were handled).
+ */
+QV_SR_EXPORT int32_t sr_repair_tables_1(sr_opaque_handle_t tree_handle,
+                                        const char *const *p_registry_paths, uint32_t total_paths);
+
+/*
+ * Opens a table exactly as sr_open_table_1 does, for programs written
+ * against the older table-file layout (whose column descriptors have the
+ * same 28 bytes). `p_rows_hash_table`, when not null, is a key hash table
+ * made by the library's internal interface: a table loaded from its file
+ * by this call takes it over; otherwise it stays the caller's.
+ */
+QV_SR_EXPORT int32_t sr_i_open_table_vorel_format(sr_opaque_handle_t tree_handle,
+                                                  const char *p_registry_path, int32_t mode,
+                                                  struct sr_hash_table_struct_t *p_rows_hash_table,
+                                                  sr_opaque_handle_t *p_result_table_handle);
 
 #ifdef __cplusplus
 }

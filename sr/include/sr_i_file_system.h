@@ -28,6 +28,7 @@ typedef struct sr_i_file_system_calls_struct_t {
   int (*rename)(const char *p_from, const char *p_to);
   int (*unlink)(const char *p_path);
   int (*stat)(const char *p_path, struct stat *p_status);
+  int (*fstat)(int fd, struct stat *p_status);
   /* fcntl for the record-lock commands (F_OFD_SETLK, F_OFD_SETLKW). */
   int (*lock)(int fd, int command, struct flock *p_lock);
   /* The pause between retries of an interrupted call. */

@@ -284,4 +284,25 @@ TEST_F(Persistent, DamagedFilesAreRefusedWithACode) {
   EXPECT_EQ(count_of(opened, "b", 0), 2);
 }
 
+TEST_F(Persistent, RepairRemovesLeftoverRewriteFilesOnly) {
+  ASSERT_EQ(sr_close_table_1(create_named_counts("/disk/t", Implicit)), 0);
+  const auto table_file = file_bytes(path("t"));
+  write_bytes(path("t.rewrite"), {1, 2, 3});
+  ASSERT_EQ(create_named_counts("/transient", Implicit) != nullptr, true);
+  const char *paths[] = {"/transient", "/disk/t", "/disk/never"};
+  EXPECT_EQ(sr_repair_tables_1(tree_, paths, 3), 0);
+  EXPECT_FALSE(std::filesystem::exists(path("t.rewrite")));
+  EXPECT_EQ(file_bytes(path("t")), table_file);
+  EXPECT_EQ(sr_repair_tables_1(tree_, nullptr, 0), 0);
+  EXPECT_EQ(sr_repair_tables_1(tree_, nullptr, 1), SR_E_NULL_POINTER);
+  EXPECT_EQ(sr_repair_tables_1(nullptr, paths, 1), SR_E_INVALID_HANDLE);
+  const char *bad[] = {"/disk/t", "no-slash"};
+  EXPECT_EQ(sr_repair_tables_1(tree_, bad, 2), SR_E_INVALID_PATH);
+
+  // The older layout's entry point reads the same file.
+  sr_opaque_handle_t table = nullptr;
+  ASSERT_EQ(sr_i_open_table_vorel_format(tree_, "/disk/t", 1, nullptr, &table), 0);
+  EXPECT_EQ(sr_i_open_table_vorel_format(tree_, "/disk/t", 0, nullptr, &table), SR_E_INVALID_MODE);
+}
+
 }  // namespace

@@ -1,0 +1,645 @@
+// Persistent tables killed at random moments. A child process runs random
+// transactions on a table: single changes through an implicitly controlled
+// handle, multi-row transactions through an explicitly controlled one,
+// appends and rewrites, aborts. Through a pipe it tells the parent each
+// commit it is about to make and each state it has committed. The parent
+// kills it with SIGKILL at a random moment and reopens the table in a tree
+// of its own: the table must hold exactly the last state reported
+// committed, or the one that was being committed, row by row, with its
+// change counter. The next child carries on from what the parent found, so
+// crashes pile up on one file: uncommitted tails, leftover rewrite files,
+// half-made tables.
+
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <iostream>
+#include <map>
+#include <optional>
+#include <random>
+#include <set>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "qv_sr.h"
+#include "sr_i_frame.h"
+#include "sr_i_table.h"
+#include "sr_i_transaction.h"
+
+namespace {
+
+#if defined(__SANITIZE_THREAD__)
+constexpr int Crash_Points = 60;
+#elif defined(__SANITIZE_ADDRESS__)
+constexpr int Crash_Points = 120;
+#elif defined(__has_feature)
+#if __has_feature(thread_sanitizer)
+constexpr int Crash_Points = 60;
+#elif __has_feature(address_sanitizer)
+constexpr int Crash_Points = 120;
+#else
+constexpr int Crash_Points = 300;
+#endif
+#else
+constexpr int Crash_Points = 300;
+#endif
+
+// Every this many crash points the table is removed, so that creation is
+// killed too.
+constexpr int Crash_Points_Per_Table = 50;
+
+constexpr int32_t Open_For_Reading = 1;
+constexpr int32_t Open_Implicit = 2;
+constexpr int32_t Open_Explicit = 6;
+constexpr int32_t Create_Implicit = 0;
+constexpr int32_t Create_Explicit = 4;
+constexpr const char *Table_Path = "/disk/crash/t";
+constexpr const char *Table_File = "crash,t";
+
+// Bounds that keep the file past the size at which rewrites start and the
+// pipe messages short.
+constexpr size_t Fewest_Rows = 12;
+constexpr size_t Most_Rows = 60;
+
+// A committed state: the change counter and each row's Version by Id. A
+// row's Payload is a function of its Id and Version.
+struct table_state {
+  bool exists = false;
+  uint64_t counter = 0;
+  std::map<int32_t, int32_t> rows;
+  bool operator==(const table_state &) const = default;
+};
+
+std::string encode(const table_state &state) {
+  if (!state.exists) {
+    return "absent";
+  }
+  std::ostringstream out;
+  out << state.counter;
+  for (const auto &[id, version] : state.rows) {
+    out << ' ' << id << ':' << version;
+  }
+  return out.str();
+}
+
+table_state decode(const std::string &text) {
+  table_state state;
+  if (text == "absent") {
+    return state;
+  }
+  state.exists = true;
+  std::istringstream in(text);
+  in >> state.counter;
+  std::string row;
+  while (in >> row) {
+    const size_t colon = row.find(':');
+    state.rows[std::stoi(row.substr(0, colon))] = std::stoi(row.substr(colon + 1));
+  }
+  return state;
+}
+
+// 40 to about 900 bytes, different for every version of every row, so
+// that a record from the wrong version or the wrong row is noticed.
+std::string payload(int32_t id, int32_t version) {
+  const uint32_t hash =
+      static_cast<uint32_t>(id) * 2654435761u ^ static_cast<uint32_t>(version) * 40503u;
+  std::string text = std::to_string(id) + "/" + std::to_string(version) + ":";
+  const size_t length = 40 + hash % 860;
+  for (size_t at = text.size(); at < length; ++at) {
+    text.push_back(static_cast<char>('a' + (hash + at * 7) % 26));
+  }
+  return text;
+}
+
+// The writer reaches rows by key through a key hash table of its own: a
+// table without one checks a new key by scanning the rows, which refuses
+// an addition whenever a deleted row left a free entry before the last
+// live row.
+constexpr uint32_t Hash_Buckets = 64;
+
+uint32_t hash_id(const void *p_key) {
+  int32_t id;
+  std::memcpy(&id, p_key, sizeof id);
+  return static_cast<uint32_t>(id) % Hash_Buckets;
+}
+
+int32_t compare_ids(const void *p_stored_key, const void *p_key) {
+  return std::memcmp(p_stored_key, p_key, sizeof(int32_t)) == 0 ? 0 : 1;
+}
+
+std::vector<sr_column_t> table_columns() {
+  std::vector<sr_column_t> columns(3);
+  columns[0].name = const_cast<char *>("Id");
+  columns[0].type = QV_INT32;
+  columns[0].qualifier = SR_PRIMARY_KEY;
+  columns[1].name = const_cast<char *>("Version");
+  columns[1].type = QV_INT32;
+  columns[1].qualifier = SR_STANDARD;
+  columns[2].name = const_cast<char *>("Payload");
+  columns[2].type = QV_CHAR_PTR;
+  columns[2].qualifier = SR_STANDARD;
+  return columns;
+}
+
+// The committed rows of an open table into `state`; false with `problem`
+// set when a read fails or a row is not one this test writes.
+bool read_rows(sr_opaque_handle_t table, table_state &state, std::string &problem) {
+  sr_table_metadata_t *p_metadata = nullptr;
+  if (const int32_t rc = sr_get_table_metadata_1(table, 0, &p_metadata); rc != 0) {
+    problem = "sr_get_table_metadata_1 gave " + std::to_string(rc);
+    return false;
+  }
+  state.exists = true;
+  state.counter = p_metadata->table_change_counter;
+  state.rows.clear();
+  const uint32_t total_rows = p_metadata->number_of_rows;
+  sr_free_table_metadata_1(p_metadata);
+  for (uint32_t at = 0; at < total_rows; ++at) {
+    qv_value_t id{};
+    qv_value_t version{};
+    qv_value_t text{};
+    const char *names[] = {"Id", "Version", "Payload"};
+    qv_value_t *values[] = {&id, &version, &text};
+    if (const int32_t rc = sr_get_fields_by_index_and_visibility_1(table, static_cast<int32_t>(at),
+                                                                   names, values, 3, 0, nullptr);
+        rc != 0) {
+      problem = "row " + std::to_string(at) + " gave " + std::to_string(rc);
+      return false;
+    }
+    const std::string stored = text.ptr_char;
+    std::free(text.ptr_char);
+    if (stored != payload(id.val_int32, version.val_int32)) {
+      problem = "row " + std::to_string(id.val_int32) + " has the payload \"" + stored + "\"";
+      return false;
+    }
+    if (!state.rows.emplace(id.val_int32, version.val_int32).second) {
+      problem = "row " + std::to_string(id.val_int32) + " is there twice";
+      return false;
+    }
+  }
+  return true;
+}
+
+// The table as a new program finds it: read-only, in a tree of its own.
+bool read_table(const std::string &directory, table_state &state, std::string &problem) {
+  sr_opaque_handle_t tree = nullptr;
+  if (sr_open_tree_1(&tree, 0, 0) != 0 ||
+      sr_mount_local_tree_1(tree, "/disk", directory.c_str(), 0) != 0) {
+    problem = "no tree";
+    return false;
+  }
+  sr_opaque_handle_t table = nullptr;
+  const int32_t rc = sr_open_table_1(tree, Table_Path, Open_For_Reading, &table);
+  bool read = true;
+  state = table_state{};
+  if (rc == SR_E_NO_TABLE) {
+    state.exists = false;
+  } else if (rc != 0) {
+    problem = "sr_open_table_1 gave " + std::to_string(rc);
+    read = false;
+  } else {
+    read = read_rows(table, state, problem);
+  }
+  sr_close_tree_1(tree);
+  return read;
+}
+
+qv_value_t int32_value(int32_t number) {
+  qv_value_t value{};
+  value.val_int32 = number;
+  return value;
+}
+
+// The child: random transactions for ever, each reported to the parent. It
+// writes lines "P <kind> <state>" before a commit may begin and
+// "C <kind> <state>" once it has returned, or "E <what>" before it gives
+// up. The kind of a commit is create, implicit, apply (which rewrites the
+// file when it is mostly dead records) or rewrite (forced); a reported
+// commit that replaced the file says rewritten.
+class child_writer {
+ public:
+  child_writer(std::string directory, uint32_t seed, int pipe_fd)
+      : directory_(std::move(directory)), rng_(seed), pipe_fd_(pipe_fd) {}
+
+  [[noreturn]] void run() {
+    if (sr_open_tree_1(&tree_, 0, 0) != 0 ||
+        sr_mount_local_tree_1(tree_, "/disk", directory_.c_str(), 0) != 0) {
+      fail("no tree");
+    }
+    open_or_create();
+    for (;;) {
+      const bool implicit = rng_() % 2 == 0;
+      reopen(implicit ? Open_Implicit : Open_Explicit);
+      for (uint32_t steps = 1 + rng_() % 10; steps > 0; --steps) {
+        if (implicit) {
+          implicit_change();
+        } else {
+          explicit_transaction();
+        }
+      }
+    }
+  }
+
+ private:
+  [[noreturn]] void fail(const std::string &what) {
+    say("E " + what);
+    _exit(2);
+  }
+
+  void say(const std::string &line) {
+    const std::string text = line + "\n";
+    // Short enough to go through the pipe in one piece.
+    if (write(pipe_fd_, text.data(), text.size()) != static_cast<ssize_t>(text.size())) {
+      _exit(3);
+    }
+  }
+
+  void announce(const char *p_kind, const table_state &state) {
+    say(std::string("P ") + p_kind + " " + encode(state));
+  }
+
+  void confirm(const char *p_kind, const table_state &state) {
+    committed_ = state;
+    struct stat status {};
+    const bool replaced =
+        stat((directory_ + "/" + Table_File).c_str(), &status) == 0 && status.st_ino != file_inode_;
+    file_inode_ = status.st_ino;
+    const bool created = std::strcmp(p_kind, "create") == 0;
+    say(std::string("C ") + (replaced && !created ? "rewritten" : p_kind) + " " + encode(state));
+  }
+
+  void check(int32_t rc, const char *p_call) {
+    if (rc != 0) {
+      fail(std::string(p_call) + " gave " + std::to_string(rc));
+    }
+  }
+
+  void open_or_create() {
+    const int32_t rc = sr_open_hashed_key_table_1(tree_, Table_Path, Open_Implicit, Hash_Buckets,
+                                                  hash_id, compare_ids, &table_);
+    if (rc == SR_E_NO_TABLE) {
+      table_state created;
+      created.exists = true;
+      created.counter = 1;
+      announce("create", created);
+      std::vector<sr_column_t> columns = table_columns();
+      check(sr_create_hashed_key_table_1(tree_, Table_Path, columns.data(), 3,
+                                         rng_() % 2 ? Create_Implicit : Create_Explicit,
+                                         Hash_Buckets, hash_id, compare_ids, &table_),
+            "sr_create_hashed_key_table_1");
+      confirm("create", created);
+    } else {
+      check(rc, "sr_open_table_1");
+      std::string problem;
+      if (!read_rows(table_, committed_, problem)) {
+        fail(problem);
+      }
+      struct stat status {};
+      stat((directory_ + "/" + Table_File).c_str(), &status);
+      file_inode_ = status.st_ino;
+    }
+    for (const auto &[id, version] : committed_.rows) {
+      next_id_ = std::max(next_id_, id + 1);
+    }
+  }
+
+  void reopen(int32_t mode) {
+    check(sr_close_table_1(table_), "sr_close_table_1");
+    check(sr_open_hashed_key_table_1(tree_, Table_Path, mode, Hash_Buckets, hash_id, compare_ids,
+                                     &table_),
+          "sr_open_hashed_key_table_1");
+  }
+
+  int32_t any_row(const table_state &state) {
+    auto row = state.rows.begin();
+    std::advance(row, rng_() % state.rows.size());
+    return row->first;
+  }
+
+  int32_t add_row(int32_t id, int32_t version) {
+    qv_value_t key = int32_value(id);
+    qv_value_t number = int32_value(version);
+    const std::string text = payload(id, version);
+    qv_value_t body{};
+    body.ptr_char = const_cast<char *>(text.c_str());
+    const char *names[] = {"Id", "Version", "Payload"};
+    qv_value_t *values[] = {&key, &number, &body};
+    return sr_add_row_1(table_, names, values, 3);
+  }
+
+  int32_t set_row(int32_t id, int32_t version) {
+    qv_value_t number = int32_value(version);
+    const std::string text = payload(id, version);
+    qv_value_t body{};
+    body.ptr_char = const_cast<char *>(text.c_str());
+    const char *names[] = {"Version", "Payload"};
+    qv_value_t *values[] = {&number, &body};
+    return sr_set_fields_by_key_1(table_, int32_value(id), names, values, 2);
+  }
+
+  // add, set or delete, each picked so that the row count stays within
+  // bounds.
+  enum class change { add, set, remove };
+  change pick_change(const table_state &state) {
+    if (state.rows.size() < Fewest_Rows) {
+      return change::add;
+    }
+    if (state.rows.size() > Most_Rows) {
+      return change::remove;
+    }
+    return static_cast<change>(rng_() % 3);
+  }
+
+  // One change through the implicitly controlled handle: applied and
+  // committed by the call itself.
+  void implicit_change() {
+    table_state next = committed_;
+    ++next.counter;
+    switch (pick_change(committed_)) {
+      case change::add: {
+        const int32_t id = next_id_++;
+        next.rows[id] = 1;
+        announce("implicit", next);
+        check(add_row(id, 1), "sr_add_row_1");
+        break;
+      }
+      case change::set: {
+        const int32_t id = any_row(committed_);
+        const int32_t version = ++next.rows[id];
+        announce("implicit", next);
+        check(set_row(id, version), "sr_set_fields_by_key_1");
+        break;
+      }
+      case change::remove: {
+        // By packed index: the row's place among the live rows.
+        const auto at = static_cast<int32_t>(rng_() % committed_.rows.size());
+        qv_value_t id{};
+        check(sr_get_field_by_index_1(table_, at, "Id", &id), "sr_get_field_by_index_1");
+        next.rows.erase(id.val_int32);
+        announce("implicit", next);
+        check(sr_delete_row_by_index_1(table_, static_cast<uint32_t>(at)),
+              "sr_delete_row_by_index_1");
+        break;
+      }
+    }
+    confirm("implicit", next);
+  }
+
+  // Several changes through the explicitly controlled handle, then abort,
+  // apply and abort, or apply (appending or rewriting) and commit.
+  void explicit_transaction() {
+    table_state next = committed_;
+    std::set<int32_t> deleted;
+    for (uint32_t changes = 1 + rng_() % 8; changes > 0; --changes) {
+      if (!deleted.empty() && rng_() % 4 == 0) {
+        // A row deleted in this transaction comes back.
+        const int32_t id = *deleted.begin();
+        deleted.erase(deleted.begin());
+        const auto old = committed_.rows.find(id);
+        const int32_t version = old == committed_.rows.end() ? 1 : old->second + 1;
+        next.rows[id] = version;
+        check(add_row(id, version), ("sr_add_row_1, reviving " + std::to_string(id)).c_str());
+        continue;
+      }
+      switch (pick_change(next)) {
+        case change::add: {
+          const int32_t id = next_id_++;
+          next.rows[id] = 1;
+          check(add_row(id, 1),
+                ("sr_add_row_1 in a transaction, adding " + std::to_string(id)).c_str());
+          break;
+        }
+        case change::set: {
+          const int32_t id = any_row(next);
+          check(set_row(id, ++next.rows[id]), "sr_set_fields_by_key_1");
+          break;
+        }
+        case change::remove: {
+          const int32_t id = any_row(next);
+          next.rows.erase(id);
+          deleted.insert(id);
+          check(sr_delete_rows_1(table_, "Id == $i", id), "sr_delete_rows_1");
+          break;
+        }
+      }
+    }
+    const uint64_t counter = rng_() % 2 ? 0 : committed_.counter + 1 + rng_() % 3;
+    next.counter = counter == 0 ? committed_.counter + 1 : counter;
+    auto *p_table = static_cast<sr_i_table_t *>(table_);
+    // A rewrite is forced through the internal apply; the table's write
+    // lock is of no use in this single-threaded process.
+    switch (rng_() % 20) {
+      case 0:
+        check(sr_abort_1(table_), "sr_abort_1");
+        return;
+      case 1:
+        check(sr_apply_1(table_, counter), "sr_apply_1");
+        check(sr_abort_1(table_), "sr_abort_1 after an append");
+        return;
+      case 2:
+        check(sr_i_apply(p_table, 1, counter), "sr_i_apply");
+        check(sr_abort_1(table_), "sr_abort_1 after a rewrite");
+        return;
+      case 3:
+      case 4:
+      case 5:
+      case 6:
+        announce("rewrite", next);
+        check(sr_i_apply(p_table, 1, counter), "sr_i_apply");
+        check(sr_commit_1(table_), "sr_commit_1");
+        confirm("rewrite", next);
+        return;
+      default:
+        announce("apply", next);
+        check(sr_apply_1(table_, counter), "sr_apply_1");
+        check(sr_commit_1(table_), "sr_commit_1");
+        confirm("apply", next);
+        return;
+    }
+  }
+
+  std::string directory_;
+  std::mt19937 rng_;
+  int pipe_fd_;
+  sr_opaque_handle_t tree_ = nullptr;
+  sr_opaque_handle_t table_ = nullptr;
+  table_state committed_;
+  ino_t file_inode_ = 0;
+  int32_t next_id_ = 1;
+};
+
+// What one child left in the pipe: the last state reported committed and
+// the commit announced after it, if any.
+struct child_report {
+  std::optional<table_state> committed;
+  std::optional<table_state> announced;
+  std::string announced_kind;
+  std::string error;
+  int commits = 0;
+  int rewrites = 0;
+};
+
+void take_line(const std::string &line, child_report &report) {
+  if (line.rfind("E ", 0) == 0) {
+    report.error = line.substr(2);
+    return;
+  }
+  const size_t space = line.find(' ', 2);
+  const std::string kind = line.substr(2, space - 2);
+  const table_state state = decode(line.substr(space + 1));
+  if (line[0] == 'P') {
+    report.announced = state;
+    report.announced_kind = kind;
+    return;
+  }
+  report.committed = state;
+  report.announced.reset();
+  ++report.commits;
+  report.rewrites += kind == "rewritten" ? 1 : 0;
+}
+
+class Crash : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/qv_crash_XXXXXX";
+    ASSERT_NE(mkdtemp(pattern), nullptr);
+    directory_ = pattern;
+  }
+  void TearDown() override { std::filesystem::remove_all(directory_); }
+
+  // Runs one child with `seed`, kills it once it has sent `messages` lines
+  // and `delay` microseconds more have passed, and collects its report.
+  child_report kill_a_writer(uint32_t seed, int messages, useconds_t delay) {
+    int ends[2];
+    child_report report;
+    if (pipe(ends) != 0) {
+      report.error = "pipe";
+      return report;
+    }
+    const pid_t child = fork();
+    if (child == 0) {
+      close(ends[0]);
+      // The child stands for another program. This process runs no other
+      // thread and holds no registry lock at the fork, so the guard that
+      // keeps forked children from changing tables can be lifted.
+      In_Child_Process.store(0);
+      child_writer(directory_, seed, ends[1]).run();
+    }
+    close(ends[1]);
+    std::string pending;
+    int lines = 0;
+    bool killed = false;
+    char buffer[8192];
+    for (;;) {
+      if (!killed && lines >= messages) {
+        usleep(delay);
+        kill(child, SIGKILL);
+        killed = true;
+      }
+      const ssize_t got = read(ends[0], buffer, sizeof buffer);
+      if (got < 0 && errno == EINTR) {
+        continue;
+      }
+      if (got <= 0) {
+        break;
+      }
+      pending.append(buffer, static_cast<size_t>(got));
+      for (size_t end; (end = pending.find('\n')) != std::string::npos;) {
+        take_line(pending.substr(0, end), report);
+        pending.erase(0, end + 1);
+        ++lines;
+      }
+    }
+    close(ends[0]);
+    int status = 0;
+    waitpid(child, &status, 0);
+    if (report.error.empty() && !(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL)) {
+      report.error = "the child ended by itself, status " + std::to_string(status);
+    }
+    return report;
+  }
+
+  // Keeps the table file of a failure for a later look.
+  std::string keep_files(int point) {
+    const std::string kept = directory_ + "-kept-" + std::to_string(point);
+    std::filesystem::copy(directory_, kept, std::filesystem::copy_options::recursive);
+    return kept;
+  }
+
+  std::string directory_;
+};
+
+TEST_F(Crash, AKilledWriterLeavesTheLastCommittedStateOrTheOneInFlight) {
+  uint32_t seed = std::random_device{}();
+  if (const char *p_seed = std::getenv("SR_CRASH_SEED")) {
+    seed = static_cast<uint32_t>(std::strtoul(p_seed, nullptr, 10));
+  }
+  std::mt19937 rng(seed);
+  table_state known;  // absent
+  int in_flight = 0;
+  int new_state_found = 0;
+  int commits = 0;
+  int rewrites = 0;
+  std::map<std::string, int> in_flight_kinds;
+  int point = 0;
+  for (; point < Crash_Points; ++point) {
+    if (point % Crash_Points_Per_Table == 0) {
+      std::filesystem::remove(directory_ + "/" + Table_File);
+      known = table_state{};
+    }
+    const int messages = static_cast<int>(rng() % 30);
+    const auto delay = static_cast<useconds_t>(rng() % 3000);
+    const uint32_t child_seed = seed + static_cast<uint32_t>(point);
+    const child_report report = kill_a_writer(child_seed, messages, delay);
+    ASSERT_EQ(report.error, "") << "seed " << seed << ", crash point " << point;
+    commits += report.commits;
+    rewrites += report.rewrites;
+    if (report.committed) {
+      known = *report.committed;
+    }
+    table_state found;
+    std::string problem;
+    const bool read = read_table(directory_, found, problem);
+    const bool old_state = read && found == known;
+    const bool new_state = read && report.announced && found == *report.announced;
+    if (report.announced) {
+      ++in_flight;
+      ++in_flight_kinds[report.announced_kind];
+    }
+    if (!old_state && !new_state) {
+      ADD_FAILURE() << "seed " << seed << " (SR_CRASH_SEED), crash point " << point
+                    << ", child seed " << child_seed << ", killed after " << messages
+                    << " messages + " << delay
+                    << " us\n  found:     " << (read ? encode(found) : problem)
+                    << "\n  committed: " << encode(known) << "\n  announced: "
+                    << (report.announced ? report.announced_kind + " " + encode(*report.announced)
+                                         : "none")
+                    << "\n  files kept in " << keep_files(point);
+      break;
+    }
+    if (new_state && !old_state) {
+      ++new_state_found;
+      known = found;
+    }
+  }
+  std::cout << "crash points tried: " << point << " (seed " << seed
+            << "); a commit was in flight at " << in_flight << " of them (";
+  for (const auto &[kind, count] : in_flight_kinds) {
+    std::cout << kind << " " << count << ", ";
+  }
+  std::cout << "), the new state had reached the file at " << new_state_found
+            << "; commits reported " << commits << ", of which rewrote the file " << rewrites
+            << "\n";
+  RecordProperty("crash_points", point);
+  RecordProperty("commits_in_flight", in_flight);
+}
+
+}  // namespace

@@ -84,7 +84,7 @@ bool grow(sr_i_application_metadata_t *p_container) {
 // The value of `type` in the view asked for, checked as the gets require.
 int32_t value_in_view(const sr_i_application_metadata_t *p_container, uint32_t type,
                       uint32_t uncommitted_updates_visible, const qv_binary_t **p_p_value,
-                      std::source_location where) {
+                      sr_i_source_location where) {
   const element_t *p_element = find(p_container, type);
   if (p_element == nullptr) {
     return sr_i_raise(SR_E_NO_ROW_FOR_KEY, where);
@@ -225,7 +225,7 @@ int32_t sr_i_get_application_metadata_element(
     uint32_t uncommitted_updates_visible, uint32_t *p_length, void **p_p_data) {
   const qv_binary_t *p_value = nullptr;
   if (const int32_t rc = value_in_view(p_application_metadata, type, uncommitted_updates_visible,
-                                       &p_value, std::source_location::current());
+                                       &p_value, sr_i_source_location::current());
       rc != 0) {
     return rc;
   }
@@ -252,7 +252,7 @@ int32_t sr_i_get_application_metadata_element_binary(
     uint32_t uncommitted_updates_visible, qv_binary_t **p_p_application_data) {
   const qv_binary_t *p_value = nullptr;
   if (const int32_t rc = value_in_view(p_application_metadata, type, uncommitted_updates_visible,
-                                       &p_value, std::source_location::current());
+                                       &p_value, sr_i_source_location::current());
       rc != 0) {
     return rc;
   }

@@ -15,7 +15,6 @@
 #include <cstdlib>
 #include <cstring>
 #include <new>
-#include <source_location>
 #include <string>
 #include <vector>
 
@@ -24,6 +23,7 @@
 #include "sr_i_file_system.h"
 #include "sr_i_files.h"
 #include "sr_i_rows.h"
+#include "sr_i_source_location.h"
 #include "sr_i_table_file.h"
 #include "sr_i_transaction.h"
 
@@ -66,6 +66,20 @@ class record_writer {
   uint32_t batch_bytes_ = 0;
   uint32_t written_ = 0;
 };
+
+// Adds the commit record at file offset `offset`, behind the dead record
+// that keeps its type word inside one disk sector when it needs one; the
+// offset moves to the commit record's start.
+int32_t add_commit_record(record_writer &writer, uint32_t &offset,
+                          const std::vector<unsigned char> &commit_record) {
+  if (const uint32_t padding = sr_i_commit_record_padding(offset); padding != 0) {
+    if (const int32_t rc = writer.add(Sr_Commit_Record_Padding, padding); rc != 0) {
+      return rc;
+    }
+    offset += padding;
+  }
+  return writer.add(commit_record.data(), static_cast<uint32_t>(commit_record.size()));
+}
 
 // The disk form of a row record: header, then the memory record's data.
 // `replaced` is written over the row's first word when it is given.
@@ -137,10 +151,9 @@ int32_t append(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_r
     if (const int32_t rc = writer.add(deletion.data(), length); rc != 0) {
       return report_write_failure(p_table, rc);
     }
+    offset += length;
   }
-  if (const int32_t rc =
-          writer.add(commit_record.data(), static_cast<uint32_t>(commit_record.size()));
-      rc != 0) {
+  if (const int32_t rc = add_commit_record(writer, offset, commit_record); rc != 0) {
     return report_write_failure(p_table, rc);
   }
   int32_t rc = writer.finish();
@@ -220,9 +233,7 @@ int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned cha
     at += disk_length;
     offset += disk_length;
   }
-  if (const int32_t rc =
-          writer.add(commit_record.data(), static_cast<uint32_t>(commit_record.size()));
-      rc != 0) {
+  if (const int32_t rc = add_commit_record(writer, offset, commit_record); rc != 0) {
     return report_write_failure(p_table, rc);
   }
   int32_t rc = writer.finish();
@@ -304,13 +315,13 @@ int32_t commit_rewritten(sr_i_table_t *p_table) {
     rewrite_path = p_table->p_file_path;
   } catch (const std::bad_alloc &) {
     sr_i_set_data_path(p_table);
-    discard_rewrite_file(p_table);
     return sr_i_raise_no_memory();
   }
   sr_i_set_data_path(p_table);
+  // A failed rename leaves the rewrite file in place, complete and flushed:
+  // the commit can be tried again, or the abort removes it.
   if (Sr_File_System.rename(rewrite_path.c_str(), p_table->p_file_path) != 0) {
     const int error_number = errno;
-    discard_rewrite_file(p_table);
     if (error_number == EACCES) {
       return sr_i_raise(SR_E_ACCESS);
     }

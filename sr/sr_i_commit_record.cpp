@@ -33,6 +33,8 @@ const qv_binary_t *value_of(const sr_i_application_metadata_index_element_t &ele
 
 }  // namespace
 
+const uint32_t Sr_Commit_Record_Padding[3] = {Sr_Commit_Record_Padding_Length, 0, 0};
+
 int32_t sr_i_create_commit_record(const sr_i_application_metadata_t *p_application_metadata,
                                   uint64_t change_counter, std::vector<unsigned char> &record) {
   uint32_t elements = 0;

@@ -47,9 +47,13 @@ int32_t write_first_file(sr_i_table_t *p_table, uint32_t *p_written,
       rc != 0) {
     return rc;
   }
-  iovec records[2] = {{metadata.data(), metadata.size()}, {commit.data(), commit.size()}};
-  const auto total = static_cast<uint32_t>(metadata.size() + commit.size());
-  int32_t rc = sr_i_writev(p_table->rewrite_file_fd, records, 2, total, p_written);
+  // The commit record's type word must lie inside one disk sector.
+  const uint32_t padding = sr_i_commit_record_padding(static_cast<uint32_t>(metadata.size()));
+  iovec records[3] = {{metadata.data(), metadata.size()},
+                      {const_cast<uint32_t *>(Sr_Commit_Record_Padding), padding},
+                      {commit.data(), commit.size()}};
+  const auto total = static_cast<uint32_t>(metadata.size() + padding + commit.size());
+  int32_t rc = sr_i_writev(p_table->rewrite_file_fd, records, 3, total, p_written);
   if (rc == 0) {
     rc = sr_i_fdatasync(p_table->rewrite_file_fd);
   }
@@ -112,14 +116,14 @@ int32_t sr_i_create_persistent_table(sr_i_tree_t *p_tree, const char *p_registry
     return sr_i_raise_system_call("open", error_number);
   }
   // Another process creating the same table holds this lock: it wins, and
-  // its rewrite file is left alone.
+  // its rewrite file is left alone. Any other failure leaves no file.
   if (sr_i_lock_file(p_table->rewrite_file_fd, false) != 0) {
     const int error_number = errno;
-    sr_i_close_table(p_table);
     if (error_number == EAGAIN || error_number == EACCES || error_number == EEXIST) {
+      sr_i_close_table(p_table);
       return sr_i_raise(SR_E_TABLE_EXISTS);
     }
-    return sr_i_raise_system_call("lockf", error_number);
+    return give_up(p_table, sr_i_raise_system_call("lockf", error_number));
   }
   struct stat status;
   sr_i_set_data_path(p_table);

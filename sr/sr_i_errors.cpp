@@ -3,7 +3,7 @@
 // its text asks for, and writes an error trace record when the "Errors"
 // category is on.
 //
-// The raising site comes from std::source_location: the function name is cut
+// The raising site comes from sr_i_source_location: the function name is cut
 // out of the compiler's full signature, and the module path is the source
 // path relative to the project root (the build strips the root) without its
 // extension, e.g. "sr/sr_i_read_write_lock".
@@ -32,7 +32,7 @@ void copy_text(char *p_target, size_t size, std::string_view text) {
   p_target[length] = '\0';
 }
 
-raising_site site_of(const std::source_location &where) {
+raising_site site_of(const sr_i_source_location &where) {
   raising_site site{};
   // "int32_t sr_i_rw_lock_read(sr_i_read_write_lock_t*)" -> "sr_i_rw_lock_read"
   std::string_view function = where.function_name();
@@ -65,40 +65,40 @@ int32_t raise(int32_t code, int32_t number, const raising_site &site, Inserts...
 
 }  // namespace
 
-int32_t sr_i_raise(sr_i_plain_code code, std::source_location where) {
+int32_t sr_i_raise(sr_i_plain_code code, sr_i_source_location where) {
   return raise(code.code, sr_i_plain_message_number(code.code), site_of(where));
 }
 
-int32_t sr_i_raise_system_call(const char *p_call, int error_number, std::source_location where) {
+int32_t sr_i_raise_system_call(const char *p_call, int error_number, sr_i_source_location where) {
   const raising_site site = site_of(where);
   return raise(SR_E_SYSTEM_CALL, SR_I_MESSAGE_SYSTEM_CALL, site, p_call, error_number,
                site.function, site.line, site.module, Module_Version);
 }
 
 int32_t sr_i_raise_library_call(const char *p_function, int32_t result,
-                                std::source_location where) {
+                                sr_i_source_location where) {
   const raising_site site = site_of(where);
   return raise(SR_E_LIBRARY_CALL, SR_I_MESSAGE_LIBRARY_CALL, site, p_function,
                static_cast<int>(result), site.function, site.line, site.module, Module_Version);
 }
 
-int32_t sr_i_raise_no_memory(std::source_location where) {
+int32_t sr_i_raise_no_memory(sr_i_source_location where) {
   const raising_site site = site_of(where);
   return raise(SR_E_NO_MEMORY, SR_I_MESSAGE_NO_MEMORY, site, site.function, site.line, site.module,
                Module_Version);
 }
 
-int32_t sr_i_raise_internal(std::source_location where) {
+int32_t sr_i_raise_internal(sr_i_source_location where) {
   const raising_site site = site_of(where);
   return raise(SR_E_INTERNAL, SR_I_MESSAGE_INTERNAL, site, site.function, site.line, site.module,
                Module_Version);
 }
 
-int32_t sr_i_raise_invalid_path(const char *p_path, std::source_location where) {
+int32_t sr_i_raise_invalid_path(const char *p_path, sr_i_source_location where) {
   return raise(SR_E_INVALID_PATH, SR_I_MESSAGE_INVALID_PATH, site_of(where),
                p_path ? p_path : "<NULL POINTER>");
 }
 
-int32_t sr_i_raise_invalid_criteria(const char *p_criteria, std::source_location where) {
+int32_t sr_i_raise_invalid_criteria(const char *p_criteria, sr_i_source_location where) {
   return raise(SR_E_INVALID_CRITERIA, SR_I_MESSAGE_INVALID_CRITERIA, site_of(where), p_criteria);
 }

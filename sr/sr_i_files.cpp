@@ -18,11 +18,11 @@
 
 #include <cerrno>
 #include <cstdio>
-#include <source_location>
 
 #include "qv_sr.h"
 #include "sr_i_errors.h"
 #include "sr_i_file_system.h"
+#include "sr_i_source_location.h"
 #include "sr_i_trace.h"
 
 namespace {
@@ -47,7 +47,7 @@ auto call_retrying_interrupts(Call call, uint32_t &retries) {
 
 // The development record of an interrupted call; errno is kept for the
 // callers that hand it back.
-void trace_retries(uint32_t retries, std::source_location where = std::source_location::current()) {
+void trace_retries(uint32_t retries, sr_i_source_location where = sr_i_source_location::current()) {
   if (retries == 0) {
     return;
   }
@@ -62,7 +62,7 @@ void trace_retries(uint32_t retries, std::source_location where = std::source_lo
 // caller reports naming its file; anything else is raised as 10 from the
 // calling primitive.
 int32_t write_failure(const char *p_call, int error_number,
-                      std::source_location where = std::source_location::current()) {
+                      sr_i_source_location where = sr_i_source_location::current()) {
   if (error_number == ENOSPC) {
     return SR_E_FILESYSTEM_FULL;
   }
@@ -144,7 +144,7 @@ int32_t sr_i_fdatasync(int fd) {
         if (result == -1) {
           const int error_number = errno;
           sr_i_capture_errno("fdatasync", error_number,
-                             static_cast<int>(std::source_location::current().line()),
+                             static_cast<int>(sr_i_source_location::current().line()),
                              Module_Version);
           errno = error_number;
         }

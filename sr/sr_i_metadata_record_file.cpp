@@ -100,6 +100,23 @@ bool valid_disk_column(const unsigned char *p_descriptor, std::span<const unsign
   return true;
 }
 
+// Whether no two columns share a name (a table is never made with two).
+bool distinct_names(std::span<const unsigned char> disk, std::span<const unsigned char> area,
+                    uint32_t columns) {
+  auto name_of = [&](uint32_t column) {
+    const uint32_t offset = word_at(disk.data() + Disk_Header_Bytes + Disk_Column_Bytes * column);
+    return reinterpret_cast<const char *>(area.data() + offset);
+  };
+  for (uint32_t first = 0; first < columns; ++first) {
+    for (uint32_t second = first + 1; second < columns; ++second) {
+      if (std::strcmp(name_of(first), name_of(second)) == 0) {
+        return false;
+      }
+    }
+  }
+  return true;
+}
+
 }  // namespace
 
 int32_t sr_i_convert_metadata_memory_record_to_disk_record(const sr_i_table_t *p_table,
@@ -156,22 +173,23 @@ int32_t sr_i_convert_metadata_disk_record_to_memory_record(sr_i_table_t *p_table
       disk.subspan(Disk_Header_Bytes + size_t{Disk_Column_Bytes} * columns);
   // The default data runs from the start of the area to the first name.
   uint32_t default_area_end = static_cast<uint32_t>(area.size());
+  for (uint32_t column = 0; column < columns; ++column) {
+    default_area_end = std::min(
+        default_area_end, word_at(disk.data() + Disk_Header_Bytes + Disk_Column_Bytes * column));
+  }
+  // A type word becomes a qv_data_type_t only once it is known to be one.
   uint32_t counted_variable_columns = 0;
   for (uint32_t column = 0; column < columns; ++column) {
     const unsigned char *p_descriptor =
         disk.data() + Disk_Header_Bytes + Disk_Column_Bytes * column;
-    default_area_end = std::min(default_area_end, word_at(p_descriptor));
+    if (!valid_disk_column(p_descriptor, area, default_area_end)) {
+      return sr_i_raise(SR_E_TABLE_UNREADABLE);
+    }
     if (sr_i_is_variable_length(static_cast<qv_data_type_t>(word_at(p_descriptor + 4)))) {
       ++counted_variable_columns;
     }
   }
-  for (uint32_t column = 0; column < columns; ++column) {
-    if (!valid_disk_column(disk.data() + Disk_Header_Bytes + Disk_Column_Bytes * column, area,
-                           default_area_end)) {
-      return sr_i_raise(SR_E_TABLE_UNREADABLE);
-    }
-  }
-  if (counted_variable_columns != variable_columns) {
+  if (counted_variable_columns != variable_columns || !distinct_names(disk, area, columns)) {
     return sr_i_raise(SR_E_TABLE_UNREADABLE);
   }
 

@@ -34,7 +34,6 @@ namespace {
 // Room read beyond the measured length, to notice a file that grew.
 constexpr uint32_t Read_Margin = 4096;
 constexpr uint32_t Rows_Without_Estimate = 100;
-constexpr uint32_t Row_Word_Length = 4;  // the replaced offset in front of the slots
 
 uint32_t word_at(const std::vector<unsigned char> &bytes, size_t offset) {
   uint32_t word;
@@ -50,12 +49,22 @@ struct table_closer {
 // Whether the descriptor still refers to the file at the table's path. A
 // writer that waited for the lock may find that the holder replaced the
 // file (a rewrite renames a new file over it) while it waited.
-bool still_the_table_file(const sr_i_table_t *p_table, int fd) {
+// Returns 0 with `*p_same` set, or 10 (raised).
+int32_t check_still_the_table_file(const sr_i_table_t *p_table, int fd, bool *p_same) {
   struct stat opened {};
   struct stat current {};
-  return Sr_File_System.fstat(fd, &opened) == 0 &&
-         Sr_File_System.stat(p_table->p_file_path, &current) == 0 &&
-         opened.st_dev == current.st_dev && opened.st_ino == current.st_ino;
+  if (Sr_File_System.fstat(fd, &opened) != 0) {
+    return sr_i_raise_system_call("fstat", errno);
+  }
+  if (Sr_File_System.stat(p_table->p_file_path, &current) != 0) {
+    if (errno != ENOENT) {
+      return sr_i_raise_system_call("stat", errno);
+    }
+    *p_same = false;  // gone: opening again reports it
+    return 0;
+  }
+  *p_same = opened.st_dev == current.st_dev && opened.st_ino == current.st_ino;
+  return 0;
 }
 
 // Opens (and for writing locks) the table file.
@@ -83,8 +92,9 @@ int32_t open_table_file(sr_i_table_t *p_table, bool writable) {
     if (sr_i_lock_file(fd, true) != 0) {
       return sr_i_raise_system_call("lockf", errno);
     }
-    if (still_the_table_file(p_table, fd)) {
-      return 0;
+    bool same = false;
+    if (const int32_t rc = check_still_the_table_file(p_table, fd, &same); rc != 0 || same) {
+      return rc;
     }
     Sr_File_System.close(fd);
     p_table->file_fd = -1;

@@ -18,11 +18,11 @@
 
 #include <cassert>
 #include <cstdint>
-#include <source_location>
 
 #include "sr_i_application_metadata.h"
 #include "sr_i_hash_table.h"
 #include "sr_i_rows.h"
+#include "sr_i_source_location.h"
 #include "sr_i_table_file.h"
 #include "sr_i_trace.h"
 
@@ -37,7 +37,7 @@ unsigned int trace_address(const sr_i_table_t *p_table) {
 }
 
 void trace_apply(const sr_i_table_t *p_table, uint32_t rewrite,
-                 std::source_location where = std::source_location::current()) {
+                 sr_i_source_location where = sr_i_source_location::current()) {
   tr_record_fmt_string_1(
       Sr_Trace_Component, TR_DEVELOPMENT_RECORD_ID, "DV|APP|%.3d|%x|%u|%u|%u|%u|%u|%d|%d|%u",
       static_cast<int>(where.line()), trace_address(p_table), p_table->ready_for_commit,
@@ -48,7 +48,7 @@ void trace_apply(const sr_i_table_t *p_table, uint32_t rewrite,
 
 // Commit and abort records share their fields.
 void trace_step(const char *p_step, const sr_i_table_t *p_table,
-                std::source_location where = std::source_location::current()) {
+                sr_i_source_location where = sr_i_source_location::current()) {
   tr_record_fmt_string_1(
       Sr_Trace_Component, TR_DEVELOPMENT_RECORD_ID, "DV|%s|%.3d|%x|%u|%u|%u|%u|%u|%d|%d", p_step,
       static_cast<int>(where.line()), trace_address(p_table), p_table->ready_for_commit,

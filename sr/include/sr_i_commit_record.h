@@ -23,6 +23,22 @@ inline constexpr uint32_t Sr_Live_Commit_Record = 0xFFFFFFFFu;
 inline constexpr uint32_t Sr_Empty_Commit_Record_Length = 24;
 
 /*
+ * The next commit overwrites a commit record's type word in place, and a
+ * power failure can tear a write that straddles two disk sectors. A commit
+ * record whose type word would cross a sector boundary is therefore put
+ * behind a dead record (Sr_Commit_Record_Padding, type 0, which readers
+ * skip). Returns the padding a commit record starting at `offset` needs:
+ * 0 or the dead record's length.
+ */
+inline constexpr uint32_t Sr_Disk_Sector = 512;
+inline constexpr uint32_t Sr_Commit_Record_Padding_Length = 12;
+extern const uint32_t Sr_Commit_Record_Padding[3];
+constexpr uint32_t sr_i_commit_record_padding(uint32_t offset) {
+  const uint32_t type_word = (offset + 8) % Sr_Disk_Sector;
+  return type_word + 4 > Sr_Disk_Sector ? Sr_Commit_Record_Padding_Length : 0;
+}
+
+/*
  * The commit record for `change_counter` with every element of the
  * container (its applied value, else its committed one) in `record`.
  * Returns 0 or 12 (raised).

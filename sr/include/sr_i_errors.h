@@ -5,16 +5,16 @@
  * further up pass the code on without raising again.
  *
  * The raising site (function, line, module path) is taken from the call
- * site by std::source_location, so no call passes __LINE__ by hand.
+ * site by sr_i_source_location, so no call passes __LINE__ by hand.
  */
 #ifndef SR_I_ERRORS_H
 #define SR_I_ERRORS_H
 
 #include <cstdint>
-#include <source_location>
 #include <string>
 
 #include "qv_sr.h"
+#include "sr_i_source_location.h"
 
 /* The catalog of the registry's messages and its message set. */
 inline constexpr const char *Sr_Message_Catalog = "qv_sr.cat";
@@ -61,24 +61,24 @@ struct sr_i_plain_code {
 
 /* Each returns the code it raised. */
 int32_t sr_i_raise(sr_i_plain_code code,
-                   std::source_location where = std::source_location::current());
+                   sr_i_source_location where = sr_i_source_location::current());
 /* 10: a system or pthread call returned `error_number`. */
 int32_t sr_i_raise_system_call(const char *p_call, int error_number,
-                               std::source_location where = std::source_location::current());
+                               sr_i_source_location where = sr_i_source_location::current());
 /* 11: a companion library function (named without its "_1") returned `result`. */
 int32_t sr_i_raise_library_call(const char *p_function, int32_t result,
-                                std::source_location where = std::source_location::current());
+                                sr_i_source_location where = sr_i_source_location::current());
 /* 12 */
-int32_t sr_i_raise_no_memory(std::source_location where = std::source_location::current());
+int32_t sr_i_raise_no_memory(sr_i_source_location where = sr_i_source_location::current());
 /* 15 */
-int32_t sr_i_raise_internal(std::source_location where = std::source_location::current());
+int32_t sr_i_raise_internal(sr_i_source_location where = sr_i_source_location::current());
 /* 102: `p_path` may be null. */
 int32_t sr_i_raise_invalid_path(const char *p_path,
-                                std::source_location where = std::source_location::current());
+                                sr_i_source_location where = sr_i_source_location::current());
 /* 109: a replacement variable of the criteria format `p_criteria` (the
  * whole format is the insert) has no known type. */
 int32_t sr_i_raise_invalid_criteria(const char *p_criteria,
-                                    std::source_location where = std::source_location::current());
+                                    sr_i_source_location where = sr_i_source_location::current());
 
 /*
  * 16: a write found the filesystem full. Names the filesystem holding

@@ -24,11 +24,11 @@
 #include <atomic>
 #include <cstdint>
 #include <new>
-#include <source_location>
 
 #include "qv_cu.h"
 #include "qv_sr.h"
 #include "sr_i_errors.h"
+#include "sr_i_source_location.h"
 #include "sr_i_trace.h"
 
 /* What the frame needs to know of an exported function. */
@@ -76,7 +76,7 @@ class sr_i_fork_mutex_guard {
  */
 template <typename Body>
 int32_t sr_i_run_entry_point(const sr_i_entry_point_t &entry, Body &&body,
-                             std::source_location where = std::source_location::current()) {
+                             sr_i_source_location where = sr_i_source_location::current()) {
   if (entry.changes_state && sr_i_in_child_process()) {
     return SR_E_INTERNAL;
   }

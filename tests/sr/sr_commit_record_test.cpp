@@ -94,4 +94,16 @@ TEST(CommitRecord, RecordsThatDoNotHoldTogetherAreUnreadable) {
   }
 }
 
+TEST(CommitRecord, ItsTypeWordNeverStraddlesADiskSector) {
+  for (uint32_t offset = 0; offset < 3 * 512; ++offset) {
+    const uint32_t start = offset + sr_i_commit_record_padding(offset);
+    const uint32_t type_word = start + 8;
+    EXPECT_EQ(type_word / 512, (type_word + 3) / 512) << offset;
+  }
+  EXPECT_EQ(sr_i_commit_record_padding(500), 0u);
+  EXPECT_EQ(sr_i_commit_record_padding(501), 12u);
+  EXPECT_EQ(sr_i_commit_record_padding(503), 12u);
+  EXPECT_EQ(sr_i_commit_record_padding(504), 0u);
+}
+
 }  // namespace

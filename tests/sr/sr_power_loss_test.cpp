@@ -1,0 +1,725 @@
+// Persistent tables after a power loss at every step of their writing. The
+// file-system door is replaced by one that keeps, per file, the bytes that
+// a flush made durable ("on the platter") apart from the bytes written
+// since. A scripted run of transactions is repeated once per cut point;
+// the power goes off before the chosen write, flush, truncation, rename or
+// unlink, and what the platter then holds is opened as the table: it must
+// be the last committed state, or the one being committed at the cut. The
+// table must also take new transactions from there.
+//
+// What survives the cut is modelled three ways: only the flushed bytes;
+// every byte written (as after a crash of the process alone); and a random
+// choice of the unflushed 512-byte sectors and truncations, since a disk
+// may write back its cache in any order and tear a write between sectors.
+// Creating, renaming and unlinking a file are durable at once, which is
+// what a journaling file system gives for metadata; a file's contents are
+// durable only up to its last flush.
+
+#include <dirent.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <iostream>
+#include <iterator>
+#include <map>
+#include <optional>
+#include <random>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "qv_sr.h"
+#include "sr_i_file_system.h"
+#include "sr_i_table.h"
+#include "sr_i_transaction.h"
+
+namespace {
+
+constexpr int32_t Open_For_Reading = 1;
+constexpr int32_t Open_Implicit = 2;
+constexpr int32_t Open_Explicit = 6;
+constexpr const char *Table_Path = "/disk/power/t";
+// The script's seed; SR_POWER_LOSS_SEED runs another script.
+uint32_t script_seed() {
+  const char *p_seed = std::getenv("SR_POWER_LOSS_SEED");
+  return p_seed != nullptr ? static_cast<uint32_t>(std::strtoul(p_seed, nullptr, 10)) : 5;
+}
+// Every cut point runs the whole script again: the cost grows with the
+// square of its length.
+#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
+constexpr int Script_Steps = 50;
+#else
+constexpr int Script_Steps = 70;
+#endif
+constexpr size_t Fewest_Rows = 12;
+constexpr size_t Most_Rows = 50;
+constexpr size_t Sector = 512;
+
+// ---- The platter ------------------------------------------------------
+
+struct unflushed_change {
+  bool truncation;
+  off_t offset;  // the new length of a truncation
+  std::string bytes;
+};
+
+// What survives a power loss, of everything written.
+enum class survival { flushed_only, random_sectors, everything };
+constexpr survival Survivals[] = {survival::flushed_only, survival::random_sectors,
+                                  survival::everything};
+
+const char *name_of(survival kind) {
+  switch (kind) {
+    case survival::flushed_only:
+      return "flushed only";
+    case survival::random_sectors:
+      return "random sectors";
+    default:
+      return "everything";
+  }
+}
+
+// A directory's files as the platter holds them, by name.
+using image = std::map<std::string, std::string>;
+
+struct platter {
+  std::string directory;
+  std::map<ino_t, std::string> durable;
+  std::map<ino_t, std::vector<unflushed_change>> unflushed;
+  uint64_t calls = 0;
+  uint64_t renames = 0;
+  uint64_t cut = UINT64_MAX;
+  std::map<survival, image> images;
+  std::string problem;  // the model disagrees with the real files
+};
+
+platter *P_Platter = nullptr;
+
+ino_t inode_of(int fd) {
+  struct stat status {};
+  ::fstat(fd, &status);
+  return status.st_ino;
+}
+
+std::string file_contents(const std::string &path) {
+  std::ifstream in(path, std::ios::binary);
+  return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+}
+
+std::string file_contents(int fd) {
+  std::string bytes(static_cast<size_t>(::lseek(fd, 0, SEEK_END)), '\0');
+  size_t done = 0;
+  while (done < bytes.size()) {
+    const ssize_t got =
+        ::pread(fd, bytes.data() + done, bytes.size() - done, static_cast<off_t>(done));
+    if (got <= 0) {
+      break;
+    }
+    done += static_cast<size_t>(got);
+  }
+  return bytes;
+}
+
+void put_bytes(std::string &file, off_t offset, const std::string &bytes) {
+  const auto at = static_cast<size_t>(offset);
+  if (file.size() < at + bytes.size()) {
+    file.resize(at + bytes.size(), '\0');
+  }
+  file.replace(at, bytes.size(), bytes);
+}
+
+// The durable bytes of a file with the unflushed changes that `keep` lets
+// through, in the order they were made.
+template <typename Keep>
+std::string surviving(std::string file, const std::vector<unflushed_change> &changes, Keep keep) {
+  for (const unflushed_change &change : changes) {
+    if (change.truncation) {
+      if (keep()) {
+        file.resize(static_cast<size_t>(change.offset), '\0');
+      }
+      continue;
+    }
+    // Sector by sector: a write may be torn at any sector boundary.
+    size_t from = 0;
+    while (from < change.bytes.size()) {
+      const size_t position = static_cast<size_t>(change.offset) + from;
+      const size_t to = std::min(change.bytes.size(), from + Sector - position % Sector);
+      if (keep()) {
+        put_bytes(file, static_cast<off_t>(position), change.bytes.substr(from, to - from));
+      }
+      from = to;
+    }
+  }
+  return file;
+}
+
+// The power goes off: what each file of the directory would hold afterwards.
+void lose_power() {
+  std::mt19937 rng(static_cast<uint32_t>(P_Platter->cut));
+  DIR *p_directory = ::opendir(P_Platter->directory.c_str());
+  while (const dirent *p_entry = ::readdir(p_directory)) {
+    const std::string name = p_entry->d_name;
+    struct stat status {};
+    const std::string path = P_Platter->directory + "/" + name;
+    if (::stat(path.c_str(), &status) != 0 || !S_ISREG(status.st_mode)) {
+      continue;
+    }
+    const std::string &flushed = P_Platter->durable[status.st_ino];
+    const std::vector<unflushed_change> &changes = P_Platter->unflushed[status.st_ino];
+    const std::string everything = surviving(flushed, changes, [] { return true; });
+    if (everything != file_contents(path)) {
+      P_Platter->problem = "the platter model lost track of " + name;
+    }
+    P_Platter->images[survival::flushed_only][name] = flushed;
+    P_Platter->images[survival::everything][name] = everything;
+    P_Platter->images[survival::random_sectors][name] =
+        surviving(flushed, changes, [&] { return rng() % 2 == 0; });
+  }
+  ::closedir(p_directory);
+}
+
+void count_call() {
+  if (P_Platter->calls++ == P_Platter->cut) {
+    lose_power();
+  }
+}
+
+// A file created now starts out empty on the platter (an inode number
+// can come back for a new file once the old one is gone).
+int platter_open(const char *p_path, int flags, mode_t mode) {
+  struct stat status {};
+  const bool existed = ::stat(p_path, &status) == 0;
+  const int fd = Sr_Default_File_System.open(p_path, flags, mode);
+  if (fd >= 0 && !existed) {
+    const ino_t inode = inode_of(fd);
+    P_Platter->durable[inode].clear();
+    P_Platter->unflushed.erase(inode);
+  }
+  return fd;
+}
+
+ssize_t platter_write(int fd, const void *p_buffer, size_t length) {
+  count_call();
+  const off_t offset = ::lseek(fd, 0, SEEK_CUR);
+  const ssize_t written = Sr_Default_File_System.write(fd, p_buffer, length);
+  if (written > 0) {
+    P_Platter->unflushed[inode_of(fd)].push_back(
+        {false, offset, std::string(static_cast<const char *>(p_buffer), written)});
+  }
+  return written;
+}
+
+ssize_t platter_writev(int fd, const struct iovec *p_io_vector, int count) {
+  count_call();
+  const off_t offset = ::lseek(fd, 0, SEEK_CUR);
+  const ssize_t written = Sr_Default_File_System.writev(fd, p_io_vector, count);
+  if (written > 0) {
+    std::string bytes;
+    for (int at = 0; at < count; ++at) {
+      bytes.append(static_cast<const char *>(p_io_vector[at].iov_base), p_io_vector[at].iov_len);
+    }
+    bytes.resize(static_cast<size_t>(written));
+    P_Platter->unflushed[inode_of(fd)].push_back({false, offset, bytes});
+  }
+  return written;
+}
+
+// The platter takes the file as it is now. The real flush is left out:
+// nothing here survives a real power loss, and the runs are many.
+int platter_fsync(int fd) {
+  count_call();
+  const ino_t inode = inode_of(fd);
+  P_Platter->durable[inode] = file_contents(fd);
+  P_Platter->unflushed.erase(inode);
+  return 0;
+}
+
+int platter_ftruncate(int fd, off_t length) {
+  count_call();
+  const int result = Sr_Default_File_System.ftruncate(fd, length);
+  if (result == 0) {
+    P_Platter->unflushed[inode_of(fd)].push_back({true, length, {}});
+  }
+  return result;
+}
+
+int platter_rename(const char *p_from, const char *p_to) {
+  count_call();
+  ++P_Platter->renames;
+  return Sr_Default_File_System.rename(p_from, p_to);
+}
+
+int platter_unlink(const char *p_path) {
+  count_call();
+  return Sr_Default_File_System.unlink(p_path);
+}
+
+// ---- The table and its script ------------------------------------------
+
+struct table_state {
+  bool exists = false;
+  uint64_t counter = 0;
+  std::map<int32_t, int32_t> rows;  // Version by Id
+  bool operator==(const table_state &) const = default;
+};
+
+std::string describe(const table_state &state) {
+  if (!state.exists) {
+    return "no table";
+  }
+  std::string text = "counter " + std::to_string(state.counter) + ":";
+  for (const auto &[id, version] : state.rows) {
+    text += " " + std::to_string(id) + "v" + std::to_string(version);
+  }
+  return text;
+}
+
+// Different for every version of every row; large enough that the file
+// soon passes the size at which rewrites start.
+std::string payload(int32_t id, int32_t version) {
+  const uint32_t hash =
+      static_cast<uint32_t>(id) * 2654435761u ^ static_cast<uint32_t>(version) * 40503u;
+  std::string text = std::to_string(id) + "/" + std::to_string(version) + ":";
+  const size_t length = 40 + hash % 700;
+  for (size_t at = text.size(); at < length; ++at) {
+    text.push_back(static_cast<char>('a' + (hash + at * 7) % 26));
+  }
+  return text;
+}
+
+// Rows are found by key through a key hash table: without one a new key
+// is checked by a scan that refuses it whenever a deleted row left a free
+// entry before the last live row.
+constexpr uint32_t Hash_Buckets = 64;
+
+uint32_t hash_id(const void *p_key) {
+  int32_t id;
+  std::memcpy(&id, p_key, sizeof id);
+  return static_cast<uint32_t>(id) % Hash_Buckets;
+}
+
+int32_t compare_ids(const void *p_stored_key, const void *p_key) {
+  return std::memcmp(p_stored_key, p_key, sizeof(int32_t)) == 0 ? 0 : 1;
+}
+
+qv_value_t int32_value(int32_t number) {
+  qv_value_t value{};
+  value.val_int32 = number;
+  return value;
+}
+
+int32_t add_row(sr_opaque_handle_t table, int32_t id, int32_t version) {
+  qv_value_t key = int32_value(id);
+  qv_value_t number = int32_value(version);
+  const std::string text = payload(id, version);
+  qv_value_t body{};
+  body.ptr_char = const_cast<char *>(text.c_str());
+  const char *names[] = {"Id", "Version", "Payload"};
+  qv_value_t *values[] = {&key, &number, &body};
+  return sr_add_row_1(table, names, values, 3);
+}
+
+int32_t set_row(sr_opaque_handle_t table, int32_t id, int32_t version) {
+  qv_value_t number = int32_value(version);
+  const std::string text = payload(id, version);
+  qv_value_t body{};
+  body.ptr_char = const_cast<char *>(text.c_str());
+  const char *names[] = {"Version", "Payload"};
+  qv_value_t *values[] = {&number, &body};
+  return sr_set_fields_by_key_1(table, int32_value(id), names, values, 2);
+}
+
+int32_t open_writable(sr_opaque_handle_t tree, int32_t mode, sr_opaque_handle_t *p_table) {
+  return sr_open_hashed_key_table_1(tree, Table_Path, mode, Hash_Buckets, hash_id, compare_ids,
+                                    p_table);
+}
+
+// The committed state of the table in `directory`, as a new program opens
+// it; an empty string, or what went wrong.
+std::string read_table(const std::string &directory, table_state &state) {
+  state = table_state{};
+  sr_opaque_handle_t tree = nullptr;
+  if (sr_open_tree_1(&tree, 0, 0) != 0 ||
+      sr_mount_local_tree_1(tree, "/disk", directory.c_str(), 0) != 0) {
+    return "no tree";
+  }
+  std::string problem;
+  sr_opaque_handle_t table = nullptr;
+  sr_table_metadata_t *p_metadata = nullptr;
+  if (const int32_t rc = sr_open_table_1(tree, Table_Path, Open_For_Reading, &table); rc != 0) {
+    if (rc != SR_E_NO_TABLE) {
+      problem = "sr_open_table_1 gave " + std::to_string(rc);
+    }
+  } else if (sr_get_table_metadata_1(table, 0, &p_metadata) != 0) {
+    problem = "no metadata";
+  } else {
+    state.exists = true;
+    state.counter = p_metadata->table_change_counter;
+    for (uint32_t at = 0; at < p_metadata->number_of_rows && problem.empty(); ++at) {
+      qv_value_t id{};
+      qv_value_t version{};
+      qv_value_t text{};
+      const char *names[] = {"Id", "Version", "Payload"};
+      qv_value_t *values[] = {&id, &version, &text};
+      if (const int32_t rc =
+              sr_get_fields_by_index_1(table, static_cast<int32_t>(at), names, values, 3);
+          rc != 0) {
+        problem = "row " + std::to_string(at) + " gave " + std::to_string(rc);
+        break;
+      }
+      if (text.ptr_char != payload(id.val_int32, version.val_int32)) {
+        problem = "row " + std::to_string(id.val_int32) + " has a wrong payload";
+      } else if (!state.rows.emplace(id.val_int32, version.val_int32).second) {
+        problem = "row " + std::to_string(id.val_int32) + " is there twice";
+      }
+      std::free(text.ptr_char);
+    }
+    sr_free_table_metadata_1(p_metadata);
+  }
+  sr_close_tree_1(tree);
+  return problem;
+}
+
+// A commit in the script: the calls at positions [first_call, end_call)
+// of the run carry the table from the state before to `state`.
+struct commit_window {
+  uint64_t first_call;
+  uint64_t end_call;
+  table_state state;
+  bool operator==(const commit_window &) const = default;
+};
+
+// The scripted run: creation, then phases of single changes through an
+// implicitly controlled handle and of multi-row transactions through an
+// explicitly controlled one, appended or rewritten, committed or aborted.
+// The same seed gives the same calls in the same order on every run.
+class script {
+ public:
+  explicit script(const std::string &directory) : directory_(directory), rng_(script_seed()) {}
+
+  // The commits of the run; `problem` set when a call failed.
+  std::vector<commit_window> run(std::string &problem) {
+    check(sr_open_tree_1(&tree_, 0, 0), "sr_open_tree_1");
+    check(sr_mount_local_tree_1(tree_, "/disk", directory_.c_str(), 0), "sr_mount_local_tree_1");
+    state_.exists = true;
+    state_.counter = 1;
+    const uint64_t first = P_Platter->calls;
+    sr_column_t columns[3] = {};
+    columns[0] = {const_cast<char *>("Id"), QV_INT32, SR_PRIMARY_KEY, 0, nullptr, {}};
+    columns[1] = {const_cast<char *>("Version"), QV_INT32, SR_STANDARD, 0, nullptr, {}};
+    columns[2] = {const_cast<char *>("Payload"), QV_CHAR_PTR, SR_STANDARD, 0, nullptr, {}};
+    check(sr_create_hashed_key_table_1(tree_, Table_Path, columns, 3, 0, Hash_Buckets, hash_id,
+                                       compare_ids, &table_),
+          "sr_create_hashed_key_table_1");
+    windows_.push_back({first, P_Platter->calls, state_});
+    bool implicit = true;
+    for (int step = 0; step < Script_Steps && problem_.empty(); ++step) {
+      if (step % 8 == 0) {
+        implicit = !implicit;
+        check(sr_close_table_1(table_), "sr_close_table_1");
+        check(open_writable(tree_, implicit ? Open_Implicit : Open_Explicit, &table_), "open");
+      }
+      if (problem_.empty()) {
+        implicit ? implicit_change() : explicit_transaction();
+      }
+    }
+    sr_close_tree_1(tree_);
+    problem = problem_;
+    return windows_;
+  }
+
+ private:
+  void check(int32_t rc, const char *p_call) {
+    if (rc != 0 && problem_.empty()) {
+      problem_ = std::string(p_call) + " gave " + std::to_string(rc);
+    }
+  }
+
+  int32_t any_row(const table_state &state) {
+    auto row = state.rows.begin();
+    std::advance(row, rng_() % state.rows.size());
+    return row->first;
+  }
+
+  enum class change { add, set, remove };
+  change pick_change(const table_state &state) {
+    if (state.rows.size() < Fewest_Rows) {
+      return change::add;
+    }
+    if (state.rows.size() > Most_Rows) {
+      return change::remove;
+    }
+    return static_cast<change>(rng_() % 3);
+  }
+
+  void implicit_change() {
+    table_state next = state_;
+    ++next.counter;
+    const uint64_t first = P_Platter->calls;
+    switch (pick_change(state_)) {
+      case change::add:
+        next.rows[next_id_] = 1;
+        check(add_row(table_, next_id_++, 1), "sr_add_row_1");
+        break;
+      case change::set: {
+        const int32_t id = any_row(state_);
+        check(set_row(table_, id, ++next.rows[id]), "sr_set_fields_by_key_1");
+        break;
+      }
+      case change::remove: {
+        const int32_t id = any_row(state_);
+        next.rows.erase(id);
+        check(sr_delete_rows_1(table_, "Id == $i", id), "sr_delete_rows_1");
+        break;
+      }
+    }
+    commit(first, next);
+  }
+
+  void explicit_transaction() {
+    table_state next = state_;
+    std::set<int32_t> deleted;
+    for (uint32_t changes = 1 + rng_() % 6; changes > 0; --changes) {
+      if (!deleted.empty() && rng_() % 4 == 0) {
+        const int32_t id = *deleted.begin();  // deleted in this transaction, back again
+        deleted.erase(deleted.begin());
+        const auto old = state_.rows.find(id);
+        next.rows[id] = old == state_.rows.end() ? 1 : old->second + 1;
+        check(add_row(table_, id, next.rows[id]), "sr_add_row_1");
+        continue;
+      }
+      switch (pick_change(next)) {
+        case change::add:
+          next.rows[next_id_] = 1;
+          check(add_row(table_, next_id_++, 1), "sr_add_row_1");
+          break;
+        case change::set: {
+          const int32_t id = any_row(next);
+          check(set_row(table_, id, ++next.rows[id]), "sr_set_fields_by_key_1");
+          break;
+        }
+        case change::remove: {
+          const int32_t id = any_row(next);
+          next.rows.erase(id);
+          deleted.insert(id);
+          check(sr_delete_rows_1(table_, "Id == $i", id), "sr_delete_rows_1");
+          break;
+        }
+      }
+    }
+    const uint64_t counter = rng_() % 2 ? 0 : state_.counter + 2;
+    next.counter = counter == 0 ? state_.counter + 1 : counter;
+    auto *p_table = static_cast<sr_i_table_t *>(table_);
+    const uint64_t first = P_Platter->calls;
+    switch (rng_() % 8) {
+      case 0:  // appended, then cut off again
+        check(sr_apply_1(table_, counter), "sr_apply_1");
+        check(sr_abort_1(table_), "sr_abort_1");
+        return;
+      case 1:  // a new file written, then removed
+        check(sr_i_apply(p_table, 1, counter), "sr_i_apply");
+        check(sr_abort_1(table_), "sr_abort_1");
+        return;
+      case 2:
+      case 3:
+        check(sr_i_apply(p_table, 1, counter), "sr_i_apply");
+        break;
+      default:  // appended, or rewritten when the file is mostly dead records
+        check(sr_apply_1(table_, counter), "sr_apply_1");
+        break;
+    }
+    check(sr_commit_1(table_), "sr_commit_1");
+    commit(first, next);
+  }
+
+  void commit(uint64_t first, const table_state &next) {
+    state_ = next;
+    windows_.push_back({first, P_Platter->calls, next});
+  }
+
+  std::string directory_;
+  std::mt19937 rng_;
+  sr_opaque_handle_t tree_ = nullptr;
+  sr_opaque_handle_t table_ = nullptr;
+  table_state state_;
+  std::vector<commit_window> windows_;
+  int32_t next_id_ = 1;
+  std::string problem_;
+};
+
+// The states a cut before call `cut` may leave: the last commit that
+// finished before it, and the one under way at it.
+std::vector<table_state> states_at(const std::vector<commit_window> &windows, uint64_t cut) {
+  std::vector<table_state> states(1);  // before the creation: no table
+  for (const commit_window &window : windows) {
+    if (window.end_call <= cut) {
+      states.assign(1, window.state);
+    } else if (window.first_call < cut) {
+      states.push_back(window.state);
+    }
+  }
+  return states;
+}
+
+class PowerLoss : public ::testing::Test {
+ protected:
+  void TearDown() override {
+    Sr_File_System = Sr_Default_File_System;
+    for (const std::string &directory : directories_) {
+      std::filesystem::remove_all(directory);
+    }
+  }
+
+  // In memory where the system offers it: the platter is modelled anyway,
+  // and the runs create and remove many small directories.
+  std::string new_directory() {
+    for (const char *p_place : {"/dev/shm", "/tmp"}) {
+      std::string pattern = std::string(p_place) + "/qv_power_XXXXXX";
+      if (mkdtemp(pattern.data()) != nullptr) {
+        directories_.push_back(pattern);
+        return pattern;
+      }
+    }
+    ADD_FAILURE() << "no temporary directory";
+    return "/nonexistent";
+  }
+
+  // The restored images and what is written to them afterwards need not
+  // survive a real power loss: no real flushes, which would only slow the
+  // many runs down.
+  static int no_flush(int) { return 0; }
+
+  // Runs the script with the power going off before call `cut`.
+  std::vector<commit_window> run_script(platter &disk, std::string &problem) {
+    disk.directory = new_directory();
+    P_Platter = &disk;
+    Sr_File_System.open = platter_open;
+    Sr_File_System.write = platter_write;
+    Sr_File_System.writev = platter_writev;
+    Sr_File_System.fsync = platter_fsync;
+    Sr_File_System.ftruncate = platter_ftruncate;
+    Sr_File_System.rename = platter_rename;
+    Sr_File_System.unlink = platter_unlink;
+    std::vector<commit_window> windows = script(disk.directory).run(problem);
+    Sr_File_System = Sr_Default_File_System;
+    Sr_File_System.fsync = no_flush;
+    P_Platter = nullptr;
+    return windows;
+  }
+
+  // Writes an image into a directory of its own.
+  std::string restore(const image &files) {
+    const std::string directory = new_directory();
+    for (const auto &[name, bytes] : files) {
+      std::ofstream(directory + "/" + name, std::ios::binary) << bytes;
+    }
+    return directory;
+  }
+
+  // After the power is back a writer carries on: an appended row, then a
+  // change written by a rewrite, each of them found by the next reader.
+  std::string carry_on(const std::string &directory, table_state state) {
+    sr_opaque_handle_t tree = nullptr;
+    sr_opaque_handle_t table = nullptr;
+    if (sr_open_tree_1(&tree, 0, 0) != 0 ||
+        sr_mount_local_tree_1(tree, "/disk", directory.c_str(), 0) != 0 ||
+        open_writable(tree, Open_Implicit, &table) != 0 || add_row(table, 100000, 1) != 0) {
+      sr_close_tree_1(tree);
+      return "the implicit addition failed";
+    }
+    sr_close_table_1(table);
+    state.rows[100000] = 1;
+    ++state.counter;
+    table_state found;
+    std::string problem = read_table(directory, found);
+    if (problem.empty() && !(found == state)) {
+      problem = "after an appended row: " + describe(found);
+    }
+    if (problem.empty() &&
+        (open_writable(tree, Open_Explicit, &table) != 0 || set_row(table, 100000, 2) != 0 ||
+         sr_i_apply(static_cast<sr_i_table_t *>(table), 1, 0) != 0 || sr_commit_1(table) != 0)) {
+      problem = "the rewrite failed";
+    }
+    sr_close_tree_1(tree);
+    state.rows[100000] = 2;
+    ++state.counter;
+    if (problem.empty() && (problem = read_table(directory, found)).empty() && !(found == state)) {
+      problem = "after a rewrite: " + describe(found);
+    }
+    return problem;
+  }
+
+  std::vector<std::string> directories_;
+};
+
+TEST_F(PowerLoss, EveryCutLeavesACommittedStateThatTakesNewTransactions) {
+  // A first run counts the calls and places the commits among them.
+  platter counting;
+  std::string problem;
+  const std::vector<commit_window> windows = run_script(counting, problem);
+  ASSERT_EQ(problem, "");
+  const uint64_t total_calls = counting.calls;
+  ASSERT_GT(total_calls, 0u);
+  int images_checked = 0;
+  int new_states = 0;
+  for (uint64_t cut = 0; cut <= total_calls; ++cut) {
+    platter disk;
+    disk.cut = cut;
+    const std::vector<commit_window> again = run_script(disk, problem);
+    ASSERT_EQ(problem, "") << "cut " << cut;
+    ASSERT_TRUE(disk.calls == total_calls && again == windows) << "the run is not repeatable";
+    ASSERT_EQ(disk.problem, "") << "cut " << cut;
+    if (cut == total_calls) {
+      P_Platter = &disk;  // after the last call: the power goes off at rest
+      lose_power();
+      P_Platter = nullptr;
+    }
+    const std::vector<table_state> allowed = states_at(windows, cut);
+    std::vector<image> opened;
+    for (const survival kind : Survivals) {
+      if (std::find(opened.begin(), opened.end(), disk.images[kind]) != opened.end()) {
+        continue;
+      }
+      opened.push_back(disk.images[kind]);
+      const std::string directory = restore(disk.images[kind]);
+      table_state found;
+      problem = read_table(directory, found);
+      if (problem.empty() && std::find(allowed.begin(), allowed.end(), found) == allowed.end()) {
+        problem = "found " + describe(found);
+      }
+      if (problem.empty() && found.exists) {
+        problem = carry_on(directory, found);
+      }
+      if (!problem.empty()) {
+        directories_.pop_back();  // kept for a look
+        std::string expected;
+        for (const table_state &state : allowed) {
+          expected += "\n  or " + describe(state);
+        }
+        FAIL() << "script seed " << script_seed()
+               << " (SR_POWER_LOSS_SEED), power lost before call " << cut << " of " << total_calls
+               << ", keeping " << name_of(kind) << ": " << problem << "\n  expected" << expected
+               << "\n  image kept in " << directory;
+      }
+      new_states += allowed.size() > 1 && found == allowed.back() ? 1 : 0;
+      std::filesystem::remove_all(directory);
+      directories_.pop_back();
+      ++images_checked;
+    }
+    std::filesystem::remove_all(disk.directory);
+    directories_.erase(std::find(directories_.begin(), directories_.end(), disk.directory));
+  }
+  std::cout << "cut points tried: " << total_calls + 1 << " (script seed " << script_seed() << ", "
+            << windows.size() << " commits in the script, " << counting.renames - 1
+            << " of them by rewriting the file), images opened: " << images_checked
+            << ", of which showed the commit in flight as done: " << new_states << "\n";
+  RecordProperty("cut_points", static_cast<int>(total_calls + 1));
+}
+
+}  // namespace

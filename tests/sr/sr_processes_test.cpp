@@ -1,0 +1,375 @@
+// Persistent tables shared by processes. Writers in different processes
+// are serialised by the lock on the table file: each one waits in its open
+// until the other has closed the table, and then reads what the other
+// committed, so no update is lost. A reader takes no lock and, while a
+// writer appends and rewrites, only ever finds committed states.
+
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <iostream>
+#include <map>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "qv_sr.h"
+#include "sr_i_frame.h"
+#include "sr_i_table.h"
+#include "sr_i_transaction.h"
+
+namespace {
+
+constexpr int32_t Open_For_Reading = 1;
+constexpr int32_t Open_Implicit = 2;
+constexpr int32_t Open_Explicit = 6;
+constexpr const char *Table_Path = "/disk/shared/t";
+constexpr const char *Table_File = "shared,t";
+
+// Rows are found by key through a key hash table: without one a new key
+// is checked by a scan that refuses it whenever a deleted row left a free
+// entry before the last live row.
+constexpr uint32_t Hash_Buckets = 64;
+
+uint32_t hash_id(const void *p_key) {
+  int32_t id;
+  std::memcpy(&id, p_key, sizeof id);
+  return static_cast<uint32_t>(id) % Hash_Buckets;
+}
+
+int32_t compare_ids(const void *p_stored_key, const void *p_key) {
+  return std::memcmp(p_stored_key, p_key, sizeof(int32_t)) == 0 ? 0 : 1;
+}
+
+std::string payload(int32_t id, int32_t version, size_t length) {
+  std::string text = std::to_string(id) + "/" + std::to_string(version) + ":";
+  for (size_t at = text.size(); at < length; ++at) {
+    text.push_back(static_cast<char>('a' + (id + version + at) % 26));
+  }
+  return text;
+}
+
+qv_value_t int32_value(int32_t number) {
+  qv_value_t value{};
+  value.val_int32 = number;
+  return value;
+}
+
+// A table's rows (Version by Id) and change counter.
+struct table_state {
+  uint64_t counter = 0;
+  std::map<int32_t, int32_t> rows;
+  bool operator==(const table_state &) const = default;
+};
+
+std::string describe(const table_state &state) {
+  std::string text = "counter " + std::to_string(state.counter) + ", " +
+                     std::to_string(state.rows.size()) + " rows:";
+  int shown = 0;
+  for (const auto &[id, version] : state.rows) {
+    if (++shown > 40) {
+      return text + " ...";
+    }
+    text += " " + std::to_string(id) + "v" + std::to_string(version);
+  }
+  return text;
+}
+
+class Processes : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/qv_processes_XXXXXX";
+    ASSERT_NE(mkdtemp(pattern), nullptr);
+    directory_ = pattern;
+  }
+  void TearDown() override { std::filesystem::remove_all(directory_); }
+
+  // A tree with the mount point, or null.
+  sr_opaque_handle_t mounted_tree() const {
+    sr_opaque_handle_t tree = nullptr;
+    if (sr_open_tree_1(&tree, 0, 0) != 0) {
+      return nullptr;
+    }
+    if (sr_mount_local_tree_1(tree, "/disk", directory_.c_str(), 0) != 0) {
+      sr_close_tree_1(tree);
+      return nullptr;
+    }
+    return tree;
+  }
+
+  void create_table(int32_t mode) {
+    sr_opaque_handle_t tree = mounted_tree();
+    ASSERT_NE(tree, nullptr);
+    sr_column_t columns[3] = {};
+    columns[0] = {const_cast<char *>("Id"), QV_INT32, SR_PRIMARY_KEY, 0, nullptr, {}};
+    columns[1] = {const_cast<char *>("Version"), QV_INT32, SR_STANDARD, 0, nullptr, {}};
+    columns[2] = {const_cast<char *>("Payload"), QV_CHAR_PTR, SR_STANDARD, 0, nullptr, {}};
+    sr_opaque_handle_t table = nullptr;
+    EXPECT_EQ(sr_create_hashed_key_table_1(tree, Table_Path, columns, 3, mode, Hash_Buckets,
+                                           hash_id, compare_ids, &table),
+              0);
+    EXPECT_EQ(sr_close_tree_1(tree), 0);
+  }
+
+  // The committed state as a new reader finds it, checking each row's
+  // payload against its Id and Version; an empty string or the problem.
+  std::string read_table(table_state &state, size_t payload_length) const {
+    state = table_state{};
+    sr_opaque_handle_t tree = mounted_tree();
+    if (tree == nullptr) {
+      return "no tree";
+    }
+    std::string problem;
+    sr_opaque_handle_t table = nullptr;
+    sr_table_metadata_t *p_metadata = nullptr;
+    if (const int32_t rc = sr_open_table_1(tree, Table_Path, Open_For_Reading, &table); rc != 0) {
+      problem = "sr_open_table_1 gave " + std::to_string(rc);
+    } else if (sr_get_table_metadata_1(table, 0, &p_metadata) != 0) {
+      problem = "no metadata";
+    } else {
+      state.counter = p_metadata->table_change_counter;
+      for (uint32_t at = 0; at < p_metadata->number_of_rows && problem.empty(); ++at) {
+        qv_value_t id{};
+        qv_value_t version{};
+        qv_value_t text{};
+        const char *names[] = {"Id", "Version", "Payload"};
+        qv_value_t *values[] = {&id, &version, &text};
+        if (const int32_t rc =
+                sr_get_fields_by_index_1(table, static_cast<int32_t>(at), names, values, 3);
+            rc != 0) {
+          problem = "row " + std::to_string(at) + " gave " + std::to_string(rc);
+          break;
+        }
+        if (text.ptr_char != payload(id.val_int32, version.val_int32, payload_length)) {
+          problem = "row " + std::to_string(id.val_int32) + " has a wrong payload";
+        } else if (!state.rows.emplace(id.val_int32, version.val_int32).second) {
+          problem = "row " + std::to_string(id.val_int32) + " is there twice";
+        }
+        std::free(text.ptr_char);
+      }
+      sr_free_table_metadata_1(p_metadata);
+    }
+    sr_close_tree_1(tree);
+    return problem;
+  }
+
+  // Runs `body` in a child process, which stands for another program; its
+  // result is the child's exit status.
+  template <typename Body>
+  static pid_t start_process(Body body) {
+    const pid_t child = fork();
+    if (child == 0) {
+      // This process runs no other thread and holds no registry lock at
+      // the fork, so the guard that keeps forked children from changing
+      // tables can be lifted.
+      In_Child_Process.store(0);
+      _exit(body());
+    }
+    return child;
+  }
+
+  // The exit status of `child`, or -1 when it has not ended within a
+  // generous limit (a writer hung on the lock): then it is killed.
+  static int finish(pid_t child) {
+    const auto limit = std::chrono::steady_clock::now() + std::chrono::minutes(2);
+    int status = 0;
+    while (waitpid(child, &status, WNOHANG) == 0) {
+      if (std::chrono::steady_clock::now() > limit) {
+        kill(child, SIGKILL);
+        waitpid(child, &status, 0);
+        return -1;
+      }
+      std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  }
+
+  ino_t table_inode() const {
+    struct stat status {};
+    stat((directory_ + "/" + Table_File).c_str(), &status);
+    return status.st_ino;
+  }
+
+  std::string directory_;
+};
+
+int32_t add_row(sr_opaque_handle_t table, int32_t id, int32_t version, size_t payload_length) {
+  qv_value_t key = int32_value(id);
+  qv_value_t number = int32_value(version);
+  const std::string text = payload(id, version, payload_length);
+  qv_value_t body{};
+  body.ptr_char = const_cast<char *>(text.c_str());
+  const char *names[] = {"Id", "Version", "Payload"};
+  qv_value_t *values[] = {&key, &number, &body};
+  return sr_add_row_1(table, names, values, 3);
+}
+
+TEST_F(Processes, TwoWritersLoseNoRow) {
+  constexpr int Writers = 2;
+  constexpr int Rounds = 10;
+  constexpr int Rows_Per_Round = 20;
+  constexpr size_t Payload_Length = 24;
+  create_table(0);
+  const ino_t inode = table_inode();
+  // Each writer opens the table, adds a round of rows, one implicit commit
+  // each, and closes it again, so that the two take turns many times.
+  auto writer = [this](int number) {
+    return [this, number] {
+      sr_opaque_handle_t tree = mounted_tree();
+      if (tree == nullptr) {
+        return 2;
+      }
+      for (int round = 0; round < Rounds; ++round) {
+        sr_opaque_handle_t table = nullptr;
+        if (sr_open_hashed_key_table_1(tree, Table_Path, Open_Implicit, Hash_Buckets, hash_id,
+                                       compare_ids, &table) != 0) {
+          return 3;
+        }
+        for (int row = 0; row < Rows_Per_Round; ++row) {
+          if (add_row(table, number * 100000 + round * Rows_Per_Round + row, number,
+                      Payload_Length) != 0) {
+            return 4;
+          }
+        }
+        if (sr_close_table_1(table) != 0) {
+          return 5;
+        }
+      }
+      return sr_close_tree_1(tree) == 0 ? 0 : 6;
+    };
+  };
+  std::vector<pid_t> children;
+  for (int number = 1; number <= Writers; ++number) {
+    children.push_back(start_process(writer(number)));
+  }
+  for (const pid_t child : children) {
+    EXPECT_EQ(finish(child), 0) << "a writer failed or hung (-1)";
+  }
+
+  table_state expected;
+  expected.counter = 1 + Writers * Rounds * Rows_Per_Round;  // one commit per row
+  for (int number = 1; number <= Writers; ++number) {
+    for (int row = 0; row < Rounds * Rows_Per_Round; ++row) {
+      expected.rows[number * 100000 + row] = number;
+    }
+  }
+  table_state found;
+  ASSERT_EQ(read_table(found, Payload_Length), "");
+  EXPECT_EQ(found.rows.size(), expected.rows.size());
+  EXPECT_TRUE(found == expected) << describe(found);
+  // Rewrites, which replace the file, are not this test's subject.
+  EXPECT_EQ(table_inode(), inode) << "the file was rewritten";
+}
+
+// The state after transaction `t` of the writer below: block t (ids 10t to
+// 10t+9) added; every third transaction deletes block t-2, every fourth
+// sets block t-1 to version t; counter 100 + t.
+table_state state_after(int t) {
+  table_state state;
+  state.counter = t == 0 ? 1 : 100 + static_cast<uint64_t>(t);
+  for (int done = 1; done <= t; ++done) {
+    for (int row = 0; row < 10; ++row) {
+      state.rows[done * 10 + row] = done;
+    }
+    if (done % 3 == 0) {
+      for (int row = 0; row < 10; ++row) {
+        state.rows.erase((done - 2) * 10 + row);
+      }
+    }
+    if (done % 4 == 0) {
+      for (int row = 0; row < 10; ++row) {
+        if (state.rows.count((done - 1) * 10 + row) != 0) {
+          state.rows[(done - 1) * 10 + row] = done;
+        }
+      }
+    }
+  }
+  return state;
+}
+
+TEST_F(Processes, AReaderSeesOnlyCommittedStatesWhileAWriterWorks) {
+  constexpr int Transactions = 120;
+  constexpr size_t Payload_Length = 300;
+  create_table(4);
+  const pid_t writer = start_process([this] {
+    sr_opaque_handle_t tree = mounted_tree();
+    sr_opaque_handle_t table = nullptr;
+    if (tree == nullptr || sr_open_hashed_key_table_1(tree, Table_Path, Open_Explicit, Hash_Buckets,
+                                                      hash_id, compare_ids, &table) != 0) {
+      return 2;
+    }
+    for (int t = 1; t <= Transactions; ++t) {
+      const table_state before = state_after(t - 1);
+      for (int row = 0; row < 10; ++row) {
+        if (add_row(table, t * 10 + row, t, Payload_Length) != 0) {
+          return 3;
+        }
+      }
+      if (t % 3 == 0 && t > 2 &&
+          sr_delete_rows_1(table, "Id >= $i && Id < $i", (t - 2) * 10, (t - 1) * 10) != 0) {
+        return 4;
+      }
+      for (int row = 0; t % 4 == 0 && row < 10; ++row) {
+        const int32_t id = (t - 1) * 10 + row;
+        qv_value_t version = int32_value(t);
+        const std::string text = payload(id, t, Payload_Length);
+        qv_value_t body{};
+        body.ptr_char = const_cast<char *>(text.c_str());
+        const char *names[] = {"Version", "Payload"};
+        qv_value_t *values[] = {&version, &body};
+        if (before.rows.count(id) != 0 &&
+            sr_set_fields_by_key_1(table, int32_value(id), names, values, 2) != 0) {
+          return 5;
+        }
+      }
+      // Every fifth transaction writes a new file, which is renamed over
+      // the one the reader may be opening.
+      const int32_t applied = t % 5 == 0
+                                  ? sr_i_apply(static_cast<sr_i_table_t *>(table), 1, 100 + t)
+                                  : sr_apply_1(table, 100 + static_cast<uint64_t>(t));
+      if (applied != 0 || sr_commit_1(table) != 0) {
+        return 6;
+      }
+    }
+    return sr_close_tree_1(tree) == 0 ? 0 : 7;
+  });
+
+  int reads = 0;
+  std::map<uint64_t, int> states_seen;
+  int status = 0;
+  bool writing = true;
+  const auto limit = std::chrono::steady_clock::now() + std::chrono::minutes(2);
+  while (writing) {
+    writing = waitpid(writer, &status, WNOHANG) == 0;
+    if (writing && std::chrono::steady_clock::now() > limit) {
+      kill(writer, SIGKILL);
+      waitpid(writer, &status, 0);
+      FAIL() << "the writer hung";
+    }
+    table_state found;
+    const std::string problem = read_table(found, Payload_Length);
+    ASSERT_EQ(problem, "") << "read " << reads;
+    const int t = found.counter == 1 ? 0 : static_cast<int>(found.counter) - 100;
+    ASSERT_TRUE(t >= 0 && t <= Transactions && found == state_after(t))
+        << "read " << reads << " found a state never committed: " << describe(found);
+    EXPECT_EQ(found.rows.size() % 10, 0u);
+    ++states_seen[found.counter];
+    ++reads;
+  }
+  ASSERT_TRUE(WIFEXITED(status)) << status;
+  EXPECT_EQ(WEXITSTATUS(status), 0) << "the writer failed";
+  table_state last;
+  ASSERT_EQ(read_table(last, Payload_Length), "");
+  EXPECT_TRUE(last == state_after(Transactions)) << describe(last);
+  std::cout << "reads: " << reads << ", distinct committed states seen: " << states_seen.size()
+            << " of " << Transactions + 1 << "\n";
+}
+
+}  // namespace

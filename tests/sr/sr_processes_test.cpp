@@ -211,6 +211,31 @@ int32_t add_row(sr_opaque_handle_t table, int32_t id, int32_t version, size_t pa
   return sr_add_row_1(table, names, values, 3);
 }
 
+TEST_F(Processes, OfTwoCreatorsOneWinsAndTheOtherIsTold) {
+  for (int round = 0; round < 20; ++round) {
+    std::filesystem::remove(directory_ + "/" + Table_File);
+    auto creator = [this] {
+      sr_opaque_handle_t tree = mounted_tree();
+      if (tree == nullptr) {
+        return 99;
+      }
+      sr_column_t columns[1] = {};
+      columns[0] = {const_cast<char *>("Id"), QV_INT32, SR_PRIMARY_KEY, 0, nullptr, {}};
+      sr_opaque_handle_t table = nullptr;
+      const int32_t rc = sr_create_table_1(tree, Table_Path, columns, 1, 0, &table);
+      sr_close_tree_1(tree);
+      return rc == 0 ? 0 : rc == SR_E_TABLE_EXISTS ? 1 : 2;
+    };
+    const pid_t first = start_process(creator);
+    const pid_t second = start_process(creator);
+    const int results = finish(first) * 10 + finish(second);
+    EXPECT_TRUE(results == 1 || results == 10) << "round " << round << ": " << results;
+    table_state state;
+    EXPECT_EQ(read_table(state, 0), "") << "round " << round;
+    EXPECT_FALSE(std::filesystem::exists(directory_ + "/" + Table_File + ".rewrite"));
+  }
+}
+
 TEST_F(Processes, TwoWritersLoseNoRow) {
   constexpr int Writers = 2;
   constexpr int Rounds = 10;

@@ -8,7 +8,11 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
+#include <cstring>
+#include <initializer_list>
+#include <memory>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "qv_sr.h"
@@ -16,7 +20,8 @@
 
 namespace sr_test {
 
-inline sr_column_t column(const char *p_name, qv_data_type_t type, uint32_t qualifier) {
+inline sr_column_t column(const char *p_name, qv_data_type_t type,
+                          uint32_t qualifier = SR_STANDARD) {
   sr_column_t definition{};
   definition.name = const_cast<char *>(p_name);
   definition.type = type;
@@ -36,6 +41,59 @@ inline qv_value_t string_value(const char *p_text) {
   return value;
 }
 
+// Column names with values, and pointers to the values, as the calls that
+// add, set or read several fields take them.
+struct field_list {
+  field_list(std::initializer_list<std::pair<const char *, qv_value_t>> list) {
+    for (const auto &[p_name, value] : list) {
+      names.push_back(p_name);
+      values.push_back(value);
+    }
+    for (qv_value_t &value : values) {
+      pointers.push_back(&value);
+    }
+  }
+  field_list(const field_list &) = delete;
+  field_list &operator=(const field_list &) = delete;
+  uint32_t count() const { return static_cast<uint32_t>(names.size()); }
+  std::vector<const char *> names;
+  std::vector<qv_value_t> values;
+  std::vector<qv_value_t *> pointers;
+};
+
+// A zeroed block of a T with `extra` bytes behind it (for the types that end
+// in an array), from malloc as callers pass values, freed with free().
+template <class T>
+std::unique_ptr<T, decltype(&std::free)> zeroed_block(size_t extra = 0) {
+  return {static_cast<T *>(std::calloc(1, sizeof(T) + extra)), &std::free};
+}
+
+// The calling thread's last error: its code and text.
+inline std::pair<int32_t, std::string> last_error() {
+  cu_error_t *p_error = nullptr;
+  EXPECT_EQ(cu_get_error_1(&p_error), 0);
+  std::pair<int32_t, std::string> error{p_error->code, p_error->p_text};
+  cu_rel_error_1(p_error);
+  return error;
+}
+
+// Hash functions over int32 keys, whose 4 bytes the hash table hands over
+// unaligned: four buckets by the low bits, or one bucket for every key.
+inline int32_t int32_key_at(const void *p_key) {
+  int32_t key;
+  std::memcpy(&key, p_key, sizeof key);
+  return key;
+}
+inline uint32_t four_buckets(const void *p_key) {
+  return static_cast<uint32_t>(int32_key_at(p_key)) & 3u;
+}
+inline uint32_t one_bucket(const void *) {
+  return 0;
+}
+inline int32_t compare_int32_keys(const void *p_stored_key, const void *p_key) {
+  return int32_key_at(p_stored_key) == int32_key_at(p_key) ? 0 : 1;
+}
+
 inline sr_i_table_t *object(sr_opaque_handle_t handle) {
   return static_cast<sr_i_table_t *>(handle);
 }
@@ -48,6 +106,29 @@ class RowTables : public ::testing::Test {
  protected:
   void SetUp() override { ASSERT_EQ(sr_open_tree_1(&tree_, 0, 0), 0); }
   void TearDown() override { EXPECT_EQ(sr_close_tree_1(tree_), 0); }
+
+  // A table of `columns`; with `p_hash`, one whose int32 key has a hash
+  // table of `buckets` buckets.
+  sr_opaque_handle_t make_table(const char *p_path, std::vector<sr_column_t> columns, int32_t mode,
+                                sr_hash_function_t p_hash = nullptr, uint32_t buckets = 4) {
+    const auto total = static_cast<uint32_t>(columns.size());
+    sr_opaque_handle_t table = nullptr;
+    EXPECT_EQ(p_hash != nullptr
+                  ? sr_create_hashed_key_table_1(tree_, p_path, columns.data(), total, mode,
+                                                 buckets, p_hash, compare_int32_keys, &table)
+                  : sr_create_table_1(tree_, p_path, columns.data(), total, mode, &table),
+              0);
+    return table;
+  }
+
+  static int32_t add_fields(sr_opaque_handle_t table, const field_list &row) {
+    return sr_add_row_1(table, row.names.data(), row.pointers.data(), row.count());
+  }
+
+  static void apply_commit(sr_opaque_handle_t table) {
+    ASSERT_EQ(sr_apply_1(table, 0), 0);
+    ASSERT_EQ(sr_commit_1(table), 0);
+  }
 
   // A table keyed by the string "name", with an int32 "count" (default 7)
   // and a string "note" (default "none").
@@ -108,6 +189,15 @@ class RowTables : public ::testing::Test {
     std::string text = result.ptr_char;
     std::free(result.ptr_char);
     return text;
+  }
+
+  // An int32 column of the row at `fixed`; -1 when the read fails.
+  static int32_t int32_at_fixed(sr_opaque_handle_t table, uint32_t fixed, const char *p_column,
+                                uint32_t uncommitted) {
+    qv_value_t result{};
+    const int32_t rc = sr_get_field_by_fixed_index_and_visibility_1(
+        table, static_cast<int32_t>(fixed), p_column, &result, uncommitted, nullptr);
+    return rc == 0 ? result.val_int32 : -1;
   }
 
   static sr_row_state_t state_of(sr_opaque_handle_t table, uint32_t fixed) {

@@ -34,8 +34,11 @@
 #include "sr_i_frame.h"
 #include "sr_i_table.h"
 #include "sr_i_transaction.h"
+#include "sr_versioned_rows.h"
 
 namespace {
+
+using namespace sr_versioned;
 
 #if defined(__SANITIZE_THREAD__)
 constexpr int Crash_Points = 100;
@@ -70,15 +73,6 @@ constexpr const char *Table_File = "crash,t";
 constexpr size_t Fewest_Rows = 12;
 constexpr size_t Most_Rows = 60;
 
-// A committed state: the change counter and each row's Version by Id. A
-// row's Payload is a function of its Id and Version.
-struct table_state {
-  bool exists = false;
-  uint64_t counter = 0;
-  std::map<int32_t, int32_t> rows;
-  bool operator==(const table_state &) const = default;
-};
-
 std::string encode(const table_state &state) {
   if (!state.exists) {
     return "absent";
@@ -107,116 +101,14 @@ table_state decode(const std::string &text) {
   return state;
 }
 
-// 40 to about 900 bytes, different for every version of every row, so
-// that a record from the wrong version or the wrong row is noticed.
-std::string payload(int32_t id, int32_t version) {
-  const uint32_t hash =
-      static_cast<uint32_t>(id) * 2654435761u ^ static_cast<uint32_t>(version) * 40503u;
-  std::string text = std::to_string(id) + "/" + std::to_string(version) + ":";
-  const size_t length = 40 + hash % 860;
-  for (size_t at = text.size(); at < length; ++at) {
-    text.push_back(static_cast<char>('a' + (hash + at * 7) % 26));
-  }
-  return text;
-}
-
-// The writer reaches rows by key through a key hash table of its own: a
-// table without one checks a new key by scanning the rows, which refuses
-// an addition whenever a deleted row left a free entry before the last
-// live row.
-constexpr uint32_t Hash_Buckets = 64;
-
-uint32_t hash_id(const void *p_key) {
-  int32_t id;
-  std::memcpy(&id, p_key, sizeof id);
-  return static_cast<uint32_t>(id) % Hash_Buckets;
-}
-
-int32_t compare_ids(const void *p_stored_key, const void *p_key) {
-  return std::memcmp(p_stored_key, p_key, sizeof(int32_t)) == 0 ? 0 : 1;
-}
-
-std::vector<sr_column_t> table_columns() {
-  std::vector<sr_column_t> columns(3);
-  columns[0].name = const_cast<char *>("Id");
-  columns[0].type = QV_INT32;
-  columns[0].qualifier = SR_PRIMARY_KEY;
-  columns[1].name = const_cast<char *>("Version");
-  columns[1].type = QV_INT32;
-  columns[1].qualifier = SR_STANDARD;
-  columns[2].name = const_cast<char *>("Payload");
-  columns[2].type = QV_CHAR_PTR;
-  columns[2].qualifier = SR_STANDARD;
-  return columns;
-}
-
-// The committed rows of an open table into `state`; false with `problem`
-// set when a read fails or a row is not one this test writes.
-bool read_rows(sr_opaque_handle_t table, table_state &state, std::string &problem) {
-  sr_table_metadata_t *p_metadata = nullptr;
-  if (const int32_t rc = sr_get_table_metadata_1(table, 0, &p_metadata); rc != 0) {
-    problem = "sr_get_table_metadata_1 gave " + std::to_string(rc);
-    return false;
-  }
-  state.exists = true;
-  state.counter = p_metadata->table_change_counter;
-  state.rows.clear();
-  const uint32_t total_rows = p_metadata->number_of_rows;
-  sr_free_table_metadata_1(p_metadata);
-  for (uint32_t at = 0; at < total_rows; ++at) {
-    qv_value_t id{};
-    qv_value_t version{};
-    qv_value_t text{};
-    const char *names[] = {"Id", "Version", "Payload"};
-    qv_value_t *values[] = {&id, &version, &text};
-    if (const int32_t rc = sr_get_fields_by_index_and_visibility_1(table, static_cast<int32_t>(at),
-                                                                   names, values, 3, 0, nullptr);
-        rc != 0) {
-      problem = "row " + std::to_string(at) + " gave " + std::to_string(rc);
-      return false;
-    }
-    const std::string stored = text.ptr_char;
-    std::free(text.ptr_char);
-    if (stored != payload(id.val_int32, version.val_int32)) {
-      problem = "row " + std::to_string(id.val_int32) + " has the payload \"" + stored + "\"";
-      return false;
-    }
-    if (!state.rows.emplace(id.val_int32, version.val_int32).second) {
-      problem = "row " + std::to_string(id.val_int32) + " is there twice";
-      return false;
-    }
-  }
-  return true;
-}
+// Payloads of 40 to about 900 bytes, which keep the file past the size at
+// which rewrites start.
+constexpr uint32_t Payload_Spread = 860;
 
 // The table as a new program finds it: read-only, in a tree of its own.
 bool read_table(const std::string &directory, table_state &state, std::string &problem) {
-  sr_opaque_handle_t tree = nullptr;
-  if (sr_open_tree_1(&tree, 0, 0) != 0 ||
-      sr_mount_local_tree_1(tree, "/disk", directory.c_str(), 0) != 0) {
-    problem = "no tree";
-    return false;
-  }
-  sr_opaque_handle_t table = nullptr;
-  const int32_t rc = sr_open_table_1(tree, Table_Path, Open_For_Reading, &table);
-  bool read = true;
-  state = table_state{};
-  if (rc == SR_E_NO_TABLE) {
-    state.exists = false;
-  } else if (rc != 0) {
-    problem = "sr_open_table_1 gave " + std::to_string(rc);
-    read = false;
-  } else {
-    read = read_rows(table, state, problem);
-  }
-  sr_close_tree_1(tree);
-  return read;
-}
-
-qv_value_t int32_value(int32_t number) {
-  qv_value_t value{};
-  value.val_int32 = number;
-  return value;
+  problem = sr_versioned::read_table(directory, Table_Path, state, Payload_Spread);
+  return problem.empty();
 }
 
 // The child: random transactions for ever, each reported to the parent. It
@@ -299,8 +191,8 @@ class child_writer {
       confirm("create", created);
     } else {
       check(rc, "sr_open_hashed_key_table_1");
-      std::string problem;
-      if (!read_rows(table_, committed_, problem)) {
+      if (const std::string problem = read_rows(table_, committed_, Payload_Spread);
+          !problem.empty()) {
         fail(problem);
       }
       struct stat status {};
@@ -326,24 +218,11 @@ class child_writer {
   }
 
   int32_t add_row(int32_t id, int32_t version) {
-    qv_value_t key = int32_value(id);
-    qv_value_t number = int32_value(version);
-    const std::string text = payload(id, version);
-    qv_value_t body{};
-    body.ptr_char = const_cast<char *>(text.c_str());
-    const char *names[] = {"Id", "Version", "Payload"};
-    qv_value_t *values[] = {&key, &number, &body};
-    return sr_add_row_1(table_, names, values, 3);
+    return sr_versioned::add_row(table_, id, version, Payload_Spread);
   }
 
   int32_t set_row(int32_t id, int32_t version) {
-    qv_value_t number = int32_value(version);
-    const std::string text = payload(id, version);
-    qv_value_t body{};
-    body.ptr_char = const_cast<char *>(text.c_str());
-    const char *names[] = {"Version", "Payload"};
-    qv_value_t *values[] = {&number, &body};
-    return sr_set_fields_by_key_1(table_, int32_value(id), names, values, 2);
+    return sr_versioned::set_row(table_, id, version, Payload_Spread);
   }
 
   // add, set or delete, each picked so that the row count stays within

@@ -38,8 +38,11 @@
 #include "sr_i_file_system.h"
 #include "sr_i_table.h"
 #include "sr_i_transaction.h"
+#include "sr_versioned_rows.h"
 
 namespace {
+
+using namespace sr_versioned;
 
 constexpr int32_t Open_For_Reading = 1;
 constexpr int32_t Open_Implicit = 2;
@@ -262,77 +265,16 @@ int platter_unlink(const char *p_path) {
 
 // ---- The table and its script ------------------------------------------
 
-struct table_state {
-  bool exists = false;
-  uint64_t counter = 0;
-  std::map<int32_t, int32_t> rows;  // Version by Id
-  bool operator==(const table_state &) const = default;
-};
-
-std::string describe(const table_state &state) {
-  if (!state.exists) {
-    return "no table";
-  }
-  std::string text = "counter " + std::to_string(state.counter) + ":";
-  for (const auto &[id, version] : state.rows) {
-    text += " " + std::to_string(id) + "v" + std::to_string(version);
-  }
-  return text;
-}
-
-// Different for every version of every row; large enough that the file
-// soon passes the size at which rewrites start.
-std::string payload(int32_t id, int32_t version) {
-  const uint32_t hash =
-      static_cast<uint32_t>(id) * 2654435761u ^ static_cast<uint32_t>(version) * 40503u;
-  std::string text = std::to_string(id) + "/" + std::to_string(version) + ":";
-  const size_t length = 40 + hash % 700;
-  for (size_t at = text.size(); at < length; ++at) {
-    text.push_back(static_cast<char>('a' + (hash + at * 7) % 26));
-  }
-  return text;
-}
-
-// Rows are found by key through a key hash table: without one a new key
-// is checked by a scan that refuses it whenever a deleted row left a free
-// entry before the last live row.
-constexpr uint32_t Hash_Buckets = 64;
-
-uint32_t hash_id(const void *p_key) {
-  int32_t id;
-  std::memcpy(&id, p_key, sizeof id);
-  return static_cast<uint32_t>(id) % Hash_Buckets;
-}
-
-int32_t compare_ids(const void *p_stored_key, const void *p_key) {
-  return std::memcmp(p_stored_key, p_key, sizeof(int32_t)) == 0 ? 0 : 1;
-}
-
-qv_value_t int32_value(int32_t number) {
-  qv_value_t value{};
-  value.val_int32 = number;
-  return value;
-}
+// Payloads up to about 740 bytes: the file soon passes the size at which
+// rewrites start.
+constexpr uint32_t Payload_Spread = 700;
 
 int32_t add_row(sr_opaque_handle_t table, int32_t id, int32_t version) {
-  qv_value_t key = int32_value(id);
-  qv_value_t number = int32_value(version);
-  const std::string text = payload(id, version);
-  qv_value_t body{};
-  body.ptr_char = const_cast<char *>(text.c_str());
-  const char *names[] = {"Id", "Version", "Payload"};
-  qv_value_t *values[] = {&key, &number, &body};
-  return sr_add_row_1(table, names, values, 3);
+  return sr_versioned::add_row(table, id, version, Payload_Spread);
 }
 
 int32_t set_row(sr_opaque_handle_t table, int32_t id, int32_t version) {
-  qv_value_t number = int32_value(version);
-  const std::string text = payload(id, version);
-  qv_value_t body{};
-  body.ptr_char = const_cast<char *>(text.c_str());
-  const char *names[] = {"Version", "Payload"};
-  qv_value_t *values[] = {&number, &body};
-  return sr_set_fields_by_key_1(table, int32_value(id), names, values, 2);
+  return sr_versioned::set_row(table, id, version, Payload_Spread);
 }
 
 int32_t open_writable(sr_opaque_handle_t tree, int32_t mode, sr_opaque_handle_t *p_table) {
@@ -343,47 +285,7 @@ int32_t open_writable(sr_opaque_handle_t tree, int32_t mode, sr_opaque_handle_t 
 // The committed state of the table in `directory`, as a new program opens
 // it; an empty string, or what went wrong.
 std::string read_table(const std::string &directory, table_state &state) {
-  state = table_state{};
-  sr_opaque_handle_t tree = nullptr;
-  if (sr_open_tree_1(&tree, 0, 0) != 0 ||
-      sr_mount_local_tree_1(tree, "/disk", directory.c_str(), 0) != 0) {
-    return "no tree";
-  }
-  std::string problem;
-  sr_opaque_handle_t table = nullptr;
-  sr_table_metadata_t *p_metadata = nullptr;
-  if (const int32_t rc = sr_open_table_1(tree, Table_Path, Open_For_Reading, &table); rc != 0) {
-    if (rc != SR_E_NO_TABLE) {
-      problem = "sr_open_table_1 gave " + std::to_string(rc);
-    }
-  } else if (sr_get_table_metadata_1(table, 0, &p_metadata) != 0) {
-    problem = "no metadata";
-  } else {
-    state.exists = true;
-    state.counter = p_metadata->table_change_counter;
-    for (uint32_t at = 0; at < p_metadata->number_of_rows && problem.empty(); ++at) {
-      qv_value_t id{};
-      qv_value_t version{};
-      qv_value_t text{};
-      const char *names[] = {"Id", "Version", "Payload"};
-      qv_value_t *values[] = {&id, &version, &text};
-      if (const int32_t rc =
-              sr_get_fields_by_index_1(table, static_cast<int32_t>(at), names, values, 3);
-          rc != 0) {
-        problem = "row " + std::to_string(at) + " gave " + std::to_string(rc);
-        break;
-      }
-      if (text.ptr_char != payload(id.val_int32, version.val_int32)) {
-        problem = "row " + std::to_string(id.val_int32) + " has a wrong payload";
-      } else if (!state.rows.emplace(id.val_int32, version.val_int32).second) {
-        problem = "row " + std::to_string(id.val_int32) + " is there twice";
-      }
-      std::free(text.ptr_char);
-    }
-    sr_free_table_metadata_1(p_metadata);
-  }
-  sr_close_tree_1(tree);
-  return problem;
+  return sr_versioned::read_table(directory, Table_Path, state, Payload_Spread);
 }
 
 // A commit in the script: the calls at positions [first_call, end_call)
@@ -410,12 +312,9 @@ class script {
     state_.exists = true;
     state_.counter = 1;
     const uint64_t first = P_Platter->calls;
-    sr_column_t columns[3] = {};
-    columns[0] = {const_cast<char *>("Id"), QV_INT32, SR_PRIMARY_KEY, 0, nullptr, {}};
-    columns[1] = {const_cast<char *>("Version"), QV_INT32, SR_STANDARD, 0, nullptr, {}};
-    columns[2] = {const_cast<char *>("Payload"), QV_CHAR_PTR, SR_STANDARD, 0, nullptr, {}};
-    check(sr_create_hashed_key_table_1(tree_, Table_Path, columns, 3, 0, Hash_Buckets, hash_id,
-                                       compare_ids, &table_),
+    std::vector<sr_column_t> columns = table_columns();
+    check(sr_create_hashed_key_table_1(tree_, Table_Path, columns.data(), 3, 0, Hash_Buckets,
+                                       hash_id, compare_ids, &table_),
           "sr_create_hashed_key_table_1");
     windows_.push_back({first, P_Platter->calls, state_});
     bool implicit = true;

@@ -24,63 +24,17 @@
 #include "sr_i_frame.h"
 #include "sr_i_table.h"
 #include "sr_i_transaction.h"
+#include "sr_versioned_rows.h"
 
 namespace {
+
+using namespace sr_versioned;
 
 constexpr int32_t Open_For_Reading = 1;
 constexpr int32_t Open_Implicit = 2;
 constexpr int32_t Open_Explicit = 6;
 constexpr const char *Table_Path = "/disk/shared/t";
 constexpr const char *Table_File = "shared,t";
-
-// Rows are found by key through a key hash table: without one a new key
-// is checked by a scan that refuses it whenever a deleted row left a free
-// entry before the last live row.
-constexpr uint32_t Hash_Buckets = 64;
-
-uint32_t hash_id(const void *p_key) {
-  int32_t id;
-  std::memcpy(&id, p_key, sizeof id);
-  return static_cast<uint32_t>(id) % Hash_Buckets;
-}
-
-int32_t compare_ids(const void *p_stored_key, const void *p_key) {
-  return std::memcmp(p_stored_key, p_key, sizeof(int32_t)) == 0 ? 0 : 1;
-}
-
-std::string payload(int32_t id, int32_t version, size_t length) {
-  std::string text = std::to_string(id) + "/" + std::to_string(version) + ":";
-  for (size_t at = text.size(); at < length; ++at) {
-    text.push_back(static_cast<char>('a' + (id + version + at) % 26));
-  }
-  return text;
-}
-
-qv_value_t int32_value(int32_t number) {
-  qv_value_t value{};
-  value.val_int32 = number;
-  return value;
-}
-
-// A table's rows (Version by Id) and change counter.
-struct table_state {
-  uint64_t counter = 0;
-  std::map<int32_t, int32_t> rows;
-  bool operator==(const table_state &) const = default;
-};
-
-std::string describe(const table_state &state) {
-  std::string text = "counter " + std::to_string(state.counter) + ", " +
-                     std::to_string(state.rows.size()) + " rows:";
-  int shown = 0;
-  for (const auto &[id, version] : state.rows) {
-    if (++shown > 40) {
-      return text + " ...";
-    }
-    text += " " + std::to_string(id) + "v" + std::to_string(version);
-  }
-  return text;
-}
 
 class Processes : public ::testing::Test {
  protected:
@@ -107,12 +61,9 @@ class Processes : public ::testing::Test {
   void create_table(int32_t mode) {
     sr_opaque_handle_t tree = mounted_tree();
     ASSERT_NE(tree, nullptr);
-    sr_column_t columns[3] = {};
-    columns[0] = {const_cast<char *>("Id"), QV_INT32, SR_PRIMARY_KEY, 0, nullptr, {}};
-    columns[1] = {const_cast<char *>("Version"), QV_INT32, SR_STANDARD, 0, nullptr, {}};
-    columns[2] = {const_cast<char *>("Payload"), QV_CHAR_PTR, SR_STANDARD, 0, nullptr, {}};
+    std::vector<sr_column_t> columns = table_columns();
     sr_opaque_handle_t table = nullptr;
-    EXPECT_EQ(sr_create_hashed_key_table_1(tree, Table_Path, columns, 3, mode, Hash_Buckets,
+    EXPECT_EQ(sr_create_hashed_key_table_1(tree, Table_Path, columns.data(), 3, mode, Hash_Buckets,
                                            hash_id, compare_ids, &table),
               0);
     EXPECT_EQ(sr_close_tree_1(tree), 0);
@@ -120,44 +71,8 @@ class Processes : public ::testing::Test {
 
   // The committed state as a new reader finds it, checking each row's
   // payload against its Id and Version; an empty string or the problem.
-  std::string read_table(table_state &state, size_t payload_length) const {
-    state = table_state{};
-    sr_opaque_handle_t tree = mounted_tree();
-    if (tree == nullptr) {
-      return "no tree";
-    }
-    std::string problem;
-    sr_opaque_handle_t table = nullptr;
-    sr_table_metadata_t *p_metadata = nullptr;
-    if (const int32_t rc = sr_open_table_1(tree, Table_Path, Open_For_Reading, &table); rc != 0) {
-      problem = "sr_open_table_1 gave " + std::to_string(rc);
-    } else if (sr_get_table_metadata_1(table, 0, &p_metadata) != 0) {
-      problem = "no metadata";
-    } else {
-      state.counter = p_metadata->table_change_counter;
-      for (uint32_t at = 0; at < p_metadata->number_of_rows && problem.empty(); ++at) {
-        qv_value_t id{};
-        qv_value_t version{};
-        qv_value_t text{};
-        const char *names[] = {"Id", "Version", "Payload"};
-        qv_value_t *values[] = {&id, &version, &text};
-        if (const int32_t rc =
-                sr_get_fields_by_index_1(table, static_cast<int32_t>(at), names, values, 3);
-            rc != 0) {
-          problem = "row " + std::to_string(at) + " gave " + std::to_string(rc);
-          break;
-        }
-        if (text.ptr_char != payload(id.val_int32, version.val_int32, payload_length)) {
-          problem = "row " + std::to_string(id.val_int32) + " has a wrong payload";
-        } else if (!state.rows.emplace(id.val_int32, version.val_int32).second) {
-          problem = "row " + std::to_string(id.val_int32) + " is there twice";
-        }
-        std::free(text.ptr_char);
-      }
-      sr_free_table_metadata_1(p_metadata);
-    }
-    sr_close_tree_1(tree);
-    return problem;
+  std::string read_table(table_state &state, uint32_t payload_spread) const {
+    return sr_versioned::read_table(directory_, Table_Path, state, payload_spread);
   }
 
   // Runs `body` in a child process, which stands for another program; its
@@ -200,17 +115,6 @@ class Processes : public ::testing::Test {
   std::string directory_;
 };
 
-int32_t add_row(sr_opaque_handle_t table, int32_t id, int32_t version, size_t payload_length) {
-  qv_value_t key = int32_value(id);
-  qv_value_t number = int32_value(version);
-  const std::string text = payload(id, version, payload_length);
-  qv_value_t body{};
-  body.ptr_char = const_cast<char *>(text.c_str());
-  const char *names[] = {"Id", "Version", "Payload"};
-  qv_value_t *values[] = {&key, &number, &body};
-  return sr_add_row_1(table, names, values, 3);
-}
-
 TEST_F(Processes, OfTwoCreatorsOneWinsAndTheOtherIsTold) {
   for (int round = 0; round < 20; ++round) {
     std::filesystem::remove(directory_ + "/" + Table_File);
@@ -240,7 +144,7 @@ TEST_F(Processes, TwoWritersLoseNoRow) {
   constexpr int Writers = 2;
   constexpr int Rounds = 10;
   constexpr int Rows_Per_Round = 20;
-  constexpr size_t Payload_Length = 24;
+  constexpr uint32_t Payload_Spread = 24;
   create_table(0);
   const ino_t inode = table_inode();
   // Each writer opens the table, adds a round of rows, one implicit commit
@@ -259,7 +163,7 @@ TEST_F(Processes, TwoWritersLoseNoRow) {
         }
         for (int row = 0; row < Rows_Per_Round; ++row) {
           if (add_row(table, number * 100000 + round * Rows_Per_Round + row, number,
-                      Payload_Length) != 0) {
+                      Payload_Spread) != 0) {
             return 4;
           }
         }
@@ -279,6 +183,7 @@ TEST_F(Processes, TwoWritersLoseNoRow) {
   }
 
   table_state expected;
+  expected.exists = true;
   expected.counter = 1 + Writers * Rounds * Rows_Per_Round;  // one commit per row
   for (int number = 1; number <= Writers; ++number) {
     for (int row = 0; row < Rounds * Rows_Per_Round; ++row) {
@@ -286,7 +191,7 @@ TEST_F(Processes, TwoWritersLoseNoRow) {
     }
   }
   table_state found;
-  ASSERT_EQ(read_table(found, Payload_Length), "");
+  ASSERT_EQ(read_table(found, Payload_Spread), "");
   EXPECT_EQ(found.rows.size(), expected.rows.size());
   EXPECT_TRUE(found == expected) << describe(found);
   // Rewrites, which replace the file, are not this test's subject.
@@ -298,6 +203,7 @@ TEST_F(Processes, TwoWritersLoseNoRow) {
 // sets block t-1 to version t; counter 100 + t.
 table_state state_after(int t) {
   table_state state;
+  state.exists = true;
   state.counter = t == 0 ? 1 : 100 + static_cast<uint64_t>(t);
   for (int done = 1; done <= t; ++done) {
     for (int row = 0; row < 10; ++row) {
@@ -321,7 +227,7 @@ table_state state_after(int t) {
 
 TEST_F(Processes, AReaderSeesOnlyCommittedStatesWhileAWriterWorks) {
   constexpr int Transactions = 120;
-  constexpr size_t Payload_Length = 300;
+  constexpr uint32_t Payload_Spread = 300;
   create_table(4);
   const pid_t writer = start_process([this] {
     sr_opaque_handle_t tree = mounted_tree();
@@ -333,7 +239,7 @@ TEST_F(Processes, AReaderSeesOnlyCommittedStatesWhileAWriterWorks) {
     for (int t = 1; t <= Transactions; ++t) {
       const table_state before = state_after(t - 1);
       for (int row = 0; row < 10; ++row) {
-        if (add_row(table, t * 10 + row, t, Payload_Length) != 0) {
+        if (add_row(table, t * 10 + row, t, Payload_Spread) != 0) {
           return 3;
         }
       }
@@ -344,7 +250,7 @@ TEST_F(Processes, AReaderSeesOnlyCommittedStatesWhileAWriterWorks) {
       for (int row = 0; t % 4 == 0 && row < 10; ++row) {
         const int32_t id = (t - 1) * 10 + row;
         qv_value_t version = int32_value(t);
-        const std::string text = payload(id, t, Payload_Length);
+        const std::string text = payload(id, t, Payload_Spread);
         qv_value_t body{};
         body.ptr_char = const_cast<char *>(text.c_str());
         const char *names[] = {"Version", "Payload"};
@@ -379,7 +285,7 @@ TEST_F(Processes, AReaderSeesOnlyCommittedStatesWhileAWriterWorks) {
       FAIL() << "the writer hung";
     }
     table_state found;
-    const std::string problem = read_table(found, Payload_Length);
+    const std::string problem = read_table(found, Payload_Spread);
     ASSERT_EQ(problem, "") << "read " << reads;
     const int t = found.counter == 1 ? 0 : static_cast<int>(found.counter) - 100;
     ASSERT_TRUE(t >= 0 && t <= Transactions && found == state_after(t))
@@ -391,7 +297,7 @@ TEST_F(Processes, AReaderSeesOnlyCommittedStatesWhileAWriterWorks) {
   ASSERT_TRUE(WIFEXITED(status)) << status;
   EXPECT_EQ(WEXITSTATUS(status), 0) << "the writer failed";
   table_state last;
-  ASSERT_EQ(read_table(last, Payload_Length), "");
+  ASSERT_EQ(read_table(last, Payload_Spread), "");
   EXPECT_TRUE(last == state_after(Transactions)) << describe(last);
   std::cout << "reads: " << reads << ", distinct committed states seen: " << states_seen.size()
             << " of " << Transactions + 1 << "\n";

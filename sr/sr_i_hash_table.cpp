@@ -211,3 +211,14 @@ void sr_i_hash_table_output_stats(const sr_hash_table_t *p_hash_table) {
   std::printf("max_bucket_count   : %u\n", longest_chain);
   std::printf("unused buckets     : %u\n", empty_buckets);
 }
+
+int32_t sr_i_hash_table_open_for_client(uint32_t total_hash_buckets,
+                                        sr_hash_function_t p_hash_function,
+                                        sr_hash_keys_compare_function_t p_compare_function,
+                                        sr_hash_table_t **p_p_hash_table) {
+  if (total_hash_buckets == 0 || p_hash_function == nullptr || p_compare_function == nullptr) {
+    return sr_i_raise(SR_E_NULL_POINTER);
+  }
+  return sr_i_hash_table_open(total_hash_buckets, p_hash_function, p_compare_function,
+                              p_p_hash_table);
+}

@@ -1,8 +1,11 @@
 // sr_i_tree.cpp - the life of a tree apart from its entry points: the set
 // of open trees, the string conversion handles, and the teardown shared by
-// sr_close_tree_1 and a failed sr_open_tree_1.
+// sr_close_tree_1 and a failed sr_open_tree_1, and the entering of new
+// named tables.
 
 #include "sr_i_tree.h"
+
+#include <new>
 
 #include "sr_i_errors.h"
 #include "sr_i_table.h"
@@ -99,5 +102,15 @@ int32_t sr_i_close_tree(sr_i_tree_t *p_tree) {
   }
   sr_i_rw_close(&p_tree->lock);
   delete p_tree;
+  return 0;
+}
+
+int32_t sr_i_enter_named_table(sr_i_tree_t *p_tree, std::string key, sr_i_table_t *p_table) {
+  try {
+    p_tree->tables.emplace(std::move(key), p_table);
+  } catch (const std::bad_alloc &) {
+    sr_i_close_table(p_table);
+    return sr_i_raise_no_memory();
+  }
   return 0;
 }

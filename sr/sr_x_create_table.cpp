@@ -63,11 +63,8 @@ int32_t sr_x_create_table(sr_opaque_handle_t tree_handle, const char *p_registry
   if (rc != 0) {
     return rc;
   }
-  try {
-    p_tree->tables.emplace(std::move(key), p_table);
-  } catch (const std::bad_alloc &) {
-    sr_i_close_table(p_table);
-    return sr_i_raise_no_memory();
+  if (const int32_t rc = sr_i_enter_named_table(p_tree, std::move(key), p_table); rc != 0) {
+    return rc;
   }
   *p_result_table_handle = p_table;
   return 0;
@@ -90,12 +87,9 @@ extern "C" int32_t sr_create_hashed_key_table_1(sr_opaque_handle_t tree_handle,
                                                 sr_hash_keys_compare_function_t p_compare_function,
                                                 sr_opaque_handle_t *p_result_table_handle) {
   return sr_i_run_entry_point(Create_Hashed_Key_Table, [&]() -> int32_t {
-    if (total_hash_buckets == 0 || p_hash_function == nullptr || p_compare_function == nullptr) {
-      return sr_i_raise(SR_E_NULL_POINTER);
-    }
     sr_hash_table_t *p_hash_table = nullptr;
-    if (const int32_t rc = sr_i_hash_table_open(total_hash_buckets, p_hash_function,
-                                                p_compare_function, &p_hash_table);
+    if (const int32_t rc = sr_i_hash_table_open_for_client(total_hash_buckets, p_hash_function,
+                                                           p_compare_function, &p_hash_table);
         rc != 0) {
       return rc;
     }

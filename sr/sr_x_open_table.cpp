@@ -100,11 +100,8 @@ int32_t do_open_table(sr_opaque_handle_t tree_handle, const char *p_registry_pat
         rc != 0) {
       return rc;
     }
-    try {
-      p_tree->tables.emplace(std::move(key), p_loaded);
-    } catch (const std::bad_alloc &) {
-      sr_i_close_table(p_loaded);
-      return sr_i_raise_no_memory();
+    if (const int32_t rc = sr_i_enter_named_table(p_tree, std::move(key), p_loaded); rc != 0) {
+      return rc;
     }
     *p_result_table_handle = p_loaded;
     return 0;
@@ -158,15 +155,12 @@ extern "C" int32_t sr_open_hashed_key_table_1(sr_opaque_handle_t tree_handle,
                                               sr_hash_keys_compare_function_t p_compare_function,
                                               sr_opaque_handle_t *p_result_table_handle) {
   return sr_i_run_entry_point(Open_Hashed_Key_Table, [&]() -> int32_t {
-    if (total_hash_buckets == 0 || p_hash_function == nullptr || p_compare_function == nullptr) {
-      return sr_i_raise(SR_E_NULL_POINTER);
-    }
     // The hash table is built first so that a table loaded by this opening
     // takes it; a table already in memory keeps the one it has, and the new
     // one is dropped.
     sr_hash_table_t *p_hash_table = nullptr;
-    if (const int32_t rc = sr_i_hash_table_open(total_hash_buckets, p_hash_function,
-                                                p_compare_function, &p_hash_table);
+    if (const int32_t rc = sr_i_hash_table_open_for_client(total_hash_buckets, p_hash_function,
+                                                           p_compare_function, &p_hash_table);
         rc != 0) {
       return rc;
     }

@@ -49,6 +49,13 @@ int32_t sr_i_hash_table_open(uint32_t total_hash_buckets, sr_hash_function_t p_h
  * Returns 0. Row records the elements point into are not touched. */
 int32_t sr_i_hash_table_close(sr_hash_table_t *p_hash_table);
 
+/* The hash table a client asks for with its three settings: 101 (raised)
+ * unless all are given, then sr_i_hash_table_open. */
+int32_t sr_i_hash_table_open_for_client(uint32_t total_hash_buckets,
+                                        sr_hash_function_t p_hash_function,
+                                        sr_hash_keys_compare_function_t p_compare_function,
+                                        sr_hash_table_t **p_p_hash_table);
+
 /*
  * The bucket of a key through `*p_hash_index`. A client hash function must
  * return a bucket below `total_hash_buckets`; any other result is refused

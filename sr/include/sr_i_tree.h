@@ -80,4 +80,9 @@ int32_t sr_i_unregister_tree(sr_i_tree_t *p_tree);
  */
 int32_t sr_i_close_tree(sr_i_tree_t *p_tree);
 
+/* Enters a new table into the tree's named tables under `key`, with the
+ * tree write-locked. On failure (12, raised) the table is freed. */
+int32_t sr_i_enter_named_table(sr_i_tree_t *p_tree, std::string key,
+                               struct sr_i_table_struct_t *p_table);
+
 #endif /* SR_I_TREE_H */

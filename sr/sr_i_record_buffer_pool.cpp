@@ -12,6 +12,7 @@
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdlib>
 #include <cstring>
 
@@ -36,6 +37,85 @@ uintptr_t end_of(const sr_i_record_metadata_t *p_record) {
 
 uint32_t data_area_length(const sr_i_record_metadata_t *p_record) {
   return p_record->record_length - Sr_Record_Header_Length;
+}
+
+// Links a free record into the address-ordered chain, as
+// sr_i_rb_insert_free_record does, starting the walk at `p_below`: a free
+// record known to lie below it, or null for the chain's head.
+uint32_t insert_free_record_above(sr_i_record_metadata_t *p_record,
+                                  sr_i_record_metadata_t **pp_free_chain,
+                                  sr_i_record_metadata_t *p_below,
+                                  sr_i_record_metadata_t **pp_previous) {
+  uint32_t bytes_out_of_use = data_area_length(p_record);
+  sr_i_record_metadata_t *p_previous = p_below;
+  sr_i_record_metadata_t *p_next = p_below != nullptr ? p_below->p_next : *pp_free_chain;
+  while (p_next != nullptr && address_of(p_next) < address_of(p_record)) {
+    p_previous = p_next;
+    p_next = p_next->p_next;
+  }
+  if (p_next != nullptr && end_of(p_record) == address_of(p_next)) {
+    p_record->record_length += p_next->record_length;
+    p_record->p_next = p_next->p_next;
+    bytes_out_of_use += Sr_Record_Header_Length;
+  } else {
+    p_record->p_next = p_next;
+  }
+  if (p_previous != nullptr && end_of(p_previous) == address_of(p_record)) {
+    p_previous->record_length += p_record->record_length;
+    p_previous->p_next = p_record->p_next;
+    bytes_out_of_use += Sr_Record_Header_Length;
+  } else if (p_previous != nullptr) {
+    p_previous->p_next = p_record;
+  } else {
+    *pp_free_chain = p_record;
+  }
+  *pp_previous = p_previous;
+  return bytes_out_of_use;
+}
+
+// A free record of the chain below `p_record` to start an insertion walk
+// from: the search hint's start or its neighbour when below, else null.
+sr_i_record_metadata_t *free_record_below(const sr_i_record_buffer_pool_t *p_pool,
+                                          const sr_i_record_metadata_t *p_record) {
+  if (p_pool->search_bound == 0) {
+    return nullptr;
+  }
+  for (sr_i_record_metadata_t *p_candidate :
+       {p_pool->p_search_start, p_pool->p_search_start_previous}) {
+    if (p_candidate != nullptr && address_of(p_candidate) < address_of(p_record)) {
+      return p_candidate;
+    }
+  }
+  return nullptr;
+}
+
+// Keeps the search hint true after the free record `p_record` went into the
+// chain, `p_previous` being the free record below it that now links to it or
+// absorbed it. A record at or beyond the hint's start changes nothing the
+// hint promises; one below it may raise the bound, become the start's
+// neighbour, or swallow the start.
+void note_free_record_inserted(sr_i_record_buffer_pool_t *p_pool, sr_i_record_metadata_t *p_record,
+                               sr_i_record_metadata_t *p_previous) {
+  sr_i_record_metadata_t *p_start = p_pool->p_search_start;
+  if (p_pool->search_bound == 0 ||
+      (p_start != nullptr && address_of(p_record) > address_of(p_start))) {
+    return;
+  }
+  const bool absorbed = p_previous != nullptr && end_of(p_previous) > address_of(p_record);
+  sr_i_record_metadata_t *p_merged = absorbed ? p_previous : p_record;
+  if (p_start != nullptr && end_of(p_merged) > address_of(p_start)) {
+    if (absorbed) {
+      p_pool->search_bound = 0;  // the merged record's own predecessor is unknown
+      return;
+    }
+    p_pool->p_search_start = p_merged;
+    p_pool->p_search_start_previous = p_previous;
+    return;
+  }
+  p_pool->search_bound = std::max(p_pool->search_bound, data_area_length(p_merged) + 1);
+  if (p_merged->p_next == p_start) {
+    p_pool->p_search_start_previous = p_merged;
+  }
 }
 
 // A zeroed block of `block_size` bytes appended to the pool, its data area
@@ -65,7 +145,9 @@ int32_t add_block(sr_i_record_buffer_pool_t *p_pool, uint64_t block_size,
   p_record->type = SR_I_RECORD_FREE;
   // A fresh block touches no other free record, so nothing merges and the
   // count returned is only the new data area, which is not in use.
-  sr_i_rb_insert_free_record(p_record, &p_pool->p_free_chain, pp_previous);
+  insert_free_record_above(p_record, &p_pool->p_free_chain, free_record_below(p_pool, p_record),
+                           pp_previous);
+  note_free_record_inserted(p_pool, p_record, *pp_previous);
   *pp_record = p_record;
   return 0;
 }
@@ -110,12 +192,28 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
                                      uint32_t *p_actual_data_length) {
   sr_i_record_metadata_t *p_previous = nullptr;
   sr_i_record_metadata_t *p_record = p_pool->p_free_chain;
+  if (p_pool->search_bound != 0 && data_length >= p_pool->search_bound) {
+    p_previous = p_pool->p_search_start_previous;
+    p_record = p_pool->p_search_start;
+  }
   while (p_record != nullptr && data_area_length(p_record) < data_length) {
     p_previous = p_record;
     p_record = p_record->p_next;
   }
   if (p_record != nullptr) {
-    memset(sr_i_rb_record_data(p_record), 0, data_area_length(p_record));
+    // Beyond what a record of data_length bytes takes, the area is split
+    // off as a free record again, so its bytes need no clearing; clearing
+    // them would cost a whole block's worth for every row added to it.
+    const uint32_t taken = data_length + Sr_Smallest_Split_Remainder - 1;
+    memset(sr_i_rb_record_data(p_record), 0, std::min(data_area_length(p_record), taken));
+    // Every free record before this one is shorter than data_length. A hint
+    // reaching further along the chain is kept.
+    if (p_pool->search_bound == 0 || (p_pool->p_search_start != nullptr &&
+                                      address_of(p_record) >= address_of(p_pool->p_search_start))) {
+      p_pool->p_search_start = p_record;
+      p_pool->p_search_start_previous = p_previous;
+      p_pool->search_bound = data_length;
+    }
   } else {
     // A new block comes zeroed from calloc.
     const uint64_t block_size =
@@ -125,6 +223,10 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
     if (const int32_t rc = add_block(p_pool, block_size, &p_record, &p_previous); rc != 0) {
       return rc;
     }
+    // No other free record holds data_length bytes.
+    p_pool->p_search_start = p_record;
+    p_pool->p_search_start_previous = p_previous;
+    p_pool->search_bound = data_length;
   }
   *pp_data = sr_i_rb_record_data(p_record);
   *pp_previous_free_record = p_previous;
@@ -153,18 +255,29 @@ int32_t sr_i_rb_allocate_record(sr_i_record_buffer_pool_t *p_pool, void *p_data,
   }
   p_record->type = record_type;
   const uint32_t remainder = data_area_length(p_record) - data_length;
-  if (remainder < Sr_Smallest_Split_Remainder) {
-    replace_in_chain(p_record->p_next);
+  // What takes the record's place in the chain: the rest of it, or its
+  // successor when it is taken whole.
+  const bool taken_whole = remainder < Sr_Smallest_Split_Remainder;
+  sr_i_record_metadata_t *p_successor;
+  if (taken_whole) {
+    p_successor = p_record->p_next;
     p_pool->used_bytes += data_area_length(p_record);
   } else {
     p_record->record_length = data_length + Sr_Record_Header_Length;
-    auto *p_rest = reinterpret_cast<sr_i_record_metadata_t *>(end_of(p_record));
-    p_rest->record_length = remainder;
-    p_rest->p_next = p_record->p_next;
-    p_rest->type = SR_I_RECORD_FREE;
-    p_rest->disk_table_offset = 0;
-    replace_in_chain(p_rest);
+    p_successor = reinterpret_cast<sr_i_record_metadata_t *>(end_of(p_record));
+    p_successor->record_length = remainder;
+    p_successor->p_next = p_record->p_next;
+    p_successor->type = SR_I_RECORD_FREE;
+    p_successor->disk_table_offset = 0;
     p_pool->used_bytes += data_length + Sr_Record_Header_Length;
+  }
+  replace_in_chain(p_successor);
+  // Records only shrink or leave here, so the hint's bound stays true; its
+  // start and the start's neighbour may have to follow the change.
+  if (p_record == p_pool->p_search_start) {
+    p_pool->p_search_start = p_successor;
+  } else if (p_record == p_pool->p_search_start_previous) {
+    p_pool->p_search_start_previous = taken_whole ? p_previous_free_record : p_successor;
   }
   // A record taken from the free chain has not been written to the file yet.
   p_record->p_next = nullptr;
@@ -176,38 +289,16 @@ int32_t sr_i_rb_free_record(sr_i_record_buffer_pool_t *p_pool, void *p_data) {
   sr_i_record_metadata_t *p_record = sr_i_rb_record_header(p_data);
   p_record->type = SR_I_RECORD_FREE;
   sr_i_record_metadata_t *p_previous = nullptr;
-  p_pool->used_bytes -= sr_i_rb_insert_free_record(p_record, &p_pool->p_free_chain, &p_previous);
+  p_pool->used_bytes -= insert_free_record_above(p_record, &p_pool->p_free_chain,
+                                                 free_record_below(p_pool, p_record), &p_previous);
+  note_free_record_inserted(p_pool, p_record, p_previous);
   return 0;
 }
 
 uint32_t sr_i_rb_insert_free_record(sr_i_record_metadata_t *p_record,
                                     sr_i_record_metadata_t **pp_free_chain,
                                     sr_i_record_metadata_t **pp_previous) {
-  uint32_t bytes_out_of_use = data_area_length(p_record);
-  sr_i_record_metadata_t *p_previous = nullptr;
-  sr_i_record_metadata_t *p_next = *pp_free_chain;
-  while (p_next != nullptr && address_of(p_next) < address_of(p_record)) {
-    p_previous = p_next;
-    p_next = p_next->p_next;
-  }
-  if (p_next != nullptr && end_of(p_record) == address_of(p_next)) {
-    p_record->record_length += p_next->record_length;
-    p_record->p_next = p_next->p_next;
-    bytes_out_of_use += Sr_Record_Header_Length;
-  } else {
-    p_record->p_next = p_next;
-  }
-  if (p_previous != nullptr && end_of(p_previous) == address_of(p_record)) {
-    p_previous->record_length += p_record->record_length;
-    p_previous->p_next = p_record->p_next;
-    bytes_out_of_use += Sr_Record_Header_Length;
-  } else if (p_previous != nullptr) {
-    p_previous->p_next = p_record;
-  } else {
-    *pp_free_chain = p_record;
-  }
-  *pp_previous = p_previous;
-  return bytes_out_of_use;
+  return insert_free_record_above(p_record, pp_free_chain, nullptr, pp_previous);
 }
 
 int32_t sr_i_reserve_record(sr_i_record_buffer_pool_t *p_pool, uint32_t length, uint32_t type,
@@ -279,16 +370,34 @@ int32_t sr_i_rb_duplicate_record_buffer_pool(
   }
   p_to->p_first_record_buffer = p_copy;
   p_to->p_last_record_buffer = p_copy;
+  p_to->p_search_start = nullptr;
+  p_to->p_search_start_previous = nullptr;
+  p_to->search_bound = 0;
 
-  // Free records that meet across a former block seam stay separate: the
-  // accounting copied above counts both headers.
-  auto map_record = [p_map](const sr_i_record_metadata_t *p_record) {
-    return static_cast<sr_i_record_metadata_t *>(sr_i_rb_map_duplicated_address(p_map, p_record));
-  };
-  p_to->p_free_chain = map_record(p_from->p_free_chain);
-  for (sr_i_record_metadata_t *p_record = p_to->p_free_chain; p_record != nullptr;
-       p_record = p_record->p_next) {
-    p_record->p_next = map_record(p_record->p_next);
+  // The free chain of the copy is linked afresh in the copy's own address
+  // order: the source's blocks lie end to end in allocation order, which
+  // need not be their address order, so relinking the source chain through
+  // the map could leave the copy's chain out of order. Free records that
+  // meet across a former block seam stay separate: the accounting copied
+  // above counts both headers.
+  p_to->p_free_chain = nullptr;
+  if (p_copy != nullptr) {
+    sr_i_record_metadata_t *p_last_free = nullptr;
+    const uintptr_t end = address_of(p_copy) + p_copy->total_bytes;
+    for (auto *p_record = reinterpret_cast<sr_i_record_metadata_t *>(p_copy->data);
+         address_of(p_record) < end;
+         p_record = reinterpret_cast<sr_i_record_metadata_t *>(end_of(p_record))) {
+      if (p_record->type != SR_I_RECORD_FREE) {
+        continue;
+      }
+      p_record->p_next = nullptr;
+      if (p_last_free == nullptr) {
+        p_to->p_free_chain = p_record;
+      } else {
+        p_last_free->p_next = p_record;
+      }
+      p_last_free = p_record;
+    }
   }
   *pp_duplication_map = p_map;
   return 0;

@@ -57,6 +57,16 @@ typedef struct sr_i_record_buffer_pool_struct_t {
   sr_i_record_metadata_t *p_free_chain; /* lowest free record, or null */
   sr_i_record_buffer_t *p_first_record_buffer;
   sr_i_record_buffer_t *p_last_record_buffer;
+  /* Where a first-fit search may begin without changing its answer: every
+   * free record before p_search_start has a data area shorter than
+   * search_bound, so a request of at least that size starts there. No hint
+   * while search_bound is 0; a null p_search_start with a bound stands for
+   * the end of the chain. Tables that add row after row strand a short free
+   * tail in every block, and without the hint each request would walk them
+   * all. */
+  sr_i_record_metadata_t *p_search_start;
+  sr_i_record_metadata_t *p_search_start_previous; /* the free record before it, or null */
+  uint32_t search_bound;
 } sr_i_record_buffer_pool_t;
 
 /*
@@ -93,8 +103,10 @@ int32_t sr_i_rb_uninitialize_record_buffer_pool(sr_i_record_buffer_pool_t *p_poo
 
 /*
  * First fit: finds the lowest free record whose data area holds
- * `data_length` bytes, adding a block when none does, and zeroes its data
- * area. The record stays free until sr_i_rb_allocate_record takes it.
+ * `data_length` bytes, adding a block when none does, and zeroes the part of
+ * its data area that a record of up to `data_length` bytes can take (all of
+ * it when the rest would be too small to split off). The record stays free
+ * until sr_i_rb_allocate_record takes it.
  * Returns its data pointer, the free record before it in the chain (null
  * when it is the first) and its whole data-area length.
  * Returns 0, or 12 (raised) leaving the pool as it was.

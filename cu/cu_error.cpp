@@ -26,11 +26,16 @@ struct thread_error {
 };
 
 thread_local thread_error This_Thread_Error;
+// Whether the thread's record may hold anything. A plain flag needs no
+// thread-local construction on access, so the call every successful library
+// call ends with, clearing an already clear record, costs one load.
+thread_local bool This_Thread_Error_Set = false;
 
 }  // namespace
 
 extern "C" int32_t cu_set_error_1(int32_t code, int32_t /*reserved*/, const char *p_catalog,
                                   int32_t set, int32_t message, const char *p_default_text, ...) {
+  This_Thread_Error_Set = true;
   thread_error &error = This_Thread_Error;
   error.code = code;
   error.set = set;
@@ -50,6 +55,10 @@ extern "C" int32_t cu_set_error_1(int32_t code, int32_t /*reserved*/, const char
 }
 
 extern "C" int32_t cu_set_no_error_1(void) {
+  if (!This_Thread_Error_Set) {
+    return 0;
+  }
+  This_Thread_Error_Set = false;
   thread_error &error = This_Thread_Error;
   error.code = 0;
   error.set = 0;

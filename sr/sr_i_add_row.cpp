@@ -13,17 +13,6 @@
 
 namespace {
 
-// The caller's value for a column: the first exactly equal name wins.
-int32_t find_named_value(const char *p_column_name, const char *const *p_column_names,
-                         uint32_t total_values) {
-  for (uint32_t at = 0; at < total_values; ++at) {
-    if (p_column_names[at] != nullptr && std::strcmp(p_column_names[at], p_column_name) == 0) {
-      return static_cast<int32_t>(at);
-    }
-  }
-  return -1;
-}
-
 bool key_is_checked(const sr_i_table_t *p_table) {
   return (p_table->p_columns[0].qualifier & 15) == SR_PRIMARY_KEY;
 }
@@ -123,7 +112,7 @@ int32_t sr_i_add_row(sr_i_table_t *p_table, const char *const *p_column_names,
   uint32_t values_used = 0;
   for (uint32_t column = 0; column < p_table->total_columns; ++column) {
     const int32_t named =
-        find_named_value(p_table->p_columns[column].name, p_column_names, total_values);
+        sr_i_find_named_value(p_table->p_columns[column].name, p_column_names, total_values);
     if (named < 0) {
       if (column == 0) {
         return sr_i_raise(SR_E_KEY_EXPECTED);

@@ -132,8 +132,9 @@ int32_t sr_i_get_values_for_fixed_index(sr_i_table_t *p_table, uint32_t fixed_ro
   if (p_record == nullptr) {
     return sr_i_raise(SR_E_ROW_DELETED);
   }
+  int32_t column = -1;
   for (uint32_t value = 0; value < total_values; ++value) {
-    const int32_t column = sr_i_find_column(p_table, p_column_names[value]);
+    column = sr_i_find_column(p_table, p_column_names[value], static_cast<uint32_t>(column + 1));
     if (column < 0) {
       return sr_i_raise(SR_E_INVALID_COLUMN);
     }

@@ -20,13 +20,43 @@ const void *sr_i_row_key(const sr_i_table_t *p_table, const void *p_record) {
   return sr_i_row_variable_part(p_table, p_record) + sr_i_slot_anchor(p_slot).offset;
 }
 
-int32_t sr_i_find_column(const sr_i_table_t *p_table, const char *p_name) {
+namespace {
+// Compared inline, byte by byte: names are short and mostly differ in their
+// first byte, and a call to strcmp per column costs more than the work.
+bool same_name(const char *p_one, const char *p_other) {
+  for (; *p_one == *p_other; ++p_one, ++p_other) {
+    if (*p_one == '\0') {
+      return true;
+    }
+  }
+  return false;
+}
+
+bool is_column_named(const sr_i_table_t *p_table, uint32_t column, const char *p_name) {
+  return same_name(p_table->p_columns[column].name, p_name);
+}
+}  // namespace
+
+int32_t sr_i_find_column(const sr_i_table_t *p_table, const char *p_name, uint32_t likely_column) {
   if (p_name == nullptr) {
     return -1;
   }
+  if (likely_column < p_table->total_columns && is_column_named(p_table, likely_column, p_name)) {
+    return static_cast<int32_t>(likely_column);
+  }
   for (uint32_t column = 0; column < p_table->total_columns; ++column) {
-    if (std::strcmp(p_table->p_columns[column].name, p_name) == 0) {
+    if (is_column_named(p_table, column, p_name)) {
       return static_cast<int32_t>(column);
+    }
+  }
+  return -1;
+}
+
+int32_t sr_i_find_named_value(const char *p_name, const char *const *p_names,
+                              uint32_t total_names) {
+  for (uint32_t at = 0; at < total_names; ++at) {
+    if (p_names[at] != nullptr && same_name(p_names[at], p_name)) {
+      return static_cast<int32_t>(at);
     }
   }
   return -1;

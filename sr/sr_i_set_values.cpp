@@ -19,17 +19,6 @@
 
 namespace {
 
-/* The first of the caller's names equal to `p_name`, or -1. */
-int32_t find_caller_value(const char *p_name, const char *const *p_column_names,
-                          uint32_t total_values) {
-  for (uint32_t at = 0; at < total_values; ++at) {
-    if (p_column_names[at] != nullptr && std::strcmp(p_column_names[at], p_name) == 0) {
-      return static_cast<int32_t>(at);
-    }
-  }
-  return -1;
-}
-
 /*
  * Fills `builder` column by column: a named column takes the caller's value
  * (105 for a protected one), an unnamed one keeps its value in `p_current`
@@ -44,7 +33,7 @@ int32_t build_new_record(const sr_i_table_t *p_table, const void *p_current,
   uint32_t total_used = 0;
   for (uint32_t column = 0; column < p_table->total_columns; ++column) {
     const sr_column_t &definition = p_table->p_columns[column];
-    const int32_t named = find_caller_value(definition.name, p_column_names, total_values);
+    const int32_t named = sr_i_find_named_value(definition.name, p_column_names, total_values);
     if (named >= 0) {
       if ((definition.qualifier & SR_PROTECTED) != 0) {
         return sr_i_raise(SR_E_INVALID_COLUMN);

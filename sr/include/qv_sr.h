@@ -219,8 +219,9 @@ QV_SR_EXPORT int32_t sr_close_tree_1(sr_opaque_handle_t tree_handle);
  * qualifier, missing structured-data definition or key type); SR_E_KEY_EXPECTED
  * (no key); SR_E_DUPLICATE_KEY (two keys); SR_E_DUPLICATE_COLUMN;
  * SR_E_TABLE_EXISTS; SR_E_LIBRARY_CALL (a default value cannot be encoded);
- * SR_E_NO_MEMORY; SR_E_INTERNAL in a forked child, or for a path below a
- * mount point (persistent tables are not supported by this release).
+ * SR_E_NO_MEMORY; SR_E_INTERNAL in a forked child. Below a mount point the
+ * table is persistent: its file is written and flushed before the call
+ * returns (SR_E_SYSTEM_CALL, SR_E_FILESYSTEM_FULL, SR_E_ACCESS when that fails).
  */
 QV_SR_EXPORT int32_t sr_create_table_1(sr_opaque_handle_t tree_handle, const char *p_registry_path,
                                        sr_column_t *p_columns, uint32_t array_count, int32_t mode,
@@ -245,8 +246,10 @@ QV_SR_EXPORT int32_t sr_create_hashed_key_table_1(
  * the other kind while it is open is refused. A read-only table opened for
  * writing becomes writable for every handle.
  * Returns 0; SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_INVALID_MODE;
- * SR_E_INVALID_PATH; SR_E_NO_TABLE; SR_E_EXCLUSIVE_MODES; SR_E_INTERNAL for a
- * path below a mount point (not supported by this release).
+ * SR_E_INVALID_PATH; SR_E_NO_TABLE; SR_E_EXCLUSIVE_MODES. Below a mount
+ * point a table not yet in memory is loaded from its file:
+ * SR_E_TABLE_UNREADABLE when the file cannot be read as a table,
+ * SR_E_SYSTEM_CALL or SR_E_ACCESS when it cannot be opened.
  */
 QV_SR_EXPORT int32_t sr_open_table_1(sr_opaque_handle_t tree_handle, const char *p_registry_path,
                                      int32_t mode, sr_opaque_handle_t *p_result_table_handle);

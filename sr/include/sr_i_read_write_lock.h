@@ -9,17 +9,43 @@
 
 #include <pthread.h>
 
+#include <atomic>
 #include <cstdint>
 
+/*
+ * Readers take and leave the lock with one atomic operation on lock_count
+ * while no writer holds it; the mutex is taken only to wait, to wake, and by
+ * writers. A writer changes lock_count from 0 to -1 under the mutex, so a
+ * reader that waits (under the mutex) cannot miss the writer's release.
+ */
 typedef struct sr_i_read_write_lock_struct_t {
-  pthread_mutex_t lock;           /* guards the three counters */
-  pthread_cond_t read_condition;  /* readers wait here */
-  pthread_cond_t write_condition; /* writers wait here */
-  int32_t lock_count;             /* 0 free, n > 0 readers, -1 a writer */
-  int32_t waiting_readers;        /* readers waiting or about to wait */
+  pthread_mutex_t lock;            /* guards the waiting counts and the waits */
+  pthread_cond_t read_condition;   /* readers wait here */
+  pthread_cond_t write_condition;  /* writers wait here */
+  std::atomic<int32_t> lock_count; /* 0 free, n > 0 readers, -1 a writer */
+  int32_t waiting_readers;         /* readers waiting or about to wait */
   /* Counted up when a writer starts to wait and down only when its wait fails
    * or it is cancelled; no decision reads it, it is a record of demand. */
   int32_t waiting_writers;
+  /* Writers inside their wait loop right now: the last reader out takes the
+   * mutex to wake one only when this is not 0. */
+  std::atomic<int32_t> blocked_writers;
+
+  sr_i_read_write_lock_struct_t() = default;
+  /* A table object swaps its whole contents with another and then swaps
+   * the two locks back (sr_i_swap_table_contents), so a lock is only ever
+   * copied to be put back where it was, with no thread waiting on it. */
+  sr_i_read_write_lock_struct_t(const sr_i_read_write_lock_struct_t &other) { *this = other; }
+  sr_i_read_write_lock_struct_t &operator=(const sr_i_read_write_lock_struct_t &other) {
+    lock = other.lock;
+    read_condition = other.read_condition;
+    write_condition = other.write_condition;
+    lock_count.store(other.lock_count.load());
+    waiting_readers = other.waiting_readers;
+    waiting_writers = other.waiting_writers;
+    blocked_writers.store(other.blocked_writers.load());
+    return *this;
+  }
 } sr_i_read_write_lock_t;
 
 void sr_i_rw_open(sr_i_read_write_lock_t *p_rwlock);

@@ -81,8 +81,15 @@ inline const unsigned char *sr_i_default_data(const sr_i_table_t *p_table) {
 /* The key pointer of a record (see above). */
 const void *sr_i_row_key(const sr_i_table_t *p_table, const void *p_record);
 
-/* The column of that exact name, or -1. */
-int32_t sr_i_find_column(const sr_i_table_t *p_table, const char *p_name);
+/* The column of that exact name, or -1. `likely_column`, when a column of
+ * the table, is compared first: callers naming several columns mostly name
+ * them in table order. */
+int32_t sr_i_find_column(const sr_i_table_t *p_table, const char *p_name,
+                         uint32_t likely_column = 0);
+
+/* The first of a caller's `total_names` names (null ones skipped) equal to
+ * `p_name`, or -1. */
+int32_t sr_i_find_named_value(const char *p_name, const char *const *p_names, uint32_t total_names);
 
 /*
  * A row record under construction, outside the pool: the header word and

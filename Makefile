@@ -7,7 +7,7 @@
 JOBS ?= $(shell nproc)
 CTEST = ctest --output-on-failure -j$(JOBS) --timeout 600
 
-.PHONY: run test test-asan test-tsan fuzz-smoke deps format clean
+.PHONY: run test test-asan test-tsan fuzz-smoke bench deps format clean
 
 deps:
 	@tools/install-deps.sh
@@ -31,6 +31,15 @@ test-tsan: deps
 	cmake --preset tsan
 	cmake --build build-tsan -j$(JOBS)
 	cd build-tsan && $(CTEST)
+
+# The comparison with SQLite and LMDB: every workload, then one table of
+# ratios. BENCH_ARGS passes Google Benchmark flags (e.g. a filter).
+BENCH_ARGS ?= --benchmark_min_time=0.2
+bench:
+	@tools/install-deps.sh bench
+	cmake --preset default
+	cmake --build build -j$(JOBS) --target compare_bench
+	build/bench/compare_bench $(BENCH_ARGS)
 
 fuzz-smoke: deps
 	tools/fuzz-smoke.sh

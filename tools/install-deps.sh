@@ -1,8 +1,12 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the build and the tests need, when missing.
 # Run by every make target; does nothing on a machine that has them all.
+# `install-deps.sh bench` adds the peers of the comparison benchmark.
 set -euo pipefail
 packages=(cmake make g++ libc-bin locales libgtest-dev libbenchmark-dev)
+if [ "${1:-}" = bench ]; then
+  packages+=(libsqlite3-dev liblmdb-dev)
+fi
 missing=()
 for package in "${packages[@]}"; do
   dpkg-query -W -f='${Status}' "$package" 2>/dev/null | grep -q "install ok installed" ||

@@ -1,0 +1,126 @@
+// compare_workloads.h - what every program of the side-by-side comparison
+// shares: the row every system stores, the table sizes, the order in which
+// keys are looked up, a scratch directory on disk, and the naming scheme the
+// report relies on.
+//
+// A benchmark is registered as "<workload>/<system>" with the row count as its
+// argument, so Google Benchmark names it "<workload>/<system>/<rows>". The
+// report groups by workload and rows and compares every system with the one
+// named "ours". Rates are items per second (an item is one row read, one row
+// written or one change); workload 7 reports the counter "bytes_per_row"
+// instead.
+#ifndef COMPARE_WORKLOADS_H
+#define COMPARE_WORKLOADS_H
+
+#include <benchmark/benchmark.h>
+
+#include <cstdint>
+#include <cstdio>
+#include <string>
+#include <vector>
+
+namespace compare {
+
+// A realistic configuration row: a 16-byte string key, a 32-bit and a 64-bit
+// integer, a double and a 32-byte string.
+inline constexpr size_t Key_Length = 16;
+inline constexpr size_t Note_Length = 32;
+
+struct config_row {
+  char key[Key_Length + 1];
+  int32_t count;
+  int64_t total;
+  double ratio;
+  char note[Note_Length + 1];
+};
+
+// Row `i` of every table; the same for every system.
+inline config_row make_row(uint32_t i) {
+  config_row row{};
+  std::snprintf(row.key, sizeof row.key, "cfg-%012u", i);
+  row.count = static_cast<int32_t>(i);
+  row.total = static_cast<int64_t>(i) * 1000003;
+  row.ratio = i * 0.5;
+  std::snprintf(row.note, sizeof row.note, "note for row %019u", i);
+  return row;
+}
+
+// The workloads. Each system does the same work, the way its own
+// documentation recommends for speed; one item is one row or one change.
+//  w1 read by key: every column of one row looked up by key in a table held
+//     in memory (strings copied out to the caller).
+//  w2 read by index: every column of one row named by position (ours by
+//     packed and by fixed index; SQLite by rowid).
+//  w3 bulk load: `rows` rows added in one transaction, committed; timed from
+//     an empty table to the commit.
+//  w4 durable change: one change (set the 32-bit column of an existing row, or
+//     add a row) on a table of 1,000 rows, durable on disk before the call
+//     returns.
+//  w5 durable batch: 1,000 sets per transaction, durable at commit.
+//  w6 open and scan: a table file of `rows` rows opened by a new reader and
+//     every column of every row read.
+//  w7 memory: bytes held per row by a table of `rows` rows in memory.
+inline constexpr const char *W1_Read_By_Key = "w1_read_by_key";
+inline constexpr const char *W2_Read_By_Packed_Index = "w2_read_by_packed_index";
+inline constexpr const char *W2_Read_By_Fixed_Index = "w2_read_by_fixed_index";
+inline constexpr const char *W3_Bulk_Load = "w3_bulk_load";
+inline constexpr const char *W4_Durable_Set = "w4_durable_set";
+inline constexpr const char *W4_Durable_Add = "w4_durable_add";
+inline constexpr const char *W5_Durable_Batch = "w5_durable_batch";
+inline constexpr const char *W6_Open_And_Scan = "w6_open_and_scan";
+inline constexpr const char *W7_Memory = "w7_memory";
+
+// Rows of the tables the durable workloads change, and changes per batch.
+inline constexpr uint32_t Durable_Table_Rows = 1000;
+inline constexpr uint32_t Batch_Changes = 1000;
+
+// The table sizes of the scaling workloads.
+inline const std::vector<int64_t> Row_Counts = {1000, 100000, 1000000};
+
+// The n-th key a read workload looks up in a table of `rows` rows: a fixed
+// stride through the table, coprime with every size above, so consecutive
+// reads land far apart and every row is visited once per `rows` reads.
+inline uint32_t lookup_row(uint64_t n, uint32_t rows) {
+  return static_cast<uint32_t>((n * 7919u) % rows);
+}
+
+// A fresh directory for a benchmark's files, removed with everything in it
+// when the object goes away. It lies below $QV_BENCH_DIR, or /var/tmp, so
+// that durable workloads flush to a real disk rather than to memory.
+class scratch_directory {
+ public:
+  explicit scratch_directory(const char *p_label);
+  ~scratch_directory();
+  scratch_directory(const scratch_directory &) = delete;
+  scratch_directory &operator=(const scratch_directory &) = delete;
+  const std::string &path() const { return path_; }
+  std::string file(const char *p_name) const { return path_ + "/" + p_name; }
+
+ private:
+  std::string path_;
+};
+
+// Size in bytes of the file at `path`; 0 when it does not exist.
+uint64_t file_size(const std::string &path);
+
+// Bytes the C heap holds in use (small and large blocks); measures the memory
+// a system keeps for its rows.
+uint64_t heap_bytes_in_use();
+
+// Registers `function` as "<workload>/<system>" once per entry of `rows`.
+benchmark::internal::Benchmark *add(const std::string &workload, const std::string &system,
+                                    void (*function)(benchmark::State &),
+                                    const std::vector<int64_t> &rows = Row_Counts);
+
+// Fails the running benchmark with `what` when `ok` is false. Returns `ok`.
+bool check(benchmark::State &state, bool ok, const char *what);
+
+// The registrations of each program of the comparison; main calls them all.
+void register_ours();
+void register_sqlite();
+void register_lmdb();
+void register_floors();
+
+}  // namespace compare
+
+#endif  // COMPARE_WORKLOADS_H

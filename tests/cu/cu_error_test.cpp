@@ -51,14 +51,6 @@ TEST(ErrorInformation, PositionalInsertsAreFilledFromTheArguments) {
             "sr_i_write function near line 212 of file sr/sr_i_files, version 1.2.\n");
 }
 
-TEST(ErrorInformation, SuccessClearsTheLastError) {
-  cu_set_error_1(100, 0, "no_such_catalog.cat", 1, 7, "2605-100 invalid handle.\n");
-  cu_set_no_error_1();
-  const last_error error = read_last_error();
-  EXPECT_EQ(error.code, 0);
-  EXPECT_EQ(error.text, "");
-}
-
 TEST(ErrorInformation, EachThreadSeesOnlyItsOwnError) {
   cu_set_error_1(101, 0, "", 1, 8, "main thread %1$s\n", "here");
   std::string other_before;

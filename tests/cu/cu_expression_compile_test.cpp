@@ -10,87 +10,54 @@
 
 namespace {
 
-struct error_case {
-  std::string text;
-  int32_t result;
-};
-
-TEST(ExpressionCompile, ErrorsAreReportedByKind) {
-  const std::vector<error_case> cases = {
-      {"Id ==", CU_RESULT_SYNTAX_ERROR},
-      {"(Id == 7", CU_RESULT_SYNTAX_ERROR},
-      {"Id == 7)", CU_RESULT_SYNTAX_ERROR},
-      {"Id = 7", CU_RESULT_SYNTAX_ERROR},
-      {"Id == 7 Id", CU_RESULT_SYNTAX_ERROR},
-      {"", CU_RESULT_SYNTAX_ERROR},
-      {R"(Name == "eth0)", CU_RESULT_SYNTAX_ERROR},
-      {R"(Name == 'bad \q escape')", CU_RESULT_SYNTAX_ERROR},
-      {R"(Name == '\x00')", CU_RESULT_SYNTAX_ERROR},
-      {"Id == 12abc", CU_RESULT_SYNTAX_ERROR},
-      {"Id == 0x", CU_RESULT_SYNTAX_ERROR},
-      {"Vlans[0 == 1", CU_RESULT_SYNTAX_ERROR},
-      {"Link. == 1", CU_RESULT_SYNTAX_ERROR},
-      {"Id == 7 @", CU_RESULT_SYNTAX_ERROR},
-      {"!~Id", CU_RESULT_SYNTAX_ERROR},           // the longest operator wins
-      {"Id in [Count]", CU_RESULT_SYNTAX_ERROR},  // list entries are literals
-      {"Nope == 1", CU_RESULT_UNKNOWN_NAME},
-      {"Link.Nope == 1", CU_RESULT_UNKNOWN_NAME},
-      {"size(Name) == 1", CU_RESULT_UNKNOWN_NAME},
-      {"infinity > 1", CU_RESULT_UNKNOWN_NAME},
-      {"Name == 1", CU_RESULT_TYPE_MISMATCH},
-      {"Name + 1 > 0", CU_RESULT_TYPE_MISMATCH},
-      {"Weight & 1", CU_RESULT_TYPE_MISMATCH},
-      {"Id << 1.5", CU_RESULT_TYPE_MISMATCH},
-      {"~Weight", CU_RESULT_TYPE_MISMATCH},
-      {"!Name", CU_RESULT_TYPE_MISMATCH},
-      {"-Name", CU_RESULT_TYPE_MISMATCH},
-      {"Name", CU_RESULT_TYPE_MISMATCH},  // the whole expression must be a number
-      {"Name && 1", CU_RESULT_TYPE_MISMATCH},
-      {"Name =~ Path", CU_RESULT_TYPE_MISMATCH},  // patterns are literals
-      {R"(Id =~ "7")", CU_RESULT_TYPE_MISMATCH},
-      {R"(Mac =~ "0x00")", CU_RESULT_TYPE_MISMATCH},
-      {"Vlans == 1", CU_RESULT_TYPE_MISMATCH},
-      {"Id[0] == 1", CU_RESULT_TYPE_MISMATCH},
-      {"Vlans[1.5] == 1", CU_RESULT_TYPE_MISMATCH},
-      {"Name.Field == 1", CU_RESULT_TYPE_MISMATCH},
-      {"Link.Media.Length == 1", CU_RESULT_TYPE_MISMATCH},
-      {"Addresses.Prefix > 1", CU_RESULT_TYPE_MISMATCH},  // a projection is only for "in"
-      {"Addresses.Prefix[0] > 1", CU_RESULT_TYPE_MISMATCH},
-      {"Addresses[0].Gateway == Name", CU_RESULT_TYPE_MISMATCH},
-      {"Mac == Name", CU_RESULT_TYPE_MISMATCH},
-      {"Owner == Mac", CU_RESULT_TYPE_MISMATCH},
-      {"Link == Link", CU_RESULT_TYPE_MISMATCH},
-      {"len(Id) == 1", CU_RESULT_TYPE_MISMATCH},
-      {"Id in Aliases", CU_RESULT_TYPE_MISMATCH},
-      {"Link in Addresses", CU_RESULT_TYPE_MISMATCH},
-      {"Id in Count", CU_RESULT_TYPE_MISMATCH},
-      {"Id in ['7']", CU_RESULT_TYPE_MISMATCH},
-      {R"(Mac == "0x123")", CU_RESULT_BAD_LITERAL},
-      {R"(Mac == "hello")", CU_RESULT_BAD_LITERAL},
-      {R"(Mac in ["0x00", "0xg0"])", CU_RESULT_BAD_LITERAL},
-      {R"(Owner == "0x1 0x2")", CU_RESULT_BAD_LITERAL},
-      {R"(Owner == "0x10000 0x0 0x0 0x0 0x0 0x0")", CU_RESULT_BAD_LITERAL},
-      {R"(Owner == "0x1 0x2 0x3 0x4 0x5 0x6 0x7")", CU_RESULT_BAD_LITERAL},
-      {R"(Owner == "0x1 0x2 0x3 0x4 0x5 0x123456789")", CU_RESULT_BAD_LITERAL},
-      {"Id == 18446744073709551616", CU_RESULT_BAD_LITERAL},
-      {"Id == 0x1FFFFFFFFFFFFFFFF", CU_RESULT_BAD_LITERAL},
-      {"Weight == 1e400", CU_RESULT_BAD_LITERAL},
-      {"-18446744073709551615 < Id", CU_RESULT_BAD_LITERAL},
-      {R"(Name =~ "(")", CU_RESULT_BAD_PATTERN},
-      {R"(Name =~ "(a)\1")", CU_RESULT_BAD_PATTERN},
-      {R"(Name =~ "(a{200}){100}")", CU_RESULT_BAD_PATTERN},
-      {R"(Name =~ "a++++++++++++++++")", CU_RESULT_BAD_PATTERN},  // each + doubles the piece
-      {R"x(Name =~ "((((((((((((((((a+)+)+)+)+)+)+)+)+)+)+)+)+)+)+)+)")x", CU_RESULT_BAD_PATTERN},
-      {R"(Name =~ "x{99999999999999999999}")", CU_RESULT_BAD_PATTERN},
-      {"Broken == 1", CU_RESULT_BAD_VARIABLE_TYPE}};
-  for (const error_case &one : cases) {
+// Each text fails to compile with `result` and leaves no expression.
+template <typename... Texts>
+void expect_compile_error(int32_t result, const Texts &...texts) {
+  for (const std::string &text : {std::string(texts)...}) {
     test_table table = interfaces_table();
     cu_expression_t *p_expression = reinterpret_cast<cu_expression_t *>(&table);
-    EXPECT_EQ(cu_comp_expr_1(one.text.c_str(), 0, &test_table::answer, &table, &p_expression),
-              one.result)
-        << one.text;
-    EXPECT_EQ(p_expression, nullptr) << one.text;
+    EXPECT_EQ(cu_comp_expr_1(text.c_str(), 0, &test_table::answer, &table, &p_expression), result)
+        << text;
+    EXPECT_EQ(p_expression, nullptr) << text;
   }
+}
+
+TEST(ExpressionCompile, ErrorsAreReportedByKind) {
+  expect_compile_error(CU_RESULT_SYNTAX_ERROR, "Id ==", "(Id == 7", "Id == 7)", "Id = 7",
+                       "Id == 7 Id", "", R"(Name == "eth0)", R"(Name == 'bad \q escape')",
+                       R"(Name == '\x00')", "Id == 12abc", "Id == 0x", "Vlans[0 == 1", "Link. == 1",
+                       "Id == 7 @");
+  // The longest operator wins.
+  expect_compile_error(CU_RESULT_SYNTAX_ERROR, "!~Id");
+  // List entries are literals.
+  expect_compile_error(CU_RESULT_SYNTAX_ERROR, "Id in [Count]");
+  expect_compile_error(CU_RESULT_UNKNOWN_NAME, "Nope == 1", "Link.Nope == 1", "size(Name) == 1",
+                       "infinity > 1");
+  expect_compile_error(
+      CU_RESULT_TYPE_MISMATCH, "Name == 1", "Name + 1 > 0", "Weight & 1", "Id << 1.5", "~Weight",
+      "!Name", "-Name", "Name && 1", R"(Id =~ "7")", R"(Mac =~ "0x00")", "Vlans == 1", "Id[0] == 1",
+      "Vlans[1.5] == 1", "Name.Field == 1", "Link.Media.Length == 1", "Addresses.Prefix[0] > 1",
+      "Addresses[0].Gateway == Name", "Mac == Name", "Owner == Mac", "Link == Link", "len(Id) == 1",
+      "Id in Aliases", "Link in Addresses", "Id in Count", "Id in ['7']");
+  // The whole expression must be a number.
+  expect_compile_error(CU_RESULT_TYPE_MISMATCH, "Name");
+  // Patterns are literals.
+  expect_compile_error(CU_RESULT_TYPE_MISMATCH, "Name =~ Path");
+  // A projection is only for "in".
+  expect_compile_error(CU_RESULT_TYPE_MISMATCH, "Addresses.Prefix > 1");
+  expect_compile_error(
+      CU_RESULT_BAD_LITERAL, R"(Mac == "0x123")", R"(Mac == "hello")", R"(Mac in ["0x00", "0xg0"])",
+      R"(Owner == "0x1 0x2")", R"(Owner == "0x10000 0x0 0x0 0x0 0x0 0x0")",
+      R"(Owner == "0x1 0x2 0x3 0x4 0x5 0x6 0x7")", R"(Owner == "0x1 0x2 0x3 0x4 0x5 0x123456789")",
+      "Id == 18446744073709551616", "Id == 0x1FFFFFFFFFFFFFFFF", "Weight == 1e400",
+      "-18446744073709551615 < Id");
+  expect_compile_error(CU_RESULT_BAD_PATTERN, R"(Name =~ "(")", R"(Name =~ "(a)\1")",
+                       R"(Name =~ "(a{200}){100}")",
+                       R"x(Name =~ "((((((((((((((((a+)+)+)+)+)+)+)+)+)+)+)+)+)+)+)+)")x",
+                       R"(Name =~ "x{99999999999999999999}")");
+  // Each + doubles the piece.
+  expect_compile_error(CU_RESULT_BAD_PATTERN, R"(Name =~ "a++++++++++++++++")");
+  expect_compile_error(CU_RESULT_BAD_VARIABLE_TYPE, "Broken == 1");
 }
 
 TEST(ExpressionCompile, TheCallbackIsAskedAboutColumnsAndTheirFields) {

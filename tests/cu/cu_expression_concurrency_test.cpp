@@ -17,11 +17,11 @@ TEST(ExpressionConcurrency, ThreadsShareOneCompiledExpression) {
       {{"Age", QV_INT32, {}}, {"Name", QV_CHAR_PTR, {}}, {"Scores", QV_FLOAT64_ARRAY, {}}});
   std::vector<test_row> rows;
   for (int index = 0; index < 400; ++index) {
-    value_builder values;
+    value_arena values;
     const std::string name = std::string(1, static_cast<char>('a' + index % 26)) + "user";
     rows.push_back(encode_row(
         {{QV_INT32, number<int32_t>(index % 90)},
-         {QV_CHAR_PTR, values.text(name)},
+         {QV_CHAR_PTR, values.string(name)},
          {QV_FLOAT64_ARRAY, values.array({number<double>(index % 7), number<double>(2.5)})}}));
   }
   compiled_expression expression;

@@ -33,92 +33,30 @@ int32_t test_table::answer(void *p_token, const char *p_name, uint32_t length, u
   return -1;
 }
 
-void *value_builder::block(size_t bytes) {
-  blocks_.push_back(std::make_unique<unsigned char[]>(bytes + 1));
-  return blocks_.back().get();
-}
-
-qv_value_t value_builder::text(const std::string &value) {
-  qv_value_t result{};
-  result.ptr_char =
-      static_cast<char *>(std::memcpy(block(value.size()), value.c_str(), value.size() + 1));
-  return result;
-}
-
-qv_value_t value_builder::binary(const std::string &bytes) {
-  auto *p_binary = static_cast<qv_binary_t *>(block(sizeof(qv_binary_t) + bytes.size()));
-  p_binary->length = static_cast<uint32_t>(bytes.size());
-  std::memcpy(p_binary->data, bytes.data(), bytes.size());
-  qv_value_t result{};
-  result.ptr_binary = p_binary;
-  return result;
-}
-
-qv_value_t value_builder::handle(const qv_resource_handle_t &value) {
-  auto *p_handle = static_cast<qv_resource_handle_t *>(block(sizeof value));
-  *p_handle = value;
-  qv_value_t result{};
-  result.ptr_rsrc_handle = p_handle;
-  return result;
-}
-
-qv_value_t value_builder::array(const std::vector<qv_value_t> &elements) {
-  auto *p_array =
-      static_cast<qv_array_t *>(block(sizeof(qv_array_t) + elements.size() * sizeof(qv_value_t)));
-  p_array->element_count = static_cast<uint32_t>(elements.size());
-  std::memcpy(p_array->elements, elements.data(), elements.size() * sizeof(qv_value_t));
-  qv_value_t result{};
-  result.ptr_array = p_array;
-  return result;
-}
-
-qv_value_t value_builder::structured(
-    const std::vector<std::pair<qv_data_type_t, qv_value_t>> &elements) {
-  auto *p_structured = static_cast<qv_structured_data_t *>(
-      block(sizeof(qv_structured_data_t) + elements.size() * sizeof(qv_structured_data_element_t)));
-  p_structured->element_count = static_cast<uint32_t>(elements.size());
-  for (size_t index = 0; index < elements.size(); ++index) {
-    p_structured->elements[index].data_type = elements[index].first;
-    p_structured->elements[index].value = elements[index].second;
-  }
-  qv_value_t result{};
-  result.ptr_sd = p_structured;
-  return result;
-}
-
-qv_value_t value_builder::byte_string(const std::string &packed_fields) {
-  auto *p_sbs = static_cast<qv_sbs_t *>(block(sizeof(qv_sbs_t) + packed_fields.size()));
-  p_sbs->length = static_cast<int32_t>(packed_fields.size());
-  std::memcpy(p_sbs->fields, packed_fields.data(), packed_fields.size());
-  qv_value_t result{};
-  result.ptr_sbs = p_sbs;
-  return result;
-}
-
 uint32_t test_row::body_offset(uint32_t index) const {
   uint32_t offset;
   std::memcpy(&offset, slots() + 8 * index, sizeof offset);
   return offset;
 }
 
-test_row encode_row(const std::vector<std::pair<qv_data_type_t, qv_value_t>> &cells) {
+test_row encode_row(const std::vector<std::pair<int32_t, qv_value_t>> &cells) {
   test_row row;
   row.total_slots = static_cast<uint32_t>(cells.size());
   row.record.assign(4 + 8 * cells.size(), 0xEE);
   uint32_t total = 0;
   for (const auto &[type, value] : cells) {
     uint32_t size = 0;
-    EXPECT_EQ(qv_pmsg_size_conv_protocol_value_1(1, 0, type, &value, &size), 0);
+    EXPECT_EQ(qv_pmsg_size_conv_protocol_value_1(1, 0, as_type(type), &value, &size), 0);
     total += size;
   }
   row.indirect.resize(total);
   uint32_t offset = 0;
   for (size_t index = 0; index < cells.size(); ++index) {
     qv_pmsg_value_t slot;
-    EXPECT_EQ(
-        qv_pmsg_build_conv_protocol_value_1(nullptr, 0, cells[index].first, &cells[index].second,
-                                            &slot, row.indirect.data(), total, &offset),
-        0)
+    EXPECT_EQ(qv_pmsg_build_conv_protocol_value_1(nullptr, 0, as_type(cells[index].first),
+                                                  &cells[index].second, &slot, row.indirect.data(),
+                                                  total, &offset),
+              0)
         << "cell " << index;
     std::memcpy(row.record.data() + 4 + 8 * index, &slot, sizeof slot);
   }
@@ -165,24 +103,22 @@ test_table interfaces_table() {
 }
 
 test_row interfaces_row() {
-  value_builder values;
+  value_arena values;
   const qv_value_t link = values.structured(
       {{QV_UINT32, number<uint32_t>(1000)},
-       {QV_CHAR_PTR, values.text("copper")},
+       {QV_CHAR_PTR, values.string("copper")},
        {QV_INT32, number<int32_t>(1)},
-       {QV_RSRC_HANDLE_PTR, values.handle({0, {5, 0, 0, 0}})},
+       {QV_RSRC_HANDLE_PTR, values.handle(0, 5, 0, 0, 0)},
        {QV_INT32_ARRAY, values.array({number<int32_t>(1), number<int32_t>(2), number<int32_t>(4)})},
-       {QV_CHAR_PTR, values.text("x")}});
+       {QV_CHAR_PTR, values.string("x")}});
   const qv_value_t addresses = values.array(
-      {values.structured({{QV_CHAR_PTR, values.text("inet")},
+      {values.structured({{QV_CHAR_PTR, values.string("inet")},
                           {QV_INT32, number<int32_t>(24)},
                           {QV_BINARY_PTR, values.binary(std::string("\x0a\x00\x00\x01", 4))}}),
-       values.structured({{QV_CHAR_PTR, values.text("inet6")},
+       values.structured({{QV_CHAR_PTR, values.string("inet6")},
                           {QV_INT32, number<int32_t>(64)},
                           {QV_BINARY_PTR, values.binary("")}}),
-       values.structured({{QV_CHAR_PTR, values.text("inet")}})});
-  // One structured-byte-string field: length 2, type 9, serial 1, "hi".
-  const std::string raw_fields("\x02\x00\x09\x01hi", 6);
+       values.structured({{QV_CHAR_PTR, values.string("inet")}})});
   return encode_row({
       {QV_INT32, number<int32_t>(7)},
       {QV_UINT32, number<uint32_t>(4000000000u)},
@@ -190,11 +126,11 @@ test_row interfaces_row() {
       {QV_UINT64, number<uint64_t>(UINT64_MAX)},
       {QV_FLOAT32, number<float>(0.1f)},
       {QV_FLOAT64, number<double>(2.5)},
-      {QV_CHAR_PTR, values.text("eth0")},
+      {QV_CHAR_PTR, values.string("eth0")},
       {QV_BINARY_PTR, values.binary(std::string("\x00\x11\x22\xaa\xbb\xcc", 6))},
-      {QV_RSRC_HANDLE_PTR, values.handle({0x00020001u, {1, 2, 3, 0xFFFFFFFFu}})},
+      {QV_RSRC_HANDLE_PTR, values.handle(0x00020001u, 1, 2, 3, 0xFFFFFFFFu)},
       {QV_SD_PTR, link},
-      {QV_SBS_PTR, values.byte_string(raw_fields)},
+      {QV_SBS_PTR, values.byte_string({{QV_BINARY_PTR, 1, "hi"}})},  // bytes 02 00 09 01 h i
       {QV_INT32_ARRAY,
        values.array({number<int32_t>(10), number<int32_t>(20), number<int32_t>(-30)})},
       {QV_UINT32_ARRAY, values.array({number<uint32_t>(0xFFFFFF00u), number<uint32_t>(0)})},
@@ -203,12 +139,12 @@ test_row interfaces_row() {
       {QV_FLOAT32_ARRAY, values.array({number<float>(0.5f), number<float>(0.1f)})},
       {QV_FLOAT64_ARRAY, values.array({number<double>(36.6), number<double>(-1.5)})},
       {QV_CHAR_PTR_ARRAY,
-       values.array({values.text("wan"), values.text(""), values.text("uplink")})},
+       values.array({values.string("wan"), values.string(""), values.string("uplink")})},
       {QV_BINARY_PTR_ARRAY, values.array({values.binary("\x01\x02"), values.binary("")})},
       {QV_RSRC_HANDLE_PTR_ARRAY,
-       values.array({values.handle({0, {1, 0, 0, 0}}), values.handle({0x10, {9, 9, 9, 9}})})},
+       values.array({values.handle(0, 1, 0, 0, 0), values.handle(0x10, 9, 9, 9, 9)})},
       {QV_SD_PTR_ARRAY, addresses},
-      {QV_CHAR_PTR, values.text("C:\\temp\\'x'")},
+      {QV_CHAR_PTR, values.string("C:\\temp\\'x'")},
   });
 }
 

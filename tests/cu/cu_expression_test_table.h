@@ -1,6 +1,7 @@
 // cu_expression_test_table.h - what the expression tests share: a table of
 // columns answering the compiler's callback as the registry does, client
-// values encoded with libqv_pmsg into a row record laid out like the
+// values (built as the codec tests build them) encoded with libqv_pmsg into
+// a row record laid out like the
 // registry's (a 4-byte header word, then the slots, so that slots are not
 // 8-byte aligned; the variable part in a block of its own size), and one
 // realistic row with a column of every type.
@@ -10,11 +11,11 @@
 
 #include <cstdint>
 #include <cstring>
-#include <memory>
 #include <string>
 #include <utility>
 #include <vector>
 
+#include "pmsg_test_values.h"
 #include "qv_cu.h"
 #include "qv_cu_expression.h"
 #include "qv_pmsg.h"
@@ -53,21 +54,6 @@ struct compiled_expression {
   ~compiled_expression() { cu_free_expr_1(p_expression, 0); }
 };
 
-// Owns the blocks of client values built for a test.
-class value_builder {
- public:
-  qv_value_t text(const std::string &value);
-  qv_value_t binary(const std::string &bytes);
-  qv_value_t handle(const qv_resource_handle_t &value);
-  qv_value_t array(const std::vector<qv_value_t> &elements);
-  qv_value_t structured(const std::vector<std::pair<qv_data_type_t, qv_value_t>> &elements);
-  qv_value_t byte_string(const std::string &packed_fields);
-
- private:
-  void *block(size_t bytes);
-  std::vector<std::unique_ptr<unsigned char[]>> blocks_;
-};
-
 // A fixed-size value: number<int32_t>(-30), number<float>(0.1f).
 template <typename Number>
 qv_value_t number(Number value) {
@@ -87,7 +73,7 @@ struct test_row {
 
 // Encodes the cells with qv_pmsg_build_conv_protocol_value_1 (a failure is
 // reported as a test failure).
-test_row encode_row(const std::vector<std::pair<qv_data_type_t, qv_value_t>> &cells);
+test_row encode_row(const std::vector<std::pair<int32_t, qv_value_t>> &cells);
 
 // The "interfaces" table: a column of every type 2 to 22 (see the .cpp).
 test_table interfaces_table();

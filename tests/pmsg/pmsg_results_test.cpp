@@ -16,39 +16,37 @@ TEST(Results, HeaderWorksFromC) {
   EXPECT_EQ(pmsg_c_interface_round_trip(), 0);
 }
 
+// An unknown type is 2, unknown flags 7, a missing pointer 1.
 TEST(Results, BadArgumentsAreNamed) {
   value_arena arena;
   qv_value_t text = arena.string("x"), value{};
   qv_pmsg_value_t slot{};
   unsigned char area[16];
   uint32_t offset = 0, length = 0;
+  auto size = [&](int32_t type, uint32_t flags, uint32_t *p_length) {
+    return qv_pmsg_size_conv_protocol_value_1(1, flags, as_type(type), &text, p_length);
+  };
+  auto encode = [&](int32_t type, uint32_t flags, unsigned char *p_area, uint32_t *p_offset) {
+    return qv_pmsg_build_conv_protocol_value_1(nullptr, flags, as_type(type), &text, &slot, p_area,
+                                               16, p_offset);
+  };
+  auto decode = [&](int32_t type, uint32_t flags, unsigned char *p_area) {
+    return qv_pmsg_build_conv_packed_client_value_1(nullptr, flags, as_type(type), &value, &slot,
+                                                    p_area, 16);
+  };
   for (int32_t bad_type : {0, 1, QV_DATA_TYPE_LIMIT}) {
-    EXPECT_EQ(qv_pmsg_size_conv_protocol_value_1(1, 0, as_type(bad_type), &text, &length), 2);
-    EXPECT_EQ(qv_pmsg_build_conv_protocol_value_1(nullptr, 0, as_type(bad_type), &text, &slot, area,
-                                                  16, &offset),
-              2);
-    EXPECT_EQ(qv_pmsg_build_conv_packed_client_value_1(nullptr, 0, as_type(bad_type), &value, &slot,
-                                                       area, 16),
-              2);
+    EXPECT_EQ(size(bad_type, 0, &length), 2);
+    EXPECT_EQ(encode(bad_type, 0, area, &offset), 2);
+    EXPECT_EQ(decode(bad_type, 0, area), 2);
     EXPECT_EQ(qv_pmsg_convert_pmsg_value_1(&slot, as_type(bad_type), area), 2);
   }
-  EXPECT_EQ(qv_pmsg_size_conv_protocol_value_1(1, 1, QV_CHAR_PTR, &text, &length), 7);
-  EXPECT_EQ(
-      qv_pmsg_build_conv_protocol_value_1(nullptr, 4, QV_CHAR_PTR, &text, &slot, area, 16, &offset),
-      7);
-  EXPECT_EQ(
-      qv_pmsg_build_conv_packed_client_value_1(nullptr, 2, QV_CHAR_PTR, &value, &slot, area, 16),
-      7);
-  EXPECT_EQ(qv_pmsg_size_conv_protocol_value_1(1, 0, QV_CHAR_PTR, &text, nullptr), 1);
-  EXPECT_EQ(
-      qv_pmsg_build_conv_protocol_value_1(nullptr, 0, QV_CHAR_PTR, &text, &slot, area, 16, nullptr),
-      1);
-  EXPECT_EQ(qv_pmsg_build_conv_protocol_value_1(nullptr, 0, QV_CHAR_PTR, &text, &slot, nullptr, 16,
-                                                &offset),
-            1);
-  EXPECT_EQ(
-      qv_pmsg_build_conv_packed_client_value_1(nullptr, 0, QV_CHAR_PTR, &value, &slot, nullptr, 16),
-      1);
+  EXPECT_EQ(size(QV_CHAR_PTR, 1, &length), 7);
+  EXPECT_EQ(encode(QV_CHAR_PTR, 4, area, &offset), 7);
+  EXPECT_EQ(decode(QV_CHAR_PTR, 2, area), 7);
+  EXPECT_EQ(size(QV_CHAR_PTR, 0, nullptr), 1);
+  EXPECT_EQ(encode(QV_CHAR_PTR, 0, area, nullptr), 1);
+  EXPECT_EQ(encode(QV_CHAR_PTR, 0, nullptr, &offset), 1);
+  EXPECT_EQ(decode(QV_CHAR_PTR, 0, nullptr), 1);
   EXPECT_EQ(qv_pmsg_convert_pmsg_value_1(&slot, QV_CHAR_PTR, nullptr), 1);
   EXPECT_EQ(qv_pmsg_cnv_required_1(nullptr, nullptr, nullptr), 1);
   EXPECT_EQ(offset, 0u);

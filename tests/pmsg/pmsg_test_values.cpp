@@ -3,6 +3,8 @@
 #include "pmsg_test_values.h"
 
 #include <algorithm>
+#include <bit>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 
@@ -142,18 +144,8 @@ std::vector<std::pair<int32_t, qv_value_t>> sample_values(value_arena &arena) {
       {QV_UINT32, number32(0xFFFFFFFEu)},
       {QV_INT64, number64(0x8000000000000001ull)},
       {QV_UINT64, number64(0x0102030405060708ull)},
-      {QV_FLOAT32,
-       [] {
-         qv_value_t v{};
-         v.val_float32 = -1.5f;
-         return v;
-       }()},
-      {QV_FLOAT64,
-       [] {
-         qv_value_t v{};
-         v.val_float64 = 3.25e300;
-         return v;
-       }()},
+      {QV_FLOAT32, number32(std::bit_cast<uint32_t>(-1.5f))},
+      {QV_FLOAT64, number64(std::bit_cast<uint64_t>(3.25e300))},
       {QV_CHAR_PTR, arena.string("a 32-byte string for the codec!!")},
       {QV_CHAR_PTR, arena.string("")},
       {QV_BINARY_PTR, arena.binary(std::string_view("\0\x01\xFF"
@@ -163,12 +155,7 @@ std::vector<std::pair<int32_t, qv_value_t>> sample_values(value_arena &arena) {
       {QV_RSRC_HANDLE_PTR, arena.handle(0x00010002, 3, 4, 5, 0xFFFF0006)},
       {QV_SD_PTR, arena.structured({{QV_CHAR_PTR, arena.string("name")},
                                     {QV_UINT32, number32(7)},
-                                    {QV_FLOAT64,
-                                     [] {
-                                       qv_value_t v{};
-                                       v.val_float64 = 0.5;
-                                       return v;
-                                     }()},
+                                    {QV_FLOAT64, number64(std::bit_cast<uint64_t>(0.5))},
                                     {QV_SD_PTR, inner},
                                     {QV_CHAR_PTR_ARRAY, names},
                                     {QV_BINARY_PTR, arena.binary("")}})},
@@ -236,83 +223,69 @@ std::pair<int32_t, qv_value_t> random_value(std::mt19937 &random, value_arena &a
   return {type, arena.array(elements)};
 }
 
-testing::AssertionResult values_equal(int32_t type, const qv_value_t &expected,
-                                      const qv_value_t &actual) {
-  auto differ = [type](const char *what) {
-    return testing::AssertionFailure() << "type " << type << ": " << what << " differs";
-  };
+namespace {
+
+std::string hex(const void *p_bytes, size_t length) {
+  std::string text;
+  char pair[3];
+  for (size_t at = 0; at < length; ++at) {
+    std::snprintf(pair, sizeof pair, "%02x", static_cast<const unsigned char *>(p_bytes)[at]);
+    text += pair;
+  }
+  return text;
+}
+
+// A value written out by what it holds, each part tagged with its type: a
+// null pointer stands for the type's empty value, or (`decoded`) for a
+// missing piece, which a decoded value must never have.
+std::string render(int32_t type, const qv_value_t &value, bool decoded) {
+  const std::string tag = std::to_string(type) + ":";
   if (is_fixed_type(type)) {
-    return std::memcmp(&expected, &actual, fixed_width(type)) == 0 ? testing::AssertionSuccess()
-                                                                   : differ("number");
+    return tag + hex(&value, fixed_width(type));
   }
-  if (actual.ptr_char == nullptr) {
-    return differ("pointer (decoded null)");
+  if (value.ptr_char == nullptr && decoded) {
+    return tag + "<null>";
   }
+  const qv_resource_handle_t invalid = {~0u, {~0u, ~0u, ~0u, ~0u}};
   switch (type) {
     case QV_CHAR_PTR:
-      return std::strcmp(expected.ptr_char ? expected.ptr_char : "", actual.ptr_char) == 0
-                 ? testing::AssertionSuccess()
-                 : differ("string");
-    case QV_BINARY_PTR: {
-      uint32_t length = expected.ptr_binary ? expected.ptr_binary->length : 0;
-      return length == actual.ptr_binary->length &&
-                     (length == 0 ||
-                      std::memcmp(expected.ptr_binary->data, actual.ptr_binary->data, length) == 0)
-                 ? testing::AssertionSuccess()
-                 : differ("binary");
-    }
-    case QV_RSRC_HANDLE_PTR: {
-      qv_resource_handle_t invalid = {~0u, {~0u, ~0u, ~0u, ~0u}};
-      const qv_resource_handle_t *p_expected =
-          expected.ptr_rsrc_handle ? expected.ptr_rsrc_handle : &invalid;
-      return std::memcmp(p_expected, actual.ptr_rsrc_handle, sizeof invalid) == 0
-                 ? testing::AssertionSuccess()
-                 : differ("handle");
-    }
-    case QV_SBS_PTR: {
-      int32_t length = expected.ptr_sbs ? expected.ptr_sbs->length : 0;
-      return length == actual.ptr_sbs->length &&
-                     (length == 0 ||
-                      std::memcmp(expected.ptr_sbs->fields, actual.ptr_sbs->fields, length) == 0)
-                 ? testing::AssertionSuccess()
-                 : differ("structured byte string");
-    }
+      return tag + '"' + (value.ptr_char ? value.ptr_char : "") + '"';
+    case QV_BINARY_PTR:
+      return tag + (value.ptr_binary ? hex(value.ptr_binary->data, value.ptr_binary->length) : "");
+    case QV_RSRC_HANDLE_PTR:
+      return tag + hex(value.ptr_rsrc_handle ? value.ptr_rsrc_handle : &invalid, sizeof invalid);
+    case QV_SBS_PTR:
+      return tag + (value.ptr_sbs ? hex(value.ptr_sbs->fields, value.ptr_sbs->length) : "");
     case QV_SD_PTR: {
-      uint32_t count = expected.ptr_sd ? expected.ptr_sd->element_count : 0;
-      if (count != actual.ptr_sd->element_count) {
-        return differ("element count");
+      std::string text = tag + "{";
+      for (uint32_t at = 0; value.ptr_sd && at < value.ptr_sd->element_count; ++at) {
+        const qv_structured_data_element_t &element = value.ptr_sd->elements[at];
+        text += render(element.data_type, element.value, decoded) + ",";
       }
-      for (uint32_t index = 0; index < count; ++index) {
-        const auto &want = expected.ptr_sd->elements[index];
-        const auto &got = actual.ptr_sd->elements[index];
-        if (want.data_type != got.data_type) {
-          return differ("element type");
-        }
-        auto nested = values_equal(want.data_type, want.value, got.value);
-        if (!nested) {
-          return nested << " in element " << index << " of type " << type;
-        }
-      }
-      return testing::AssertionSuccess();
+      return text + "}";
     }
     default: {
-      uint32_t count = expected.ptr_array ? expected.ptr_array->element_count : 0;
-      if (count != actual.ptr_array->element_count) {
-        return differ("element count");
+      const int32_t element_type = type >= QV_CHAR_PTR_ARRAY ? type - 11
+                                   : array_width(type) == 4  ? QV_UINT32
+                                                             : QV_UINT64;
+      std::string text = tag + "[";
+      for (uint32_t at = 0; value.ptr_array && at < value.ptr_array->element_count; ++at) {
+        text += render(element_type, value.ptr_array->elements[at], decoded) + ",";
       }
-      int32_t element_type = type >= QV_CHAR_PTR_ARRAY ? type - 11
-                             : array_width(type) == 4  ? QV_UINT32
-                                                       : QV_UINT64;
-      for (uint32_t index = 0; index < count; ++index) {
-        auto nested = values_equal(element_type, expected.ptr_array->elements[index],
-                                   actual.ptr_array->elements[index]);
-        if (!nested) {
-          return nested << " in element " << index << " of type " << type;
-        }
-      }
-      return testing::AssertionSuccess();
+      return text + "]";
     }
   }
+}
+
+}  // namespace
+
+testing::AssertionResult values_equal(int32_t type, const qv_value_t &expected,
+                                      const qv_value_t &actual) {
+  const std::string wanted = render(type, expected, false), found = render(type, actual, true);
+  if (wanted == found) {
+    return testing::AssertionSuccess();
+  }
+  return testing::AssertionFailure() << "expected " << wanted << "\n   found " << found;
 }
 
 int32_t append_value(encoded_row &row, int32_t type, const qv_value_t &value,

@@ -1,7 +1,8 @@
-// pmsg_test_values.h - what the codec tests share: building client values,
-// comparing them deeply, making random ones, encoding with the caller's
-// grow-and-retry loop, and producing the other byte order's encoding by
-// following docs/value-encoding.md independently of the library's code.
+// pmsg_test_values.h - what the codec tests share (and the expression tests
+// build their rows with): building client values, comparing them deeply,
+// making random ones, encoding with the caller's grow-and-retry loop, and
+// producing the other byte order's encoding by following
+// docs/value-encoding.md independently of the library's code.
 
 #ifndef PMSG_TEST_VALUES_H
 #define PMSG_TEST_VALUES_H

@@ -35,8 +35,11 @@ static int32_t last_code(char *p_text, size_t size) {
 int main(void) {
   char text[512];
   sr_opaque_handle_t tree = NULL;
+  sr_opaque_handle_t table = NULL;
   sr_column_t column;
   qv_value_t value;
+  const char *names[1] = {"Port"};
+  qv_value_t *values[1] = {&value};
 
   CHECK(sr_open_tree_1(NULL, 0, 0) == SR_E_INVALID_HANDLE);
   CHECK(last_code(text, sizeof text) == 100);
@@ -45,19 +48,22 @@ int main(void) {
   CHECK(sr_open_tree_1(&tree, 0, 0) == 0);
   CHECK(tree != NULL);
   CHECK(last_code(text, sizeof text) == 0);
-  CHECK(sr_close_tree_1(tree) == 0);
 
-  /* The types are usable from C with their documented sizes. */
+  /* The types are usable from C with their documented sizes: a table of
+   * one key column, a row added and read back. */
   CHECK(sizeof(qv_value_t) == 8);
   CHECK(sizeof(qv_structured_data_element_t) == 16);
   CHECK(sizeof(qv_resource_handle_t) == 20);
   memset(&column, 0, sizeof column);
   column.name = "Port";
   column.type = QV_UINT32;
-  column.qualifier = (sr_qualifier_t)(SR_STANDARD | SR_PROTECTED);
+  column.qualifier = (sr_qualifier_t)(SR_PRIMARY_KEY | SR_PROTECTED);
+  CHECK(sr_create_table_1(tree, "/c/ports", &column, 1, 0, &table) == 0);
   value.val_uint32 = 8080;
-  column.default_value = value;
-  CHECK((column.qualifier & 15) == SR_STANDARD);
+  CHECK(sr_add_row_1(table, names, values, 1) == 0);
+  value.val_uint32 = 0;
+  CHECK(sr_get_field_by_index_1(table, 0, "Port", &value) == 0 && value.val_uint32 == 8080);
+  CHECK(sr_close_tree_1(tree) == 0);
   CHECK((cu_dtc_table_1[QV_CHAR_PTR_ARRAY] & CU_DTC_POINTER) != 0);
   CHECK(strcmp(cu_mesgtbl_qv_sr_set[0], "Reserved: DO NOT USE!") == 0);
 

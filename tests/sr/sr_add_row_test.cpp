@@ -1,14 +1,12 @@
 // Adding rows: the order of the checks, a failed add leaving no trace,
-// values stored as given (null pointers as empty values, long values in
-// rebuilt records), key checks by scan and by hash, revival of a deleted
-// key at its old position, and the row index growing under pending changes.
+// defaults, null pointers stored as empty values, long keys and values, key
+// checks by scan and by hash, revival of a deleted key at its old position,
+// and the row index growing under pending changes.
 
 #include <gtest/gtest.h>
 
-#include <cstring>
 #include <string>
 
-#include "qv_cu.h"
 #include "sr_i_rows.h"
 #include "sr_row_test_support.h"
 
@@ -16,7 +14,7 @@ namespace {
 
 using namespace sr_test;
 
-class AddRow : public RowTables {};
+using AddRow = RowTables;
 
 // What a failed add must leave exactly as it was.
 struct footprint {
@@ -61,8 +59,7 @@ TEST_F(AddRow, ChecksComeInTheirOrderAndAFailureLeavesNoTrace) {
   EXPECT_EQ(add_named(table, "c", 3), 0);
 }
 
-TEST_F(AddRow, TheHandleAndTheOpenModeAreCheckedFirst) {
-  EXPECT_EQ(add_numbered(nullptr, 1, 1), SR_E_INVALID_HANDLE);
+TEST_F(AddRow, AReadOnlyHandleIsRefused) {
   ASSERT_EQ(sr_close_table_1(create_numbered("/add/readonly", Explicit)), 0);
   sr_opaque_handle_t reader = nullptr;
   ASSERT_EQ(sr_open_table_1(tree_, "/add/readonly", 1, &reader), 0);
@@ -72,36 +69,19 @@ TEST_F(AddRow, TheHandleAndTheOpenModeAreCheckedFirst) {
 
 TEST_F(AddRow, UnnamedColumnsTakeDefaultsAndNullValuesBecomeEmpty) {
   sr_opaque_handle_t table = create_named_counts("/add/defaults", Implicit);
-  qv_value_t name = string_value("k");
-  qv_value_t null_note{};
-  const char *names[] = {"name", "note"};
-  qv_value_t *values[] = {&name, &null_note};
-  ASSERT_EQ(sr_add_row_1(table, names, values, 2), 0);
+  ASSERT_EQ(add_fields(table, {{"name", string_value("k")}, {"note", string_value(nullptr)}}), 0);
   EXPECT_EQ(count_of(table, "k", 0), 7);
   EXPECT_EQ(string_at_fixed(table, fixed_index_of(table, "k"), "note", 0), "");
-
-  std::vector<sr_column_t> columns = {column("handle", QV_RSRC_HANDLE_PTR, SR_PRIMARY_KEY)};
-  sr_opaque_handle_t handles = nullptr;
-  ASSERT_EQ(sr_create_table_1(tree_, "/add/handles", columns.data(), 1, Implicit, &handles), 0);
-  qv_value_t null_handle{};
-  const char *handle_name[] = {"handle"};
-  qv_value_t *handle_value[] = {&null_handle};
-  ASSERT_EQ(sr_add_row_1(handles, handle_name, handle_value, 1), 0);
-  qv_value_t read{};
-  ASSERT_EQ(sr_get_field_by_index_1(handles, 0, "handle", &read), 0);
-  EXPECT_EQ(cu_rsrc_hndl_cmp_1(read.ptr_rsrc_handle, cu_ptr_invld_rsrc_hndl_1), 0);
-  std::free(read.ptr_rsrc_handle);
 }
 
-TEST_F(AddRow, LongValuesAreStoredWhole) {
+TEST_F(AddRow, LongKeysAndValuesAreStoredWhole) {
   sr_opaque_handle_t table = create_named_counts("/add/long", Implicit);
   for (const size_t length : {31u, 32u, 33u, 200u, 5000u}) {
-    const std::string key(length, 'k');
-    const std::string note(length * 2, 'n');
-    qv_value_t name = string_value(key.c_str()), text = string_value(note.c_str());
-    const char *names[] = {"name", "note"};
-    qv_value_t *values[] = {&name, &text};
-    ASSERT_EQ(sr_add_row_1(table, names, values, 2), 0) << length;
+    const std::string key(length, 'k'), note(length * 2, 'n');
+    ASSERT_EQ(add_fields(table, {{"name", string_value(key.c_str())},
+                                 {"note", string_value(note.c_str())}}),
+              0)
+        << length;
     const uint32_t fixed = fixed_index_of(table, key.c_str());
     EXPECT_EQ(string_at_fixed(table, fixed, "note", 0), note) << length;
     EXPECT_EQ(string_at_fixed(table, fixed, "name", 0), key) << length;
@@ -113,11 +93,9 @@ TEST_F(AddRow, PrimaryKeyByScanRefusesWhenTheNewRowLiesBeforeTheLastLiveRow) {
   for (const char *p_name : {"a", "b", "c"}) {
     ASSERT_EQ(add_named(table, p_name, 1), 0);
   }
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
+  apply_commit(table);
   ASSERT_EQ(sr_delete_row_by_index_1(table, 0), 0);
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
+  apply_commit(table);
   // Position 0 is free again and lies before "c": the key check meets the
   // new row itself.
   EXPECT_EQ(add_named(table, "d", 1), SR_E_DUPLICATE_KEY);
@@ -131,23 +109,21 @@ TEST_F(AddRow, PrimaryKeyByScanRefusesWhenTheNewRowLiesBeforeTheLastLiveRow) {
 }
 
 TEST_F(AddRow, ADeletedKeyComesBackAtItsOldPosition) {
+  // Handle keys: the table gets the built-in key hash table.
   std::vector<sr_column_t> columns = {column("handle", QV_RSRC_HANDLE_PTR, SR_PRIMARY_KEY),
                                       column("count", QV_INT32, SR_STANDARD)};
-  sr_opaque_handle_t table = nullptr;
-  ASSERT_EQ(sr_create_table_1(tree_, "/add/revive", columns.data(), 2, Explicit, &table), 0);
-  ASSERT_NE(object(table)->p_rows_hash_table, nullptr);
+  sr_opaque_handle_t table = make_table("/add/revive", columns, Explicit);
   qv_resource_handle_t handles[3] = {};
-  for (uint32_t at = 0; at < 3; ++at) {
+  auto add = [&](uint32_t at, int32_t count) {
     handles[at].id.id4 = at + 1;
-    qv_value_t key{}, count = int32_value(static_cast<int32_t>(at));
+    qv_value_t key{};
     key.ptr_rsrc_handle = &handles[at];
-    const char *names[] = {"handle", "count"};
-    qv_value_t *values[] = {&key, &count};
-    ASSERT_EQ(sr_add_row_1(table, names, values, 2), 0);
+    return add_fields(table, {{"handle", key}, {"count", int32_value(count)}});
+  };
+  for (uint32_t at = 0; at < 3; ++at) {
+    ASSERT_EQ(add(at, static_cast<int32_t>(at)), 0);
   }
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
-
+  apply_commit(table);
   qv_value_t key{};
   key.ptr_rsrc_handle = &handles[1];
   uint32_t fixed_before = 0;
@@ -157,21 +133,15 @@ TEST_F(AddRow, ADeletedKeyComesBackAtItsOldPosition) {
       0);
   EXPECT_EQ(object(table)->applied_deletions, 1u);
 
-  qv_value_t count = int32_value(42);
-  const char *names[] = {"handle", "count"};
-  qv_value_t *values[] = {&key, &count};
-  ASSERT_EQ(sr_add_row_1(table, names, values, 2), 0);
+  ASSERT_EQ(add(1, 42), 0);
   uint32_t fixed_after = 0;
   ASSERT_EQ(sr_get_fixed_row_index_for_key_1(table, key, &fixed_after), 0);
   EXPECT_EQ(fixed_after, fixed_before);
   EXPECT_EQ(object(table)->applied_deletions, 0u);
   EXPECT_EQ(object(table)->total_applied_rows, 3u);
   EXPECT_EQ(sr_i_get_row_state_for_fixed_index(object(table), fixed_after), SR_ROW_STATE_UPDATED);
-  // A live key is still a duplicate.
-  EXPECT_EQ(sr_add_row_1(table, names, values, 2), SR_E_DUPLICATE_KEY);
-
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
+  EXPECT_EQ(add(1, 42), SR_E_DUPLICATE_KEY);  // a live key is still a duplicate
+  apply_commit(table);
   qv_value_t read{};
   ASSERT_EQ(sr_get_field_by_key_1(table, key, "count", &read), 0);
   EXPECT_EQ(read.val_int32, 42);
@@ -193,29 +163,12 @@ TEST_F(AddRow, TheIndexDoublesAndPendingChangesFollowTheirRows) {
     EXPECT_EQ(p_entry->p_pending_change, p_change);
   }
   EXPECT_EQ(listed, 101u);
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
+  apply_commit(table);
   for (int32_t id = 0; id < 101; ++id) {
     qv_value_t read{};
     ASSERT_EQ(sr_get_field_by_key_1(table, int32_value(id), "count", &read), 0);
     EXPECT_EQ(read.val_int32, id * 10);
   }
-}
-
-TEST_F(AddRow, ANewRowTakesTheLowestFreePosition) {
-  sr_opaque_handle_t table = create_named_counts("/add/lowest", Explicit, SR_PRIMARY_KEY_NOCHECK);
-  for (int32_t row = 0; row < 10; ++row) {
-    ASSERT_EQ(add_named(table, std::to_string(row).c_str(), row), 0);
-  }
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
-  const uint32_t fifth = fixed_index_of(table, "5");
-  ASSERT_EQ(sr_delete_row_by_index_1(table, object(table)->p_rows_fixed_index[fifth].packed_index),
-            0);
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
-  ASSERT_EQ(add_named(table, "new", 1), 0);
-  EXPECT_EQ(fixed_index_of(table, "new"), fifth);
 }
 
 }  // namespace

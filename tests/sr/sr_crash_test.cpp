@@ -17,6 +17,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -25,10 +26,8 @@
 #include <map>
 #include <optional>
 #include <random>
-#include <set>
 #include <sstream>
 #include <string>
-#include <vector>
 
 #include "qv_sr.h"
 #include "sr_i_frame.h"
@@ -40,18 +39,15 @@ namespace {
 
 using namespace sr_versioned;
 
-#if defined(__SANITIZE_THREAD__)
-constexpr int Crash_Points = 100;
-#elif defined(__SANITIZE_ADDRESS__)
-constexpr int Crash_Points = 150;
-#elif defined(__has_feature)
-#if __has_feature(thread_sanitizer)
-constexpr int Crash_Points = 100;
-#elif __has_feature(address_sanitizer)
-constexpr int Crash_Points = 150;
+#if defined(__has_feature)
+#define SR_HAS_FEATURE(feature) __has_feature(feature)
 #else
-constexpr int Crash_Points = 300;
+#define SR_HAS_FEATURE(feature) 0
 #endif
+#if defined(__SANITIZE_THREAD__) || SR_HAS_FEATURE(thread_sanitizer)
+constexpr int Crash_Points = 100;
+#elif defined(__SANITIZE_ADDRESS__) || SR_HAS_FEATURE(address_sanitizer)
+constexpr int Crash_Points = 150;
 #else
 constexpr int Crash_Points = 300;
 #endif
@@ -60,18 +56,8 @@ constexpr int Crash_Points = 300;
 // killed too.
 constexpr int Crash_Points_Per_Table = 50;
 
-constexpr int32_t Open_For_Reading = 1;
-constexpr int32_t Open_Implicit = 2;
-constexpr int32_t Open_Explicit = 6;
-constexpr int32_t Create_Implicit = 0;
-constexpr int32_t Create_Explicit = 4;
 constexpr const char *Table_Path = "/disk/crash/t";
 constexpr const char *Table_File = "crash,t";
-
-// Bounds that keep the file past the size at which rewrites start and the
-// pipe messages short.
-constexpr size_t Fewest_Rows = 12;
-constexpr size_t Most_Rows = 60;
 
 std::string encode(const table_state &state) {
   if (!state.exists) {
@@ -101,15 +87,9 @@ table_state decode(const std::string &text) {
   return state;
 }
 
-// Payloads of 40 to about 900 bytes, which keep the file past the size at
-// which rewrites start.
+// Payloads of 40 to about 900 bytes and 12 to 60 rows keep the file past
+// the size at which rewrites start, and the pipe messages short.
 constexpr uint32_t Payload_Spread = 860;
-
-// The table as a new program finds it: read-only, in a tree of its own.
-bool read_table(const std::string &directory, table_state &state, std::string &problem) {
-  problem = sr_versioned::read_table(directory, Table_Path, state, Payload_Spread);
-  return problem.empty();
-}
 
 // The child: random transactions for ever, each reported to the parent. It
 // writes lines "P <kind> <state>" before a commit may begin and
@@ -123,17 +103,21 @@ class child_writer {
       : directory_(std::move(directory)), rng_(seed), pipe_fd_(pipe_fd) {}
 
   [[noreturn]] void run() {
-    if (sr_open_tree_1(&tree_, 0, 0) != 0 ||
-        sr_mount_local_tree_1(tree_, "/disk", directory_.c_str(), 0) != 0) {
+    if ((tree_ = mounted_tree(directory_)) == nullptr) {
       fail("no tree");
     }
     open_or_create();
     for (;;) {
       const bool implicit = rng_() % 2 == 0;
-      reopen(implicit ? Open_Implicit : Open_Explicit);
+      check(sr_close_table_1(table_), "sr_close_table_1");
+      check(open_table(tree_, Table_Path, implicit ? Open_Implicit : Open_Explicit, &table_),
+            "sr_open_hashed_key_table_1");
       for (uint32_t steps = 1 + rng_() % 10; steps > 0; --steps) {
         if (implicit) {
-          implicit_change();
+          // Deleted by packed index: the row's place among the live rows.
+          no_problem(changes_.implicit_change(
+              table_, committed_, true, [this](const auto &next) { announce("implicit", next); }));
+          confirm("implicit", committed_);
         } else {
           explicit_transaction();
         }
@@ -159,12 +143,16 @@ class child_writer {
     say(std::string("P ") + p_kind + " " + encode(state));
   }
 
+  ino_t file_inode() const {
+    struct stat status {};
+    stat((directory_ + "/" + Table_File).c_str(), &status);
+    return status.st_ino;
+  }
+
   void confirm(const char *p_kind, const table_state &state) {
     committed_ = state;
-    struct stat status {};
-    const bool replaced =
-        stat((directory_ + "/" + Table_File).c_str(), &status) == 0 && status.st_ino != file_inode_;
-    file_inode_ = status.st_ino;
+    const bool replaced = file_inode() != file_inode_;
+    file_inode_ = file_inode();
     const bool created = std::strcmp(p_kind, "create") == 0;
     say(std::string("C ") + (replaced && !created ? "rewritten" : p_kind) + " " + encode(state));
   }
@@ -174,186 +162,64 @@ class child_writer {
       fail(std::string(p_call) + " gave " + std::to_string(rc));
     }
   }
+  void no_problem(const std::string &problem) {
+    if (!problem.empty()) {
+      fail(problem);
+    }
+  }
 
   void open_or_create() {
-    const int32_t rc = sr_open_hashed_key_table_1(tree_, Table_Path, Open_Implicit, Hash_Buckets,
-                                                  hash_id, compare_ids, &table_);
+    const int32_t rc = open_table(tree_, Table_Path, Open_Implicit, &table_);
     if (rc == SR_E_NO_TABLE) {
-      table_state created;
-      created.exists = true;
-      created.counter = 1;
+      const table_state created{true, 1, {}};
       announce("create", created);
-      std::vector<sr_column_t> columns = table_columns();
-      check(sr_create_hashed_key_table_1(tree_, Table_Path, columns.data(), 3,
-                                         rng_() % 2 ? Create_Implicit : Create_Explicit,
-                                         Hash_Buckets, hash_id, compare_ids, &table_),
+      check(create_table(tree_, Table_Path, rng_() % 2 ? 0 : 4, &table_),
             "sr_create_hashed_key_table_1");
       confirm("create", created);
     } else {
       check(rc, "sr_open_hashed_key_table_1");
-      if (const std::string problem = read_rows(table_, committed_, Payload_Spread);
-          !problem.empty()) {
-        fail(problem);
-      }
-      struct stat status {};
-      stat((directory_ + "/" + Table_File).c_str(), &status);
-      file_inode_ = status.st_ino;
+      no_problem(read_rows(table_, committed_, Payload_Spread));
+      file_inode_ = file_inode();
     }
     for (const auto &[id, version] : committed_.rows) {
-      next_id_ = std::max(next_id_, id + 1);
+      changes_.next_id = std::max(changes_.next_id, id + 1);
     }
-  }
-
-  void reopen(int32_t mode) {
-    check(sr_close_table_1(table_), "sr_close_table_1");
-    check(sr_open_hashed_key_table_1(tree_, Table_Path, mode, Hash_Buckets, hash_id, compare_ids,
-                                     &table_),
-          "sr_open_hashed_key_table_1");
-  }
-
-  int32_t any_row(const table_state &state) {
-    auto row = state.rows.begin();
-    std::advance(row, rng_() % state.rows.size());
-    return row->first;
-  }
-
-  int32_t add_row(int32_t id, int32_t version) {
-    return sr_versioned::add_row(table_, id, version, Payload_Spread);
-  }
-
-  int32_t set_row(int32_t id, int32_t version) {
-    return sr_versioned::set_row(table_, id, version, Payload_Spread);
-  }
-
-  // add, set or delete, each picked so that the row count stays within
-  // bounds.
-  enum class change { add, set, remove };
-  change pick_change(const table_state &state) {
-    if (state.rows.size() < Fewest_Rows) {
-      return change::add;
-    }
-    if (state.rows.size() > Most_Rows) {
-      return change::remove;
-    }
-    return static_cast<change>(rng_() % 3);
-  }
-
-  // One change through the implicitly controlled handle: applied and
-  // committed by the call itself.
-  void implicit_change() {
-    table_state next = committed_;
-    ++next.counter;
-    switch (pick_change(committed_)) {
-      case change::add: {
-        const int32_t id = next_id_++;
-        next.rows[id] = 1;
-        announce("implicit", next);
-        check(add_row(id, 1), "sr_add_row_1");
-        break;
-      }
-      case change::set: {
-        const int32_t id = any_row(committed_);
-        const int32_t version = ++next.rows[id];
-        announce("implicit", next);
-        check(set_row(id, version), "sr_set_fields_by_key_1");
-        break;
-      }
-      case change::remove: {
-        // By packed index: the row's place among the live rows.
-        const auto at = static_cast<int32_t>(rng_() % committed_.rows.size());
-        qv_value_t id{};
-        check(sr_get_field_by_index_1(table_, at, "Id", &id), "sr_get_field_by_index_1");
-        next.rows.erase(id.val_int32);
-        announce("implicit", next);
-        check(sr_delete_row_by_index_1(table_, static_cast<uint32_t>(at)),
-              "sr_delete_row_by_index_1");
-        break;
-      }
-    }
-    confirm("implicit", next);
   }
 
   // Several changes through the explicitly controlled handle, then abort,
   // apply and abort, or apply (appending or rewriting) and commit.
   void explicit_transaction() {
     table_state next = committed_;
-    std::set<int32_t> deleted;
-    for (uint32_t changes = 1 + rng_() % 8; changes > 0; --changes) {
-      if (!deleted.empty() && rng_() % 4 == 0) {
-        // A row deleted in this transaction comes back.
-        const int32_t id = *deleted.begin();
-        deleted.erase(deleted.begin());
-        const auto old = committed_.rows.find(id);
-        const int32_t version = old == committed_.rows.end() ? 1 : old->second + 1;
-        next.rows[id] = version;
-        check(add_row(id, version), ("sr_add_row_1, reviving " + std::to_string(id)).c_str());
-        continue;
-      }
-      switch (pick_change(next)) {
-        case change::add: {
-          const int32_t id = next_id_++;
-          next.rows[id] = 1;
-          check(add_row(id, 1),
-                ("sr_add_row_1 in a transaction, adding " + std::to_string(id)).c_str());
-          break;
-        }
-        case change::set: {
-          const int32_t id = any_row(next);
-          check(set_row(id, ++next.rows[id]), "sr_set_fields_by_key_1");
-          break;
-        }
-        case change::remove: {
-          const int32_t id = any_row(next);
-          next.rows.erase(id);
-          deleted.insert(id);
-          check(sr_delete_rows_1(table_, "Id == $i", id), "sr_delete_rows_1");
-          break;
-        }
-      }
-    }
+    no_problem(changes_.transaction(table_, committed_, next, 1 + rng_() % 8));
     const uint64_t counter = rng_() % 2 ? 0 : committed_.counter + 1 + rng_() % 3;
     next.counter = counter == 0 ? committed_.counter + 1 : counter;
     auto *p_table = static_cast<sr_i_table_t *>(table_);
     // A rewrite is forced through the internal apply; the table's write
     // lock is of no use in this single-threaded process.
-    switch (rng_() % 20) {
-      case 0:
-        check(sr_abort_1(table_), "sr_abort_1");
-        return;
-      case 1:
-        check(sr_apply_1(table_, counter), "sr_apply_1");
-        check(sr_abort_1(table_), "sr_abort_1 after an append");
-        return;
-      case 2:
-        check(sr_i_apply(p_table, 1, counter), "sr_i_apply");
-        check(sr_abort_1(table_), "sr_abort_1 after a rewrite");
-        return;
-      case 3:
-      case 4:
-      case 5:
-      case 6:
-        announce("rewrite", next);
-        check(sr_i_apply(p_table, 1, counter), "sr_i_apply");
-        check(sr_commit_1(table_), "sr_commit_1");
-        confirm("rewrite", next);
-        return;
-      default:
-        announce("apply", next);
-        check(sr_apply_1(table_, counter), "sr_apply_1");
-        check(sr_commit_1(table_), "sr_commit_1");
-        confirm("apply", next);
-        return;
+    const uint32_t choice = rng_() % 20;
+    if (choice == 0) {
+      check(sr_abort_1(table_), "sr_abort_1");
+    } else if (choice <= 2) {
+      check(choice == 1 ? sr_apply_1(table_, counter) : sr_i_apply(p_table, 1, counter),
+            "apply before an abort");
+      check(sr_abort_1(table_), "sr_abort_1 after an apply");
+    } else {
+      const char *p_kind = choice <= 6 ? "rewrite" : "apply";
+      announce(p_kind, next);
+      check(choice <= 6 ? sr_i_apply(p_table, 1, counter) : sr_apply_1(table_, counter), p_kind);
+      check(sr_commit_1(table_), "sr_commit_1");
+      confirm(p_kind, next);
     }
   }
 
   std::string directory_;
   std::mt19937 rng_;
+  random_changes changes_{rng_, Payload_Spread, 12, 60};
   int pipe_fd_;
   sr_opaque_handle_t tree_ = nullptr;
   sr_opaque_handle_t table_ = nullptr;
   table_state committed_;
   ino_t file_inode_ = 0;
-  int32_t next_id_ = 1;
 };
 
 // What one child left in the pipe: the last state reported committed and
@@ -496,8 +362,8 @@ TEST_F(Crash, AKilledWriterLeavesTheLastCommittedStateOrTheOneInFlight) {
       known = *report.committed;
     }
     table_state found;
-    std::string problem;
-    const bool read = read_table(directory_, found, problem);
+    const std::string problem = read_table(directory_, Table_Path, found, Payload_Spread);
+    const bool read = problem.empty();
     const bool old_state = read && found == known;
     const bool new_state = read && report.announced && found == *report.announced;
     if (report.announced) {

@@ -1,10 +1,9 @@
 // The input and output primitives of table files: bounded retries of
 // interrupted calls, the codes of a full disk and of other failures, short
-// and partial writes and reads, the diagnostic file of a failed flush,
-// close-on-exec opens, and the per-descriptor file lock.
+// and partial writes and reads, the diagnostic file of a failed flush, and
+// the per-descriptor file lock.
 
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -23,8 +22,11 @@
 #include "qv_sr.h"
 #include "sr_i_file_system.h"
 #include "sr_i_files.h"
+#include "sr_row_test_support.h"
 
 namespace {
+
+using sr_test::last_error;
 
 // What the scripted calls do: the first `interruptions` attempts fail with
 // EINTR, the next `good_attempts` reach the C library (moving at most
@@ -58,9 +60,6 @@ int counting_usleep(useconds_t microseconds) {
   ++Script.pauses;
   return 0;
 }
-int scripted_open(const char *p_path, int flags, mode_t mode) {
-  return scripted_failure() ? -1 : Sr_Default_File_System.open(p_path, flags, mode);
-}
 ssize_t scripted_write(int fd, const void *p_buffer, size_t length) {
   return scripted_failure() ? -1 : ::write(fd, p_buffer, std::min(length, Script.most_bytes));
 }
@@ -82,14 +81,6 @@ ssize_t scripted_writev(int fd, const iovec *p_io_vector, int count) {
     bytes.append(static_cast<const char *>(p_io_vector[at].iov_base), p_io_vector[at].iov_len);
   }
   return ::write(fd, bytes.data(), std::min(bytes.size(), Script.most_bytes));
-}
-
-std::string last_error_text() {
-  cu_error_t *p_error = nullptr;
-  EXPECT_EQ(cu_get_error_1(&p_error), 0);
-  std::string text = p_error->p_text;
-  cu_rel_error_1(p_error);
-  return text;
 }
 
 class Files : public ::testing::Test {
@@ -176,7 +167,7 @@ TEST_F(Files, InterruptsAreRetried100TimesAFullDiskIs16AndOtherFailuresRaise10) 
       const bool quiet_full_disk = failure == ENOSPC && primitive.p_call != std::string("read");
       const int raised = interruptions == INT_MAX ? EINTR : quiet_full_disk ? 0 : failure;
       EXPECT_EQ(rc, raised != 0 ? SR_E_SYSTEM_CALL : failure != 0 ? SR_E_FILESYSTEM_FULL : 0);
-      const std::string text = last_error_text();
+      const std::string text = last_error().second;
       if (raised == 0) {
         EXPECT_EQ(text, "");
       } else {
@@ -249,26 +240,6 @@ TEST_F(Files, EveryFailedFlushRewritesTheDiagnosticFile) {
   text = contents(diagnostic);
   ASSERT_TRUE(std::regex_match(text, match, line_format)) << text;  // one line: truncated
   EXPECT_EQ(match[1], "5");
-}
-
-TEST_F(Files, OpenIsCloseOnExecCreates0644AndGivesUpOnEndlessInterrupts) {
-  const mode_t previous_mask = ::umask(022);
-  const int fd = sr_i_open_file(path("new").c_str(), O_RDWR | O_CREAT, Sr_File_Mode);
-  ::umask(previous_mask);
-  ASSERT_GE(fd, 0);
-  EXPECT_TRUE(::fcntl(fd, F_GETFD) & FD_CLOEXEC);
-  struct stat status {};
-  ASSERT_EQ(::fstat(fd, &status), 0);
-  EXPECT_EQ(status.st_mode & 07777, 0644u);
-  ::close(fd);
-
-  Sr_File_System.open = scripted_open;
-  Script.interruptions = INT_MAX;
-  errno = 0;
-  EXPECT_EQ(sr_i_open_file(path().c_str(), O_RDONLY, 0), -1);
-  EXPECT_EQ(errno, EINTR);
-  EXPECT_EQ(Script.attempts, 101);
-  EXPECT_EQ(last_error_text(), "");  // the caller reports
 }
 
 bool refused(int locked) {

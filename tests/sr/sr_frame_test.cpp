@@ -7,62 +7,45 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <functional>
 #include <semaphore>
 #include <stdexcept>
 #include <string>
 #include <thread>
 
 #include "sr_i_frame.h"
+#include "sr_row_test_support.h"
 
 namespace {
 
 constexpr sr_i_entry_point_t Changing_Call{1, true};
 constexpr sr_i_entry_point_t Reading_Call{45, false};
 
-struct last_error {
-  int32_t code;
-  std::string text;
-};
-
-last_error read_last_error() {
-  cu_error_t *p_error = nullptr;
-  EXPECT_EQ(cu_get_error_1(&p_error), 0);
-  last_error copy{p_error->code, p_error->p_text};
-  cu_rel_error_1(p_error);
-  return copy;
-}
-
-TEST(Frame, SuccessClearsAStaleMessage) {
-  cu_set_error_1(205, 0, "", 1, 22, "stale\n");
-  EXPECT_EQ(sr_i_run_entry_point(Reading_Call, [] { return 0; }), 0);
-  EXPECT_EQ(read_last_error().code, 0);
-  EXPECT_EQ(read_last_error().text, "");
-}
-
-TEST(Frame, FailureKeepsTheMessageRaisedWhereItHappened) {
-  EXPECT_EQ(sr_i_run_entry_point(Changing_Call, [] { return sr_i_raise(SR_E_NO_ROWS); }), 205);
-  const last_error error = read_last_error();
-  EXPECT_EQ(error.code, 205);
-  EXPECT_EQ(error.text, "2605-205 There are no rows to delete from the table.\n");
-}
-
-TEST(Frame, OutOfMemoryBecomes12NamingTheEntryPoint) {
-  const int32_t rc =
-      sr_i_run_entry_point(Changing_Call, []() -> int32_t { throw std::bad_alloc(); });
-  EXPECT_EQ(rc, SR_E_NO_MEMORY);
-  const last_error error = read_last_error();
-  EXPECT_EQ(error.code, 12);
-  EXPECT_EQ(error.text.rfind("2605-012 Memory could not be allocated in the TestBody function", 0),
-            0u)
-      << error.text;
-  EXPECT_NE(error.text.find("of file tests/sr/sr_frame_test"), std::string::npos);
-}
-
-TEST(Frame, AnyOtherExceptionBecomes15) {
-  const int32_t rc = sr_i_run_entry_point(
-      Reading_Call, []() -> int32_t { throw std::runtime_error("unexpected"); });
-  EXPECT_EQ(rc, SR_E_INTERNAL);
-  EXPECT_EQ(read_last_error().code, 15);
+// What the body of an entry point ends with becomes the call's code and
+// the thread's error: success clears a stale message, a raised error keeps
+// its message, no memory is 12 naming the entry point, anything else 15.
+TEST(Frame, TheBodysOutcomeBecomesTheCodeAndTheError) {
+  const struct {
+    std::function<int32_t()> body;
+    int32_t code;
+    std::string message_start;
+  } cases[] = {
+      {[] { return 0; }, 0, ""},
+      {[] { return sr_i_raise(SR_E_NO_ROWS); }, 205,
+       "2605-205 There are no rows to delete from the table.\n"},
+      {[]() -> int32_t { throw std::bad_alloc(); }, 12,
+       "2605-012 Memory could not be allocated in the TestBody function"},
+      {[]() -> int32_t { throw std::runtime_error("unexpected"); }, 15, "2605-015 "},
+  };
+  for (const auto &one : cases) {
+    cu_set_error_1(205, 0, "", 1, 22, "stale\n");
+    EXPECT_EQ(sr_i_run_entry_point(Changing_Call, one.body), one.code);
+    const auto [code, text] = sr_test::last_error();
+    EXPECT_EQ(code, one.code);
+    EXPECT_TRUE(text.starts_with(one.message_start)) << text;
+    EXPECT_EQ(text.empty(), one.code == 0) << text;
+  }
+  EXPECT_NE(sr_test::last_error().second.find("of file tests/sr/sr_frame_test"), std::string::npos);
 }
 
 TEST(Frame, ChangingCallsHoldForkMutexWhileReadingCallsDoNot) {

@@ -1,6 +1,6 @@
-// The key hash table: client and built-in hashing, the two key qualifiers,
-// unlinking by identity, bucket numbers out of range, the statistics, and a
-// random sequence of operations checked against a std::multimap.
+// The key hash table: client and built-in hashing, bucket numbers out of
+// range, the statistics, and a random sequence of operations under both key
+// qualifiers, with unlinking by identity, checked against a std::multimap.
 
 #include <gtest/gtest.h>
 
@@ -11,8 +11,11 @@
 
 #include "qv_cu.h"
 #include "sr_i_hash_table.h"
+#include "sr_row_test_support.h"
 
 namespace {
+
+using sr_test::last_error;
 
 constexpr uint32_t Buckets = 8;
 
@@ -27,23 +30,12 @@ int32_t compare_keys(const void *p_stored_key, const void *p_key) {
   return stored_key == *static_cast<const uint32_t *>(p_key) ? 0 : 1;
 }
 
-int32_t last_error_code(std::string *p_text = nullptr) {
-  cu_error_t *p_error = nullptr;
-  EXPECT_EQ(cu_get_error_1(&p_error), 0);
-  const int32_t code = p_error->code;
-  if (p_text != nullptr) {
-    *p_text = p_error->p_text;
-  }
-  cu_rel_error_1(p_error);
-  return code;
-}
-
 // The row found for the key, or -1 for a clean 202 (returned, nothing raised).
 int64_t row_for(const sr_hash_table_t *p_table, const void *p_key) {
   uint32_t row = 0;
   cu_set_no_error_1();
   const int32_t rc = sr_i_hash_table_get_index(p_table, p_key, &row, nullptr);
-  EXPECT_EQ(last_error_code(), 0);
+  EXPECT_EQ(last_error().first, 0);
   if (rc == SR_E_NO_ROW_FOR_KEY) {
     return -1;
   }
@@ -78,52 +70,18 @@ TEST_F(ClientHashTable, PrimaryKeyRefusesAnEqualKeyAndReturnsTheExistingElement)
   // Modifier bits above the base qualifier do not turn the check off.
   EXPECT_EQ(add(three_again, 2, static_cast<sr_qualifier_t>(SR_PRIMARY_KEY | SR_PROTECTED)),
             SR_E_DUPLICATE_KEY);
-  EXPECT_EQ(last_error_code(), 0);
+  EXPECT_EQ(last_error().first, 0);
   EXPECT_EQ(p_element, p_first);
   EXPECT_EQ(row_for(p_table, 3), 0);
   EXPECT_EQ(row_for(p_table, 11), 1);
   EXPECT_EQ(row_for(p_table, 19), -1);
-}
-
-TEST_F(ClientHashTable, NoCheckKeepsEqualKeysAndTheLastAddedWins) {
-  const uint32_t first = 5, second = 5;
-  ASSERT_EQ(add(first, 1, SR_PRIMARY_KEY_NOCHECK), 0);
-  ASSERT_EQ(add(second, 2, SR_PRIMARY_KEY_NOCHECK), 0);
-  uint32_t row = 0;
-  const void **p_p_key = nullptr;
-  ASSERT_EQ(sr_i_hash_table_get_index(p_table, &first, &row, &p_p_key), 0);
-  EXPECT_EQ(row, 2u);
-  EXPECT_EQ(*p_p_key, &second);  // the field itself, so a caller can repoint it
-
-  ASSERT_EQ(sr_i_hash_table_remove(p_table, &first), 0);
-  EXPECT_EQ(row_for(p_table, 5), 1);
-  ASSERT_EQ(sr_i_hash_table_remove(p_table, &first), 0);
-  EXPECT_EQ(row_for(p_table, 5), -1);
-  EXPECT_EQ(sr_i_hash_table_remove(p_table, &first), SR_E_NO_ROW_FOR_KEY);
-  EXPECT_EQ(last_error_code(), SR_E_NO_ROW_FOR_KEY);
-}
-
-TEST_F(ClientHashTable, RemoveElementUnlinksThatElementFromTheMiddleOrTheHead) {
-  const uint32_t keys[] = {2, 10, 18};  // one bucket; the chain is 18, 10, 2
-  sr_hash_table_element_t *p_elements[3];
-  for (uint32_t at = 0; at < 3; ++at) {
-    ASSERT_EQ(add(keys[at], at, SR_PRIMARY_KEY), 0);
-    p_elements[at] = p_element;
-  }
-  std::string text;
-  EXPECT_EQ(sr_i_hash_table_remove_element(p_table, 3, p_elements[0]), SR_E_NO_ROW_FOR_KEY);
-  EXPECT_EQ(last_error_code(&text), SR_E_NO_ROW_FOR_KEY);
-  EXPECT_EQ(text, "2605-202 There is no row corresponding to the specified key value.\n");
-
-  ASSERT_EQ(sr_i_hash_table_remove_element(p_table, 2, p_elements[1]), 0);
-  EXPECT_EQ(row_for(p_table, 2), 0);
-  EXPECT_EQ(row_for(p_table, 10), -1);
-  EXPECT_EQ(row_for(p_table, 18), 2);
-  ASSERT_EQ(sr_i_hash_table_remove_element(p_table, 2, p_elements[2]), 0);
-  EXPECT_EQ(row_for(p_table, 2), 0);
-  EXPECT_EQ(row_for(p_table, 18), -1);
-  ASSERT_EQ(sr_i_hash_table_remove_element(p_table, 2, p_elements[0]), 0);
-  EXPECT_EQ(row_for(p_table, 2), -1);
+  // An element looked for in another bucket is not there: 202, no key named.
+  EXPECT_EQ(sr_i_hash_table_remove_element(p_table, 2, p_first), SR_E_NO_ROW_FOR_KEY);
+  EXPECT_EQ(last_error(),
+            std::make_pair(SR_E_NO_ROW_FOR_KEY,
+                           std::string("2605-202 There is no row corresponding to the specified "
+                                       "key value.\n")));
+  EXPECT_EQ(row_for(p_table, 3), 0);
 }
 
 TEST_F(ClientHashTable, StatisticsListNonEmptyBucketsThenTheTotals) {
@@ -149,7 +107,7 @@ TEST(HashTable, ClientBucketAtOrAboveTheCountIsRefusedWith15) {
   ASSERT_EQ(sr_i_hash_table_add(p_table, &inside, 4, &bucket, &p_element, SR_PRIMARY_KEY), 0);
   EXPECT_EQ(sr_i_hash_table_add(p_table, &outside, 5, &bucket, &p_element, SR_PRIMARY_KEY),
             SR_E_INTERNAL);
-  EXPECT_EQ(last_error_code(), SR_E_INTERNAL);
+  EXPECT_EQ(last_error().first, SR_E_INTERNAL);
   EXPECT_EQ(sr_i_hash_table_get_index(p_table, &outside, &row, nullptr), SR_E_INTERNAL);
   EXPECT_EQ(sr_i_hash_table_remove(p_table, &outside), SR_E_INTERNAL);
   EXPECT_EQ(sr_i_hash_table_remove_element(p_table, Buckets, p_element), SR_E_INTERNAL);

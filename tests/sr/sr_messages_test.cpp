@@ -6,7 +6,6 @@
 #include <nl_types.h>
 
 #include <cstdio>
-#include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
@@ -28,20 +27,6 @@ last_error read_last_error() {
   last_error copy{p_error->code, p_error->message, p_error->p_text};
   cu_rel_error_1(p_error);
   return copy;
-}
-
-TEST(MessageSet, BuiltInTableKeepsTheInterfaceOrder) {
-  EXPECT_STREQ(cu_mesgtbl_qv_sr_set[0], "Reserved: DO NOT USE!");
-  EXPECT_STREQ(cu_mesgtbl_qv_sr_set[7], "2605-100 A function was passed an invalid handle.\n");
-  EXPECT_STREQ(cu_mesgtbl_qv_sr_set[29],
-               "2605-212 An attempt was made to update a table that has applied but uncommitted "
-               "updates.\n");
-  EXPECT_STREQ(cu_mesgtbl_qv_sr_set[30],
-               "2605-016 The filesystem containing the local tree is full: mounted(%1$s) "
-               "mounted_over(%2$s).\n");
-  EXPECT_STREQ(cu_mesgtbl_qv_sr_set[31],
-               "2605-213 There is no row corresponding to the specified key value (%1$s) in "
-               "table (%2$s).\n");
 }
 
 TEST(MessageSet, EveryPlainCodeHasTheMessageOfItsNumber) {
@@ -104,58 +89,47 @@ TEST(RaisingErrors, EachRaisingFunctionUsesItsMessage) {
   EXPECT_EQ(read_last_error().message, 29);
 }
 
-// The key-not-found error: code 202, text of 213, key rendered by its type.
-std::string key_not_found_text(const char *p_table, qv_value_t key, qv_data_type_t type) {
-  EXPECT_EQ(trace_key_not_found(p_table, &key, type), SR_E_NO_ROW_FOR_KEY);
-  const last_error error = read_last_error();
-  EXPECT_EQ(error.code, 202);
-  EXPECT_EQ(error.message, SR_I_MESSAGE_KEY_NOT_FOUND);
-  return error.text;
-}
-
-std::string expected_text(const std::string &key, const std::string &table) {
-  return "2605-213 There is no row corresponding to the specified key value (" + key +
-         ") in table (" + table + ").\n";
-}
-
-TEST(KeyNotFound, NumericKeysAreRenderedByTheirType) {
-  qv_value_t key{};
-  key.val_int32 = -42;
-  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_INT32), expected_text("-42", "/cfg/t"));
-  key.val_uint32 = 4000000000u;
-  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_UINT32), expected_text("4000000000", "/cfg/t"));
-  key.val_int64 = -9000000000LL;
-  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_INT64), expected_text("-9000000000", "/cfg/t"));
-  key.val_uint64 = 18446744073709551615ULL;
-  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_UINT64),
-            expected_text("18446744073709551615", "/cfg/t"));
-  key.val_float32 = 1.5f;
-  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_FLOAT32), expected_text("1.5", "/cfg/t"));
-  key.val_float64 = 0.000125;
-  EXPECT_EQ(key_not_found_text("/cfg/t", key, QV_FLOAT64), expected_text("0.000125", "/cfg/t"));
-}
-
-TEST(KeyNotFound, StringKeysAreCutAt255Bytes) {
+// The key-not-found error: code 202, text of 213, the key rendered by its
+// type (strings cut at 255 bytes, handles as six hexadecimal groups), the
+// table named.
+TEST(KeyNotFound, TheKeyIsRenderedByItsType) {
   std::string long_key(300, 'k');
-  qv_value_t key{};
-  key.ptr_char = long_key.data();
-  EXPECT_EQ(key_not_found_text("t", key, QV_CHAR_PTR), expected_text(std::string(255, 'k'), "t"));
-}
-
-TEST(KeyNotFound, ResourceHandleKeysShowSixHexadecimalGroups) {
   qv_resource_handle_t handle{0, {0xa, 0xbeef, 0x12345678, 0xffffffff}};
   const uint16_t halves[2] = {0x0102, 0xfffe};  // the header's halves in memory order
   std::memcpy(&handle.header, halves, sizeof halves);
-  qv_value_t key{};
-  key.ptr_rsrc_handle = &handle;
-  EXPECT_EQ(key_not_found_text("t", key, QV_RSRC_HANDLE_PTR),
-            expected_text("0x0102 0xfffe 0x0000000a 0x0000beef 0x12345678 0xffffffff", "t"));
-}
-
-TEST(KeyNotFound, OtherTypesAndMissingTableNameHaveFixedTexts) {
-  qv_value_t key{};
-  EXPECT_EQ(key_not_found_text(nullptr, key, QV_BINARY_PTR),
-            expected_text("***UNKNOWN KEY TYPE****", "(UNKNOWN_TABLE_NAME)"));
+  qv_value_t keys[9] = {};
+  keys[0].val_int32 = -42;
+  keys[1].val_uint32 = 4000000000u;
+  keys[2].val_int64 = -9000000000LL;
+  keys[3].val_uint64 = 18446744073709551615ULL;
+  keys[4].val_float32 = 1.5f;
+  keys[5].val_float64 = 0.000125;
+  keys[6].ptr_char = long_key.data();
+  keys[7].ptr_rsrc_handle = &handle;
+  const struct {
+    qv_data_type_t type;
+    const char *p_table;
+    std::string key, table;
+  } cases[] = {
+      {QV_INT32, "/cfg/t", "-42", "/cfg/t"},
+      {QV_UINT32, "t", "4000000000", "t"},
+      {QV_INT64, "t", "-9000000000", "t"},
+      {QV_UINT64, "t", "18446744073709551615", "t"},
+      {QV_FLOAT32, "t", "1.5", "t"},
+      {QV_FLOAT64, "t", "0.000125", "t"},
+      {QV_CHAR_PTR, "t", std::string(255, 'k'), "t"},
+      {QV_RSRC_HANDLE_PTR, "t", "0x0102 0xfffe 0x0000000a 0x0000beef 0x12345678 0xffffffff", "t"},
+      {QV_BINARY_PTR, nullptr, "***UNKNOWN KEY TYPE****", "(UNKNOWN_TABLE_NAME)"},
+  };
+  for (size_t at = 0; at < std::size(cases); ++at) {
+    EXPECT_EQ(trace_key_not_found(cases[at].p_table, &keys[at], cases[at].type),
+              SR_E_NO_ROW_FOR_KEY);
+    const last_error error = read_last_error();
+    EXPECT_EQ(error.code, 202);
+    EXPECT_EQ(error.message, SR_I_MESSAGE_KEY_NOT_FOUND);
+    EXPECT_EQ(error.text, "2605-213 There is no row corresponding to the specified key value (" +
+                              cases[at].key + ") in table (" + cases[at].table + ").\n");
+  }
 }
 
 // A mount table written for one test.
@@ -174,45 +148,46 @@ class FilesystemFull : public ::testing::Test {
     Sr_Mount_Table_Path = saved_path_;
     std::filesystem::remove_all(directory_);
   }
-  void write_mount_table(const std::string &text) { std::ofstream(mount_table_) << text; }
-  std::string full_text_for(const char *p_path) {
-    EXPECT_EQ(trace_filesystem_full_for_path(p_path), SR_E_FILESYSTEM_FULL);
-    return read_last_error().text;
-  }
-  static std::string expected(const std::string &device, const std::string &directory) {
-    return "2605-016 The filesystem containing the local tree is full: mounted(" + device +
-           ") mounted_over(" + directory + ").\n";
-  }
 
   std::filesystem::path directory_;
   std::string mount_table_;
   const char *saved_path_ = nullptr;
 };
 
-TEST_F(FilesystemFull, LongestWholeComponentPrefixWins) {
-  write_mount_table(
-      "/dev/root / ext4 rw 0 0\n"
-      "/dev/sda2 /data ext4 rw 0 0\n"
-      "/dev/sda3 /data/big xfs rw 0 0\n"
-      "tmpfs /dat tmpfs rw 0 0\n"
-      "/dev/sdb1 /mnt/my\\040disk ext4 rw 0 0\n"
-      "short line\n");
-  EXPECT_EQ(full_text_for("/data/big/tables/t1"), expected("/dev/sda3", "/data/big"));
-  EXPECT_EQ(full_text_for("/data/bigger/t1"), expected("/dev/sda2", "/data"));
-  EXPECT_EQ(full_text_for("/data"), expected("/dev/sda2", "/data"));
-  EXPECT_EQ(full_text_for("/dat/t"), expected("tmpfs", "/dat"));
-  EXPECT_EQ(full_text_for("/database/t"), expected("/dev/root", "/"));
-  EXPECT_EQ(full_text_for("/mnt/my disk/t"), expected("/dev/sdb1", "/mnt/my disk"));
-}
-
-TEST_F(FilesystemFull, LaterMountOverTheSameDirectoryWins) {
-  write_mount_table("/dev/sda2 /srv ext4 rw 0 0\noverlay /srv overlay rw 0 0\n");
-  EXPECT_EQ(full_text_for("/srv/registry/t"), expected("overlay", "/srv"));
-}
-
-TEST_F(FilesystemFull, WithoutRootEntryTheDeviceIsUnknown) {
-  write_mount_table("/dev/sda2 /data ext4 rw 0 0\n");
-  EXPECT_EQ(full_text_for("/home/t"), expected("UNKNOWN", "/"));
+TEST_F(FilesystemFull, TheLongestWholeComponentPrefixNamesTheFilesystem) {
+  // Each case with a mount table of its own writes it; the others use the
+  // last one written.
+  const struct {
+    std::string mount_table, path, device, directory;
+  } cases[] = {
+      {"/dev/root / ext4 rw 0 0\n"
+       "/dev/sda2 /data ext4 rw 0 0\n"
+       "/dev/sda3 /data/big xfs rw 0 0\n"
+       "tmpfs /dat tmpfs rw 0 0\n"
+       "/dev/sdb1 /mnt/my\\040disk ext4 rw 0 0\n"
+       "short line\n",
+       "/data/big/tables/t1", "/dev/sda3", "/data/big"},
+      {"", "/data/bigger/t1", "/dev/sda2", "/data"},
+      {"", "/data", "/dev/sda2", "/data"},
+      {"", "/dat/t", "tmpfs", "/dat"},
+      {"", "/database/t", "/dev/root", "/"},
+      {"", "/mnt/my disk/t", "/dev/sdb1", "/mnt/my disk"},
+      // A later mount over the same directory wins.
+      {"/dev/sda2 /srv ext4 rw 0 0\noverlay /srv overlay rw 0 0\n", "/srv/registry/t", "overlay",
+       "/srv"},
+      // Without an entry for the root the device is unknown.
+      {"/dev/sda2 /data ext4 rw 0 0\n", "/home/t", "UNKNOWN", "/"},
+  };
+  for (const auto &one : cases) {
+    if (!one.mount_table.empty()) {
+      std::ofstream(mount_table_) << one.mount_table;
+    }
+    EXPECT_EQ(trace_filesystem_full_for_path(one.path.c_str()), SR_E_FILESYSTEM_FULL);
+    EXPECT_EQ(read_last_error().text,
+              "2605-016 The filesystem containing the local tree is full: mounted(" + one.device +
+                  ") mounted_over(" + one.directory + ").\n")
+        << one.path;
+  }
 }
 
 TEST_F(FilesystemFull, UnreadableMountTableRaisesNothing) {

@@ -1,12 +1,10 @@
 // Persistent tables: the first file of a new table, rows surviving the
 // tree that wrote them, append and rewrite applies with their commits and
-// aborts, the writer's file lock, and damaged files refused with a clear
-// code.
+// aborts, and damaged files refused with a clear code.
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
@@ -17,7 +15,6 @@
 #include <string>
 #include <vector>
 
-#include "sr_i_files.h"
 #include "sr_i_transaction.h"
 #include "sr_row_test_support.h"
 
@@ -57,12 +54,7 @@ class Persistent : public RowTables {
   }
 
   // A fresh tree with the same mount point: a second program.
-  sr_opaque_handle_t second_tree() {
-    sr_opaque_handle_t tree = nullptr;
-    EXPECT_EQ(sr_open_tree_1(&tree, 0, 0), 0);
-    EXPECT_EQ(sr_mount_local_tree_1(tree, "/disk", directory_.c_str(), 0), 0);
-    return tree;
-  }
+  sr_opaque_handle_t second_tree() const { return mounted_tree(directory_); }
 
   std::string path(const char *p_name) const { return directory_ + "/" + p_name; }
 
@@ -85,16 +77,6 @@ TEST_F(Persistent, ANewTableIsItsMetadataAndAnEmptyCommitRecord) {
   ASSERT_EQ(stat(file.c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 0777, 0644u);
   EXPECT_EQ(fcntl(object(table)->file_fd, F_GETFD) & FD_CLOEXEC, FD_CLOEXEC);
-
-  // The file exists: another tree cannot create the table again, and the
-  // file is left as it was.
-  sr_opaque_handle_t other = second_tree();
-  std::vector<sr_column_t> columns = {column("name", QV_CHAR_PTR, SR_PRIMARY_KEY)};
-  sr_opaque_handle_t again = nullptr;
-  EXPECT_EQ(sr_create_table_1(other, "/disk/cfg/services", columns.data(), 1, 0, &again),
-            SR_E_TABLE_EXISTS);
-  EXPECT_EQ(file_bytes(file), bytes);
-  EXPECT_EQ(sr_close_tree_1(other), 0);
 }
 
 TEST_F(Persistent, CommittedRowsOutliveTheirTree) {
@@ -104,12 +86,10 @@ TEST_F(Persistent, CommittedRowsOutliveTheirTree) {
   ASSERT_EQ(sr_delete_row_by_index_1(table, 0), 0);
   qv_value_t three = int32_value(3);
   ASSERT_EQ(sr_set_field_by_key_1(table, string_value("b"), "count", &three), 0);
-  std::vector<unsigned char> metadata(4, 'm');
-  auto *p_metadata = static_cast<qv_binary_t *>(std::malloc(sizeof(qv_binary_t) + 4));
-  p_metadata->length = 4;
-  std::memcpy(p_metadata->data, "meta", 4);
-  ASSERT_EQ(sr_set_application_metadata_1(table, p_metadata), 0);
-  std::free(p_metadata);
+  auto metadata = zeroed_block<qv_binary_t>(4);
+  metadata->length = 4;
+  std::memcpy(metadata->data, "meta", 4);
+  ASSERT_EQ(sr_set_application_metadata_1(table, metadata.get()), 0);
   const uint64_t counter = object(table)->change_counter;
 
   sr_opaque_handle_t reader_tree = second_tree();
@@ -128,8 +108,7 @@ TEST_F(Persistent, CommittedRowsOutliveTheirTree) {
 TEST_F(Persistent, AnAppliedButUncommittedTailIsIgnoredAndAbortCutsItOff) {
   sr_opaque_handle_t table = create_named_counts("/disk/t", Explicit);
   ASSERT_EQ(add_named(table, "a", 1), 0);
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
+  apply_commit(table);
   const auto committed = file_bytes(path("t"));
   ASSERT_EQ(add_named(table, "b", 2), 0);
   ASSERT_EQ(sr_apply_1(table, 0), 0);
@@ -146,8 +125,7 @@ TEST_F(Persistent, AnAppliedButUncommittedTailIsIgnoredAndAbortCutsItOff) {
   ASSERT_EQ(sr_abort_1(table), 0);
   EXPECT_EQ(file_bytes(path("t")), committed);
   ASSERT_EQ(add_named(table, "c", 3), 0);
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
+  apply_commit(table);
   ASSERT_EQ(sr_open_table_1(other, "/disk/t", 1, &reader), 0);
   EXPECT_EQ(count_of(reader, "c", 0), 3);
   EXPECT_EQ(count_of(reader, "b", 0), -1);
@@ -158,20 +136,16 @@ TEST_F(Persistent, ARewriteLeavesOnlyTheLiveRows) {
   sr_opaque_handle_t table = create_named_counts("/disk/big", Explicit, SR_PRIMARY_KEY_NOCHECK);
   const std::string note(300, 'n');
   for (int row = 0; row < 100; ++row) {
-    qv_value_t name = string_value(std::to_string(row).c_str()), text = string_value(note.c_str());
     const std::string key = std::to_string(row);
-    name = string_value(key.c_str());
-    const char *names[] = {"name", "note"};
-    qv_value_t *values[] = {&name, &text};
-    ASSERT_EQ(sr_add_row_1(table, names, values, 2), 0);
+    ASSERT_EQ(add_fields(table, {{"name", string_value(key.c_str())},
+                                 {"note", string_value(note.c_str())}}),
+              0);
   }
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
+  apply_commit(table);
   for (int row = 0; row < 90; ++row) {
     ASSERT_EQ(sr_delete_row_by_index_1(table, static_cast<uint32_t>(row)), 0);
   }
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
+  apply_commit(table);
   const size_t before = file_bytes(path("big")).size();
   ASSERT_GT(before, 16384u);
   ASSERT_EQ(sr_i_rewrite_wanted(object(table)), 1u);
@@ -186,8 +160,7 @@ TEST_F(Persistent, ARewriteLeavesOnlyTheLiveRows) {
   // The rewritten file is a committed state of its own, and appends go on
   // from it.
   ASSERT_EQ(add_named(table, "new", 7), 0);
-  ASSERT_EQ(sr_apply_1(table, 0), 0);
-  ASSERT_EQ(sr_commit_1(table), 0);
+  apply_commit(table);
   sr_opaque_handle_t other = second_tree();
   sr_opaque_handle_t reader = nullptr;
   ASSERT_EQ(sr_open_table_1(other, "/disk/big", 1, &reader), 0);
@@ -215,26 +188,6 @@ TEST_F(Persistent, AReadOnlyTableOpenedForWritingIsReadAgain) {
   EXPECT_EQ(object(reader)->references, 2u);
   EXPECT_EQ(count_of(reader, "late", 0), 5);
   EXPECT_EQ(add_named(reader, "mine", 6), 0);
-}
-
-TEST_F(Persistent, AWritersLockOutlivesOtherDescriptorsOfItsFile) {
-  sr_opaque_handle_t writer = create_named_counts("/disk/t", Implicit);
-  // Another tree of this process opens and closes the same file.
-  sr_opaque_handle_t other = second_tree();
-  sr_opaque_handle_t reader = nullptr;
-  ASSERT_EQ(sr_open_table_1(other, "/disk/t", 1, &reader), 0);
-  ASSERT_EQ(sr_close_tree_1(other), 0);
-
-  const std::string file = path("t");
-  const pid_t child = fork();
-  if (child == 0) {
-    const int fd = sr_i_open_file(file.c_str(), O_RDWR, 0644);
-    _exit(fd >= 0 && sr_i_lock_file(fd, false) != 0 ? 0 : 1);
-  }
-  int status = 0;
-  ASSERT_EQ(waitpid(child, &status, 0), child);
-  EXPECT_EQ(WEXITSTATUS(status), 0) << "the child took the writer's lock";
-  ASSERT_EQ(sr_close_table_1(writer), 0);
 }
 
 TEST_F(Persistent, DamagedFilesAreRefusedWithACode) {
@@ -288,7 +241,7 @@ TEST_F(Persistent, RepairRemovesLeftoverRewriteFilesOnly) {
   ASSERT_EQ(sr_close_table_1(create_named_counts("/disk/t", Implicit)), 0);
   const auto table_file = file_bytes(path("t"));
   write_bytes(path("t.rewrite"), {1, 2, 3});
-  ASSERT_EQ(create_named_counts("/transient", Implicit) != nullptr, true);
+  ASSERT_NE(create_named_counts("/transient", Implicit), nullptr);
   const char *paths[] = {"/transient", "/disk/t", "/disk/never"};
   EXPECT_EQ(sr_repair_tables_1(tree_, paths, 3), 0);
   EXPECT_FALSE(std::filesystem::exists(path("t.rewrite")));

@@ -22,15 +22,12 @@
 
 #include <algorithm>
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <iostream>
 #include <iterator>
 #include <map>
-#include <optional>
 #include <random>
-#include <set>
 #include <string>
 #include <vector>
 
@@ -44,9 +41,6 @@ namespace {
 
 using namespace sr_versioned;
 
-constexpr int32_t Open_For_Reading = 1;
-constexpr int32_t Open_Implicit = 2;
-constexpr int32_t Open_Explicit = 6;
 constexpr const char *Table_Path = "/disk/power/t";
 // The script's seed; SR_POWER_LOSS_SEED runs another script.
 uint32_t script_seed() {
@@ -60,8 +54,6 @@ constexpr int Script_Steps = 50;
 #else
 constexpr int Script_Steps = 70;
 #endif
-constexpr size_t Fewest_Rows = 12;
-constexpr size_t Most_Rows = 50;
 constexpr size_t Sector = 512;
 
 // ---- The platter ------------------------------------------------------
@@ -73,20 +65,8 @@ struct unflushed_change {
 };
 
 // What survives a power loss, of everything written.
-enum class survival { flushed_only, random_sectors, everything };
-constexpr survival Survivals[] = {survival::flushed_only, survival::random_sectors,
-                                  survival::everything};
-
-const char *name_of(survival kind) {
-  switch (kind) {
-    case survival::flushed_only:
-      return "flushed only";
-    case survival::random_sectors:
-      return "random sectors";
-    default:
-      return "everything";
-  }
-}
+enum survival { flushed_only, random_sectors, everything };
+constexpr const char *Survival_Names[] = {"flushed only", "random sectors", "everything"};
 
 // A directory's files as the platter holds them, by name.
 using image = std::map<std::string, std::string>;
@@ -116,17 +96,7 @@ std::string file_contents(const std::string &path) {
 }
 
 std::string file_contents(int fd) {
-  std::string bytes(static_cast<size_t>(::lseek(fd, 0, SEEK_END)), '\0');
-  size_t done = 0;
-  while (done < bytes.size()) {
-    const ssize_t got =
-        ::pread(fd, bytes.data() + done, bytes.size() - done, static_cast<off_t>(done));
-    if (got <= 0) {
-      break;
-    }
-    done += static_cast<size_t>(got);
-  }
-  return bytes;
+  return file_contents("/proc/self/fd/" + std::to_string(fd));
 }
 
 void put_bytes(std::string &file, off_t offset, const std::string &bytes) {
@@ -175,13 +145,13 @@ void lose_power() {
     }
     const std::string &flushed = P_Platter->durable[status.st_ino];
     const std::vector<unflushed_change> &changes = P_Platter->unflushed[status.st_ino];
-    const std::string everything = surviving(flushed, changes, [] { return true; });
-    if (everything != file_contents(path)) {
+    const std::string all_written = surviving(flushed, changes, [] { return true; });
+    if (all_written != file_contents(path)) {
       P_Platter->problem = "the platter model lost track of " + name;
     }
-    P_Platter->images[survival::flushed_only][name] = flushed;
-    P_Platter->images[survival::everything][name] = everything;
-    P_Platter->images[survival::random_sectors][name] =
+    P_Platter->images[flushed_only][name] = flushed;
+    P_Platter->images[everything][name] = all_written;
+    P_Platter->images[random_sectors][name] =
         surviving(flushed, changes, [&] { return rng() % 2 == 0; });
   }
   ::closedir(p_directory);
@@ -207,17 +177,6 @@ int platter_open(const char *p_path, int flags, mode_t mode) {
   return fd;
 }
 
-ssize_t platter_write(int fd, const void *p_buffer, size_t length) {
-  count_call();
-  const off_t offset = ::lseek(fd, 0, SEEK_CUR);
-  const ssize_t written = Sr_Default_File_System.write(fd, p_buffer, length);
-  if (written > 0) {
-    P_Platter->unflushed[inode_of(fd)].push_back(
-        {false, offset, std::string(static_cast<const char *>(p_buffer), written)});
-  }
-  return written;
-}
-
 ssize_t platter_writev(int fd, const struct iovec *p_io_vector, int count) {
   count_call();
   const off_t offset = ::lseek(fd, 0, SEEK_CUR);
@@ -231,6 +190,11 @@ ssize_t platter_writev(int fd, const struct iovec *p_io_vector, int count) {
     P_Platter->unflushed[inode_of(fd)].push_back({false, offset, bytes});
   }
   return written;
+}
+
+ssize_t platter_write(int fd, const void *p_buffer, size_t length) {
+  const iovec whole{const_cast<void *>(p_buffer), length};
+  return platter_writev(fd, &whole, 1);
 }
 
 // The platter takes the file as it is now. The real flush is left out:
@@ -269,19 +233,6 @@ int platter_unlink(const char *p_path) {
 // rewrites start.
 constexpr uint32_t Payload_Spread = 700;
 
-int32_t add_row(sr_opaque_handle_t table, int32_t id, int32_t version) {
-  return sr_versioned::add_row(table, id, version, Payload_Spread);
-}
-
-int32_t set_row(sr_opaque_handle_t table, int32_t id, int32_t version) {
-  return sr_versioned::set_row(table, id, version, Payload_Spread);
-}
-
-int32_t open_writable(sr_opaque_handle_t tree, int32_t mode, sr_opaque_handle_t *p_table) {
-  return sr_open_hashed_key_table_1(tree, Table_Path, mode, Hash_Buckets, hash_id, compare_ids,
-                                    p_table);
-}
-
 // The committed state of the table in `directory`, as a new program opens
 // it; an empty string, or what went wrong.
 std::string read_table(const std::string &directory, table_state &state) {
@@ -307,22 +258,22 @@ class script {
 
   // The commits of the run; `problem` set when a call failed.
   std::vector<commit_window> run(std::string &problem) {
-    check(sr_open_tree_1(&tree_, 0, 0), "sr_open_tree_1");
-    check(sr_mount_local_tree_1(tree_, "/disk", directory_.c_str(), 0), "sr_mount_local_tree_1");
-    state_.exists = true;
-    state_.counter = 1;
-    const uint64_t first = P_Platter->calls;
-    std::vector<sr_column_t> columns = table_columns();
-    check(sr_create_hashed_key_table_1(tree_, Table_Path, columns.data(), 3, 0, Hash_Buckets,
-                                       hash_id, compare_ids, &table_),
-          "sr_create_hashed_key_table_1");
+    tree_ = mounted_tree(directory_);
+    if (tree_ == nullptr) {
+      problem = "no tree with the mount point";
+      return {};
+    }
+    state_ = {true, 1, {}};
+    uint64_t first = P_Platter->calls;
+    check(create_table(tree_, Table_Path, 0, &table_), "sr_create_hashed_key_table_1");
     windows_.push_back({first, P_Platter->calls, state_});
     bool implicit = true;
     for (int step = 0; step < Script_Steps && problem_.empty(); ++step) {
       if (step % 8 == 0) {
         implicit = !implicit;
         check(sr_close_table_1(table_), "sr_close_table_1");
-        check(open_writable(tree_, implicit ? Open_Implicit : Open_Explicit, &table_), "open");
+        check(open_table(tree_, Table_Path, implicit ? Open_Implicit : Open_Explicit, &table_),
+              "open");
       }
       if (problem_.empty()) {
         implicit ? implicit_change() : explicit_transaction();
@@ -340,78 +291,15 @@ class script {
     }
   }
 
-  int32_t any_row(const table_state &state) {
-    auto row = state.rows.begin();
-    std::advance(row, rng_() % state.rows.size());
-    return row->first;
-  }
-
-  enum class change { add, set, remove };
-  change pick_change(const table_state &state) {
-    if (state.rows.size() < Fewest_Rows) {
-      return change::add;
-    }
-    if (state.rows.size() > Most_Rows) {
-      return change::remove;
-    }
-    return static_cast<change>(rng_() % 3);
-  }
-
   void implicit_change() {
-    table_state next = state_;
-    ++next.counter;
     const uint64_t first = P_Platter->calls;
-    switch (pick_change(state_)) {
-      case change::add:
-        next.rows[next_id_] = 1;
-        check(add_row(table_, next_id_++, 1), "sr_add_row_1");
-        break;
-      case change::set: {
-        const int32_t id = any_row(state_);
-        check(set_row(table_, id, ++next.rows[id]), "sr_set_fields_by_key_1");
-        break;
-      }
-      case change::remove: {
-        const int32_t id = any_row(state_);
-        next.rows.erase(id);
-        check(sr_delete_rows_1(table_, "Id == $i", id), "sr_delete_rows_1");
-        break;
-      }
-    }
-    commit(first, next);
+    problem_ = changes_.implicit_change(table_, state_, false);
+    windows_.push_back({first, P_Platter->calls, state_});
   }
 
   void explicit_transaction() {
     table_state next = state_;
-    std::set<int32_t> deleted;
-    for (uint32_t changes = 1 + rng_() % 6; changes > 0; --changes) {
-      if (!deleted.empty() && rng_() % 4 == 0) {
-        const int32_t id = *deleted.begin();  // deleted in this transaction, back again
-        deleted.erase(deleted.begin());
-        const auto old = state_.rows.find(id);
-        next.rows[id] = old == state_.rows.end() ? 1 : old->second + 1;
-        check(add_row(table_, id, next.rows[id]), "sr_add_row_1");
-        continue;
-      }
-      switch (pick_change(next)) {
-        case change::add:
-          next.rows[next_id_] = 1;
-          check(add_row(table_, next_id_++, 1), "sr_add_row_1");
-          break;
-        case change::set: {
-          const int32_t id = any_row(next);
-          check(set_row(table_, id, ++next.rows[id]), "sr_set_fields_by_key_1");
-          break;
-        }
-        case change::remove: {
-          const int32_t id = any_row(next);
-          next.rows.erase(id);
-          deleted.insert(id);
-          check(sr_delete_rows_1(table_, "Id == $i", id), "sr_delete_rows_1");
-          break;
-        }
-      }
-    }
+    problem_ = changes_.transaction(table_, state_, next, 1 + rng_() % 6);
     const uint64_t counter = rng_() % 2 ? 0 : state_.counter + 2;
     next.counter = counter == 0 ? state_.counter + 1 : counter;
     auto *p_table = static_cast<sr_i_table_t *>(table_);
@@ -434,21 +322,17 @@ class script {
         break;
     }
     check(sr_commit_1(table_), "sr_commit_1");
-    commit(first, next);
-  }
-
-  void commit(uint64_t first, const table_state &next) {
     state_ = next;
-    windows_.push_back({first, P_Platter->calls, next});
+    windows_.push_back({first, P_Platter->calls, state_});
   }
 
   std::string directory_;
   std::mt19937 rng_;
+  random_changes changes_{rng_, Payload_Spread, 12, 50};
   sr_opaque_handle_t tree_ = nullptr;
   sr_opaque_handle_t table_ = nullptr;
   table_state state_;
   std::vector<commit_window> windows_;
-  int32_t next_id_ = 1;
   std::string problem_;
 };
 
@@ -524,11 +408,10 @@ class PowerLoss : public ::testing::Test {
   // After the power is back a writer carries on: an appended row, then a
   // change written by a rewrite, each of them found by the next reader.
   std::string carry_on(const std::string &directory, table_state state) {
-    sr_opaque_handle_t tree = nullptr;
+    sr_opaque_handle_t tree = mounted_tree(directory);
     sr_opaque_handle_t table = nullptr;
-    if (sr_open_tree_1(&tree, 0, 0) != 0 ||
-        sr_mount_local_tree_1(tree, "/disk", directory.c_str(), 0) != 0 ||
-        open_writable(tree, Open_Implicit, &table) != 0 || add_row(table, 100000, 1) != 0) {
+    if (tree == nullptr || open_table(tree, Table_Path, Open_Implicit, &table) != 0 ||
+        add_row(table, 100000, 1, Payload_Spread) != 0) {
       sr_close_tree_1(tree);
       return "the implicit addition failed";
     }
@@ -541,7 +424,8 @@ class PowerLoss : public ::testing::Test {
       problem = "after an appended row: " + describe(found);
     }
     if (problem.empty() &&
-        (open_writable(tree, Open_Explicit, &table) != 0 || set_row(table, 100000, 2) != 0 ||
+        (open_table(tree, Table_Path, Open_Explicit, &table) != 0 ||
+         set_row(table, 100000, 2, Payload_Spread) != 0 ||
          sr_i_apply(static_cast<sr_i_table_t *>(table), 1, 0) != 0 || sr_commit_1(table) != 0)) {
       problem = "the rewrite failed";
     }
@@ -581,7 +465,7 @@ TEST_F(PowerLoss, EveryCutLeavesACommittedStateThatTakesNewTransactions) {
     }
     const std::vector<table_state> allowed = states_at(windows, cut);
     std::vector<image> opened;
-    for (const survival kind : Survivals) {
+    for (const survival kind : {flushed_only, random_sectors, everything}) {
       if (std::find(opened.begin(), opened.end(), disk.images[kind]) != opened.end()) {
         continue;
       }
@@ -603,8 +487,8 @@ TEST_F(PowerLoss, EveryCutLeavesACommittedStateThatTakesNewTransactions) {
         }
         FAIL() << "script seed " << script_seed()
                << " (SR_POWER_LOSS_SEED), power lost before call " << cut << " of " << total_calls
-               << ", keeping " << name_of(kind) << ": " << problem << "\n  expected" << expected
-               << "\n  image kept in " << directory;
+               << ", keeping " << Survival_Names[kind] << ": " << problem << "\n  expected"
+               << expected << "\n  image kept in " << directory;
       }
       new_states += allowed.size() > 1 && found == allowed.back() ? 1 : 0;
       std::filesystem::remove_all(directory);

@@ -12,7 +12,6 @@
 
 #include <chrono>
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <iostream>
 #include <map>
@@ -30,9 +29,6 @@ namespace {
 
 using namespace sr_versioned;
 
-constexpr int32_t Open_For_Reading = 1;
-constexpr int32_t Open_Implicit = 2;
-constexpr int32_t Open_Explicit = 6;
 constexpr const char *Table_Path = "/disk/shared/t";
 constexpr const char *Table_File = "shared,t";
 
@@ -45,27 +41,13 @@ class Processes : public ::testing::Test {
   }
   void TearDown() override { std::filesystem::remove_all(directory_); }
 
-  // A tree with the mount point, or null.
-  sr_opaque_handle_t mounted_tree() const {
-    sr_opaque_handle_t tree = nullptr;
-    if (sr_open_tree_1(&tree, 0, 0) != 0) {
-      return nullptr;
-    }
-    if (sr_mount_local_tree_1(tree, "/disk", directory_.c_str(), 0) != 0) {
-      sr_close_tree_1(tree);
-      return nullptr;
-    }
-    return tree;
-  }
+  sr_opaque_handle_t mounted_tree() const { return sr_versioned::mounted_tree(directory_); }
 
   void create_table(int32_t mode) {
     sr_opaque_handle_t tree = mounted_tree();
     ASSERT_NE(tree, nullptr);
-    std::vector<sr_column_t> columns = table_columns();
     sr_opaque_handle_t table = nullptr;
-    EXPECT_EQ(sr_create_hashed_key_table_1(tree, Table_Path, columns.data(), 3, mode, Hash_Buckets,
-                                           hash_id, compare_ids, &table),
-              0);
+    EXPECT_EQ(sr_versioned::create_table(tree, Table_Path, mode, &table), 0);
     EXPECT_EQ(sr_close_tree_1(tree), 0);
   }
 
@@ -157,8 +139,7 @@ TEST_F(Processes, TwoWritersLoseNoRow) {
       }
       for (int round = 0; round < Rounds; ++round) {
         sr_opaque_handle_t table = nullptr;
-        if (sr_open_hashed_key_table_1(tree, Table_Path, Open_Implicit, Hash_Buckets, hash_id,
-                                       compare_ids, &table) != 0) {
+        if (open_table(tree, Table_Path, Open_Implicit, &table) != 0) {
           return 3;
         }
         for (int row = 0; row < Rows_Per_Round; ++row) {
@@ -232,8 +213,7 @@ TEST_F(Processes, AReaderSeesOnlyCommittedStatesWhileAWriterWorks) {
   const pid_t writer = start_process([this] {
     sr_opaque_handle_t tree = mounted_tree();
     sr_opaque_handle_t table = nullptr;
-    if (tree == nullptr || sr_open_hashed_key_table_1(tree, Table_Path, Open_Explicit, Hash_Buckets,
-                                                      hash_id, compare_ids, &table) != 0) {
+    if (tree == nullptr || open_table(tree, Table_Path, Open_Explicit, &table) != 0) {
       return 2;
     }
     for (int t = 1; t <= Transactions; ++t) {
@@ -249,14 +229,7 @@ TEST_F(Processes, AReaderSeesOnlyCommittedStatesWhileAWriterWorks) {
       }
       for (int row = 0; t % 4 == 0 && row < 10; ++row) {
         const int32_t id = (t - 1) * 10 + row;
-        qv_value_t version = int32_value(t);
-        const std::string text = payload(id, t, Payload_Spread);
-        qv_value_t body{};
-        body.ptr_char = const_cast<char *>(text.c_str());
-        const char *names[] = {"Version", "Payload"};
-        qv_value_t *values[] = {&version, &body};
-        if (before.rows.count(id) != 0 &&
-            sr_set_fields_by_key_1(table, int32_value(id), names, values, 2) != 0) {
+        if (before.rows.count(id) != 0 && set_row(table, id, t, Payload_Spread) != 0) {
           return 5;
         }
       }

@@ -6,7 +6,6 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <cmath>
 #include <cstdlib>
 #include <cstring>
@@ -14,6 +13,7 @@
 #include <tuple>
 #include <vector>
 
+#include "pmsg_test_values.h"
 #include "sr_row_test_support.h"
 
 namespace {
@@ -133,8 +133,19 @@ TEST_F(ReadRows, ChecksComeInTheirOrderWithTheirCodes) {
   expect_failure(sr_get_fields_by_key_1(table, int32_value(2), names, results, 4),
                  SR_E_NO_ROW_FOR_KEY);
 
-  // The handle comes first, then the result pointer.
+  EXPECT_EQ(sr_get_fixed_row_index_for_key_1(nullptr, int32_value(1), nullptr),
+            SR_E_INVALID_HANDLE);  // the handle first, then the result pointer
+  expect_failure(sr_get_fixed_row_index_for_key_1(table, int32_value(1), nullptr),
+                 SR_E_NULL_POINTER);
+}
+
+// Every call on rows, reading or changing, looks at its handle first.
+TEST_F(ReadRows, EveryRowCallRefusesANullHandle) {
   const qv_value_t one = int32_value(1);
+  field_list fields{{"k", one}};
+  const char *const *names = fields.names.data();
+  qv_value_t *const *values = fields.pointers.data();
+  qv_value_t value{};
   uint32_t fixed = 0;
   for (const int32_t rc :
        {sr_get_field_by_index_1(nullptr, 0, "k", &value),
@@ -142,16 +153,27 @@ TEST_F(ReadRows, ChecksComeInTheirOrderWithTheirCodes) {
         sr_get_field_by_fixed_index_and_visibility_1(nullptr, 0, "k", &value, 0, nullptr),
         sr_get_field_by_key_1(nullptr, one, "k", &value),
         sr_get_field_by_key_and_visibility_1(nullptr, one, "k", &value, 0, nullptr),
-        sr_get_fields_by_index_1(nullptr, 0, names, results, 1),
-        sr_get_fields_by_index_and_visibility_1(nullptr, 0, names, results, 1, 0, nullptr),
-        sr_get_fields_by_fixed_index_and_visibility_1(nullptr, 0, names, results, 1, 0, nullptr),
-        sr_get_fields_by_key_1(nullptr, one, names, results, 1),
-        sr_get_fields_by_key_and_visibility_1(nullptr, one, names, results, 1, 0, nullptr),
+        sr_get_fields_by_index_1(nullptr, 0, names, values, 1),
+        sr_get_fields_by_index_and_visibility_1(nullptr, 0, names, values, 1, 0, nullptr),
+        sr_get_fields_by_fixed_index_and_visibility_1(nullptr, 0, names, values, 1, 0, nullptr),
+        sr_get_fields_by_key_1(nullptr, one, names, values, 1),
+        sr_get_fields_by_key_and_visibility_1(nullptr, one, names, values, 1, 0, nullptr),
         sr_get_fixed_row_index_for_key_1(nullptr, one, &fixed),
-        sr_get_fixed_row_index_for_key_1(nullptr, one, nullptr)}) {
+        sr_set_field_by_index_1(nullptr, 0, "k", &one),
+        sr_set_field_by_fixed_index_1(nullptr, 0, "k", &one),
+        sr_set_field_by_key_1(nullptr, one, "k", &one),
+        sr_set_fields_by_index_1(nullptr, 0, names, values, 1),
+        sr_set_fields_by_fixed_index_1(nullptr, 0, names, values, 1),
+        sr_set_fields_by_key_1(nullptr, one, names, values, 1),
+        sr_add_row_1(nullptr, names, values, 1),
+        sr_delete_row_by_index_1(nullptr, 0),
+        sr_delete_rows_1(nullptr, nullptr),
+        sr_apply_1(nullptr, 0),
+        sr_commit_1(nullptr),
+        sr_abort_1(nullptr),
+        sr_close_table_1(nullptr)}) {
     EXPECT_EQ(rc, SR_E_INVALID_HANDLE);
   }
-  expect_failure(sr_get_fixed_row_index_for_key_1(table, one, nullptr), SR_E_NULL_POINTER);
 }
 
 TEST_F(ReadRows, EachViewReadsItsOwnRecordAndEveryReadReportsTheRowState) {
@@ -203,7 +225,7 @@ TEST_F(ReadRows, EachViewReadsItsOwnRecordAndEveryReadReportsTheRowState) {
 }
 
 TEST_F(ReadRows, TheTableSettingOrTheCallerShowsUncommittedUpdates) {
-  setenv("SR_UNCOMMITTED_UPDATES_VISIBLE", "1", 1);
+  setenv("SR_UNCOMMITTED_UPDATES_VISIBLE", "", 1);  // set at all, even empty
   sr_opaque_handle_t shown = create_named("/shown");
   unsetenv("SR_UNCOMMITTED_UPDATES_VISIBLE");
   sr_opaque_handle_t hidden = create_named("/hidden");
@@ -299,53 +321,35 @@ TEST_F(ReadRows, HandleStringAndFloatKeysAreComparedByValue) {
   object(floats)->p_columns[0].type = QV_FLOAT64;
 }
 
-// A malloc'ed array of `elements`, as a caller hands it over.
-std::unique_ptr<qv_array_t, decltype(&std::free)> array_of(
-    std::initializer_list<qv_value_t> elements) {
-  auto array = zeroed_block<qv_array_t>(elements.size() * sizeof(qv_value_t));
-  array->element_count = static_cast<uint32_t>(elements.size());
-  std::copy(elements.begin(), elements.end(), array->elements);
-  return array;
-}
-
 TEST_F(ReadRows, VariableLengthValuesAreTheCallersOwnBlocks) {
   std::vector<sr_column_t> columns = {column("k", QV_INT32, SR_PRIMARY_KEY),
                                       column("name", QV_CHAR_PTR), column("list", QV_INT32_ARRAY),
                                       column("blob", QV_BINARY_PTR), column("big", QV_UINT64)};
   columns[1].default_value.ptr_char = const_cast<char *>("none");
   sr_opaque_handle_t table = make_table("/values", columns, Explicit);
-  const auto numbers = array_of({int32_value(-1), int32_value(65536)});
-  const auto bytes = zeroed_block<qv_binary_t>(3);
-  bytes->length = 3;
-  std::memcpy(bytes->data, "\0\1\2", 3);
-  qv_value_t list{}, blob{}, big{};
-  list.ptr_array = numbers.get();
-  blob.ptr_binary = bytes.get();
-  big.val_uint64 = UINT64_MAX - 1;
+  value_arena arena;
+  const int32_t types[] = {QV_UINT64, QV_BINARY_PTR, QV_INT32_ARRAY, QV_CHAR_PTR};
+  // Row 1 as given; row 2 of defaults (null pointers stand for empty values).
+  const qv_value_t given[] = {number64(UINT64_MAX - 1), arena.binary(std::string_view("\0\1\2", 3)),
+                              arena.array({int32_value(-1), int32_value(65536)}),
+                              string_value("full")};
+  const qv_value_t defaults[] = {number64(0), {}, {}, string_value("none")};
   ASSERT_EQ(add_fields(table, {{"k", int32_value(1)},
-                               {"name", string_value("full")},
-                               {"list", list},
-                               {"blob", blob},
-                               {"big", big}}),
+                               {"big", given[0]},
+                               {"blob", given[1]},
+                               {"list", given[2]},
+                               {"name", given[3]}}),
             0);
-  ASSERT_EQ(add_fields(table, {{"k", int32_value(2)}}), 0);  // the defaults
+  ASSERT_EQ(add_fields(table, {{"k", int32_value(2)}}), 0);
   apply_commit(table);
 
   field_list read{{"big", {}}, {"blob", {}}, {"list", {}}, {"name", {}}};
   qv_value_t *const *values = read.pointers.data();
   for (const int32_t key : {1, 2}) {
     ASSERT_EQ(sr_get_fields_by_key_1(table, int32_value(key), read.names.data(), values, 4), 0);
-    const bool full = key == 1;
-    EXPECT_EQ(values[0]->val_uint64, full ? UINT64_MAX - 1 : 0);
-    ASSERT_EQ(values[1]->ptr_binary->length, full ? 3u : 0u);
-    EXPECT_EQ(std::memcmp(values[1]->ptr_binary->data, "\0\1\2", values[1]->ptr_binary->length), 0);
-    const qv_array_t *p_list = values[2]->ptr_array;
-    std::vector<int32_t> numbers;
-    for (uint32_t at = 0; at < p_list->element_count; ++at) {
-      numbers.push_back(p_list->elements[at].val_int32);
+    for (uint32_t at = 0; at < 4; ++at) {
+      EXPECT_TRUE(values_equal(types[at], (key == 1 ? given : defaults)[at], *values[at])) << key;
     }
-    EXPECT_EQ(numbers, (full ? std::vector<int32_t>{-1, 65536} : std::vector<int32_t>{}));
-    EXPECT_STREQ(values[3]->ptr_char, full ? "full" : "none");
     // A second read hands out new blocks.
     qv_value_t again{};
     ASSERT_EQ(sr_get_field_by_key_1(table, int32_value(key), "name", &again), 0);

@@ -1,7 +1,8 @@
-// The record buffer pool: byte counts, block growth, splitting and merging,
-// the raised failures, and copying a pool with its address map. The
-// randomized cases walk every block after each step and check the whole
-// structure against a model of the live records and their contents.
+// The record buffer pool: byte counts, block growth, splitting, the raised
+// failures, and copying a pool with its address map. The randomized cases
+// walk every block after each step and check the whole structure (merged
+// free neighbours, the free chain, both byte counts) against a model of
+// the live records and their contents.
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -15,16 +16,11 @@
 
 #include "qv_sr.h"
 #include "sr_i_record_buffer_pool.h"
+#include "sr_row_test_support.h"
 
 namespace {
 
-int32_t last_error_code() {
-  cu_error_t *p_error = nullptr;
-  EXPECT_EQ(cu_get_error_1(&p_error), 0);
-  const int32_t code = p_error->code;
-  cu_rel_error_1(p_error);
-  return code;
-}
+using sr_test::last_error;
 
 uint32_t page_size() {
   return static_cast<uint32_t>(sysconf(_SC_PAGESIZE));
@@ -183,45 +179,6 @@ TEST(RecordBufferPool, FirstRequestCountsBytesExactly) {
   }
 }
 
-TEST(RecordBufferPool, FreedNeighboursMergeAndGiveBackOneHeader) {
-  // Records A, B, C (10, 20 and 30 data bytes) then a guard D of 5, so that
-  // only the freed records can merge with each other.
-  struct {
-    std::vector<int> frees;
-    uint32_t used_bytes_drop;
-    std::vector<uint32_t> free_lengths;  // the chain before the block's rest
-  } const cases[] = {
-      {{0, 1}, 10 + 20 + 20, {70}},  // merges with the record below
-      {{1, 0}, 10 + 20 + 20, {70}},  // merges with the record above
-      {{0, 2, 1}, 60 + 40, {120}},   // one record joins both neighbours
-      {{2, 0}, 40, {30, 50}},        // not neighbours: no merge
-  };
-  for (const auto &c : cases) {
-    sr_i_record_buffer_pool_t pool{};
-    ASSERT_EQ(sr_i_rb_initialize_record_buffer_pool(1, &pool), 0);
-    void *p_records[4];
-    model_t live;
-    for (const uint32_t at : {0u, 1u, 2u, 3u}) {
-      const uint32_t length = at == 3 ? 5 : 10 * (at + 1);
-      ASSERT_EQ(sr_i_reserve_record(&pool, length, SR_I_RECORD_ROW, &p_records[at]), 0);
-      fill(p_records[at], live[p_records[at]] = {length, static_cast<uint8_t>(at)});
-    }
-    const uint32_t used_before = pool.used_bytes;
-    for (const int at : c.frees) {
-      ASSERT_EQ(sr_i_rb_free_record(&pool, p_records[at]), 0);
-      live.erase(p_records[at]);
-    }
-    EXPECT_EQ(used_before - pool.used_bytes, c.used_bytes_drop);
-    std::vector<uint32_t> free_lengths;
-    for (const sr_i_record_metadata_t *p = pool.p_free_chain; p->p_next != nullptr; p = p->p_next) {
-      free_lengths.push_back(p->record_length);
-    }
-    EXPECT_EQ(free_lengths, c.free_lengths);
-    check_pool(pool, live);
-    sr_i_rb_uninitialize_record_buffer_pool(&pool);
-  }
-}
-
 TEST(RecordBufferPool, RaisesAndLeavesThePoolAsItWas) {
   sr_i_record_buffer_pool_t pool{};
   ASSERT_EQ(sr_i_rb_initialize_record_buffer_pool(1, &pool), 0);
@@ -232,12 +189,12 @@ TEST(RecordBufferPool, RaisesAndLeavesThePoolAsItWas) {
   const sr_i_record_buffer_pool_t before = pool;
 
   EXPECT_EQ(sr_i_rb_allocate_record(&pool, p_data, p_previous, actual + 1, 2), 15);
-  EXPECT_EQ(last_error_code(), 15);
+  EXPECT_EQ(last_error().first, 15);
   sr_i_record_metadata_t *p_wrong_previous = sr_i_rb_record_header(p_data);
   EXPECT_EQ(sr_i_rb_allocate_record(&pool, p_data, p_wrong_previous, 100, 2), 15);
   // Blocks whose size does not fit the 32-bit counts cannot be had.
   EXPECT_EQ(sr_i_reserve_record(&pool, UINT32_MAX - 16, 2, &p_data), 12);
-  EXPECT_EQ(last_error_code(), 12);
+  EXPECT_EQ(last_error().first, 12);
   EXPECT_EQ(sr_i_rb_initialize_record_buffer_pool(UINT32_MAX, &pool), 12);
 
   EXPECT_EQ(std::memcmp(&pool, &before, sizeof pool), 0);

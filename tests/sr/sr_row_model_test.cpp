@@ -10,7 +10,6 @@
 #include <map>
 #include <optional>
 #include <random>
-#include <set>
 #include <string>
 
 #include "sr_row_test_support.h"
@@ -55,18 +54,16 @@ class RowModel : public RowTables {
   }
 
   int32_t add(uint32_t key, const row_values &values) {
-    qv_value_t handle = key_value(key), count = int32_value(values.count),
-               note = string_value(values.note.c_str());
-    const char *names[] = {"note", "handle", "count"};
-    qv_value_t *fields[] = {&note, &handle, &count};
-    return sr_add_row_1(table_, names, fields, 3);
+    return add_fields(table_, {{"note", string_value(values.note.c_str())},
+                               {"handle", key_value(key)},
+                               {"count", int32_value(values.count)}});
   }
 
   int32_t set(uint32_t key, const row_values &values) {
-    qv_value_t count = int32_value(values.count), note = string_value(values.note.c_str());
-    const char *names[] = {"count", "note"};
-    qv_value_t *fields[] = {&count, &note};
-    return sr_set_fields_by_key_1(table_, key_value(key), names, fields, 2);
+    const field_list fields{{"count", int32_value(values.count)},
+                            {"note", string_value(values.note.c_str())}};
+    return sr_set_fields_by_key_1(table_, key_value(key), fields.names.data(),
+                                  fields.pointers.data(), 2);
   }
 
   int32_t remove(uint32_t key) {

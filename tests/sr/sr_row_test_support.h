@@ -94,6 +94,34 @@ inline int32_t compare_int32_keys(const void *p_stored_key, const void *p_key) {
   return int32_key_at(p_stored_key) == int32_key_at(p_key) ? 0 : 1;
 }
 
+// A tree with "/disk" mounted on `directory`, as a program of its own
+// opens it; null when either call fails.
+inline sr_opaque_handle_t mounted_tree(const std::string &directory) {
+  sr_opaque_handle_t tree = nullptr;
+  if (sr_open_tree_1(&tree, 0, 0) != 0) {
+    return nullptr;
+  }
+  if (sr_mount_local_tree_1(tree, "/disk", directory.c_str(), 0) != 0) {
+    sr_close_tree_1(tree);
+    return nullptr;
+  }
+  return tree;
+}
+
+inline int32_t add_fields(sr_opaque_handle_t table, const field_list &row) {
+  return sr_add_row_1(table, row.names.data(), row.pointers.data(), row.count());
+}
+
+// Rows of the tables below: a string "name" or an int32 "id" as the key,
+// with an int32 "count".
+inline int32_t add_named(sr_opaque_handle_t table, const char *p_name, int32_t count) {
+  return add_fields(table, {{"name", string_value(p_name)}, {"count", int32_value(count)}});
+}
+
+inline int32_t add_numbered(sr_opaque_handle_t table, int32_t id, int32_t count) {
+  return add_fields(table, {{"id", int32_value(id)}, {"count", int32_value(count)}});
+}
+
 inline sr_i_table_t *object(sr_opaque_handle_t handle) {
   return static_cast<sr_i_table_t *>(handle);
 }
@@ -119,10 +147,6 @@ class RowTables : public ::testing::Test {
                   : sr_create_table_1(tree_, p_path, columns.data(), total, mode, &table),
               0);
     return table;
-  }
-
-  static int32_t add_fields(sr_opaque_handle_t table, const field_list &row) {
-    return sr_add_row_1(table, row.names.data(), row.pointers.data(), row.count());
   }
 
   static void apply_commit(sr_opaque_handle_t table) {
@@ -152,22 +176,6 @@ class RowTables : public ::testing::Test {
     sr_opaque_handle_t table = nullptr;
     EXPECT_EQ(sr_create_table_1(tree_, p_path, columns.data(), 2, mode, &table), 0);
     return table;
-  }
-
-  static int32_t add_named(sr_opaque_handle_t table, const char *p_name, int32_t count) {
-    qv_value_t name = string_value(p_name);
-    qv_value_t number = int32_value(count);
-    const char *names[] = {"name", "count"};
-    qv_value_t *values[] = {&name, &number};
-    return sr_add_row_1(table, names, values, 2);
-  }
-
-  static int32_t add_numbered(sr_opaque_handle_t table, int32_t id, int32_t count) {
-    qv_value_t key = int32_value(id);
-    qv_value_t number = int32_value(count);
-    const char *names[] = {"id", "count"};
-    qv_value_t *values[] = {&key, &number};
-    return sr_add_row_1(table, names, values, 2);
   }
 
   // The "count" of the row with string key `p_name`, in the applied view

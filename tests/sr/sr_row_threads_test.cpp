@@ -17,7 +17,7 @@ namespace {
 
 using namespace sr_test;
 
-class RowThreads : public RowTables {};
+using RowThreads = RowTables;
 
 TEST_F(RowThreads, ReadersSeeWholeRowsWhileAWriterCommits) {
   // The note of each row always spells its count: a torn row breaks that.
@@ -25,11 +25,10 @@ TEST_F(RowThreads, ReadersSeeWholeRowsWhileAWriterCommits) {
   constexpr int Rows = 20;
   for (int row = 0; row < Rows; ++row) {
     const std::string text = std::to_string(row);
-    qv_value_t name = string_value(text.c_str()), count = int32_value(row);
-    qv_value_t note = string_value(text.c_str());
-    const char *names[] = {"name", "count", "note"};
-    qv_value_t *values[] = {&name, &count, &note};
-    ASSERT_EQ(sr_add_row_1(table, names, values, 3), 0);
+    ASSERT_EQ(add_fields(table, {{"name", string_value(text.c_str())},
+                                 {"count", int32_value(row)},
+                                 {"note", string_value(text.c_str())}}),
+              0);
   }
 
   std::atomic<bool> writing{true};
@@ -65,16 +64,15 @@ TEST_F(RowThreads, ReadersSeeWholeRowsWhileAWriterCommits) {
   for (int round = 0; round < 300; ++round) {
     const int32_t value = 1000 + round;
     const std::string text = std::to_string(value);
-    qv_value_t count = int32_value(value), note = string_value(text.c_str());
-    const char *names[] = {"count", "note"};
-    qv_value_t *values[] = {&count, &note};
-    ASSERT_EQ(sr_set_fields_by_index_1(table, round % Rows, names, values, 2), 0);
+    const field_list row{{"count", int32_value(value)}, {"note", string_value(text.c_str())}};
+    ASSERT_EQ(
+        sr_set_fields_by_index_1(table, round % Rows, row.names.data(), row.pointers.data(), 2), 0);
     if (round % 10 == 0) {
       ASSERT_EQ(sr_delete_row_by_index_1(table, 0), 0);
-      qv_value_t name = string_value("again");
-      const char *add_names[] = {"name", "count", "note"};
-      qv_value_t *add_values[] = {&name, &count, &note};
-      ASSERT_EQ(sr_add_row_1(table, add_names, add_values, 3), 0);
+      ASSERT_EQ(add_fields(table, {{"name", string_value("again")},
+                                   {"count", int32_value(value)},
+                                   {"note", string_value(text.c_str())}}),
+                0);
     }
   }
   writing = false;

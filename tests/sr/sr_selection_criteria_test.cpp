@@ -5,7 +5,6 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <cstdarg>
 #include <cstdint>
 #include <cstdlib>
@@ -14,6 +13,7 @@
 #include <string>
 #include <vector>
 
+#include "pmsg_test_values.h"
 #include "sr_i_rows.h"
 #include "sr_i_selection_criteria.h"
 #include "sr_i_tree.h"
@@ -38,14 +38,6 @@ expansion expand(const char *p_format, ...) {
   expansion result{rc, rc == 0 ? p_result : ""};
   std::free(p_result);
   return result;
-}
-
-// A binary value in a malloc'ed block, as a caller would pass it.
-std::unique_ptr<qv_binary_t, decltype(&std::free)> binary_of(std::vector<unsigned char> bytes) {
-  auto binary = zeroed_block<qv_binary_t>(bytes.size());
-  binary->length = static_cast<uint32_t>(bytes.size());
-  std::copy(bytes.begin(), bytes.end(), binary->data);
-  return binary;
 }
 
 // A handle whose header holds the halves 0x0001 and 0x00ab in memory order.
@@ -79,7 +71,8 @@ TEST(Expansion, EachVariableBecomesTheLiteralOfItsType) {
   // empty values.
   EXPECT_EQ(expand("$s|$S|$s", "eth\"0", "", static_cast<char *>(nullptr)).text,
             "\"eth\"0\"|\"\"|\"\"");
-  EXPECT_EQ(expand("$b|$B", binary_of({0x00, 0x1f, 0xab, 0xff}).get(),
+  value_arena arena;
+  EXPECT_EQ(expand("$b|$B", arena.binary(std::string_view("\x00\x1f\xab\xff", 4)).ptr_binary,
                    static_cast<qv_binary_t *>(nullptr))
                 .text,
             "\"0x001fabff\"|\"0x\"");
@@ -116,9 +109,11 @@ TEST(Expansion, ResultsPastTheFirstBufferAreReturnedWhole) {
   EXPECT_EQ(expand((near_end + "$l").c_str(), INT64_MIN).text, near_end + "-9223372036854775808");
   // A value several buffers long, with text and a variable after it.
   const std::string long_value(10000, 'v');
-  const auto long_binary = binary_of(std::vector<unsigned char>(5000, 0x55));
-  EXPECT_EQ(expand("x == $s && y == $b && z == $i", long_value.c_str(), long_binary.get(), 17).text,
-            "x == \"" + long_value + "\" && y == \"0x" + std::string(10000, '5') + "\" && z == 17");
+  value_arena arena;
+  const qv_value_t long_binary = arena.binary(std::string(5000, '\x55'));
+  EXPECT_EQ(
+      expand("x == $s && y == $b && z == $i", long_value.c_str(), long_binary.ptr_binary, 17).text,
+      "x == \"" + long_value + "\" && y == \"0x" + std::string(10000, '5') + "\" && z == 17");
 }
 
 // ---- Compilation and evaluation on a real table ---------------------------
@@ -167,23 +162,17 @@ class Criteria : public RowTables {
   }
   // Fills `row` as the row "eth0".
   void fill(Row &row) {
-    auto peer = zeroed_block<qv_structured_data_t>(3 * sizeof(qv_structured_data_element_t));
-    peer->element_count = 3;
-    peer->elements[0] = {QV_INT64, 0, {}};
-    peer->elements[0].value.val_int64 = -1;
-    peer->elements[1] = {QV_UINT32, 0, {}};
-    peer->elements[1].value.val_uint32 = 80;
-    peer->elements[2] = {QV_CHAR_PTR, 0, {}};
-    peer->elements[2].value.ptr_char = const_cast<char *>("h1");
-    auto ports = zeroed_block<qv_array_t>(2 * sizeof(qv_value_t));
-    ports->element_count = 2;
-    ports->elements[0].val_int32 = 22;
-    ports->elements[1].val_int32 = 443;
-    qv_value_t values[6] = {string_value("eth0"), int32_value(5)};
-    values[2].ptr_sd = peer.get();
-    values[3].ptr_array = ports.get();
-    values[4].ptr_binary = blob_.get();
-    values[5].ptr_rsrc_handle = &owner_;
+    value_arena arena;
+    qv_value_t owner{};
+    owner.ptr_rsrc_handle = &owner_;
+    const qv_value_t values[] = {string_value("eth0"),
+                                 int32_value(5),
+                                 arena.structured({{QV_INT64, number64(static_cast<uint64_t>(-1))},
+                                                   {QV_UINT32, number32(80)},
+                                                   {QV_CHAR_PTR, arena.string("h1")}}),
+                                 arena.array({int32_value(22), int32_value(443)}),
+                                 blob_,
+                                 owner};
     for (uint32_t at = 0; at < 6; ++at) {
       row.put(at, values[at]);
     }
@@ -221,7 +210,8 @@ class Criteria : public RowTables {
       zeroed_block<sr_sd_def_t>(3 * sizeof(sr_sd_field_def_t));
   sr_i_table_t *p_table_ = nullptr;
   cu_iconv_t *p_conversion_ = nullptr;
-  std::unique_ptr<qv_binary_t, decltype(&std::free)> blob_ = binary_of({0x00, 0x1f, 0xab, 0xff});
+  value_arena arena_;
+  qv_value_t blob_ = arena_.binary(std::string_view("\x00\x1f\xab\xff", 4));
   qv_resource_handle_t owner_ = sample_handle();
 };
 
@@ -298,7 +288,7 @@ TEST_F(Criteria, ColumnsAndFieldsAreReadFromTheRecord) {
         std::string("peer.port == 80 && peer.host == \"h1\" && peer.x == -1"),
         std::string("443 in ports && len(ports) == 2"), std::string("blob == \"0x001fabff\""),
         expand("name == $s && count == $i && blob == $b && owner == $rh && peer.port == $ui",
-               "eth0", 5, blob_.get(), &owner_, 80u)
+               "eth0", 5, blob_.ptr_binary, &owner_, 80u)
             .text}) {
     EXPECT_EQ(verdict(matching, p_record), 1) << matching;
   }

@@ -1,7 +1,8 @@
 // sr_versioned_rows.h - the table the durability tests (crash, power loss,
 // several processes) write and read back: rows of Id (the key), Version
 // and Payload, where the payload is a function of Id and Version, so that a
-// record of the wrong row or the wrong version is noticed on reading.
+// record of the wrong row or the wrong version is noticed on reading; and
+// the random changes the crash and power-loss writers make to it.
 
 #ifndef SR_VERSIONED_ROWS_H
 #define SR_VERSIONED_ROWS_H
@@ -9,13 +10,20 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
+#include <functional>
 #include <map>
+#include <random>
+#include <set>
 #include <string>
-#include <vector>
 
 #include "qv_sr.h"
+#include "sr_row_test_support.h"
 
 namespace sr_versioned {
+
+inline constexpr int32_t Open_For_Reading = 1;
+inline constexpr int32_t Open_Implicit = 2;
+inline constexpr int32_t Open_Explicit = 6;
 
 // Rows are found by key through a key hash table: without one a new key
 // is checked by a scan that refuses it whenever a deleted row left a free
@@ -32,10 +40,23 @@ inline int32_t compare_ids(const void *p_stored_key, const void *p_key) {
   return std::memcmp(p_stored_key, p_key, sizeof(int32_t)) == 0 ? 0 : 1;
 }
 
-inline qv_value_t int32_value(int32_t number) {
-  qv_value_t value{};
-  value.val_int32 = number;
-  return value;
+using sr_test::int32_value;
+using sr_test::mounted_tree;
+
+inline int32_t create_table(sr_opaque_handle_t tree, const char *p_path, int32_t mode,
+                            sr_opaque_handle_t *p_table) {
+  sr_column_t columns[3] = {
+      {const_cast<char *>("Id"), QV_INT32, SR_PRIMARY_KEY, 0, nullptr, {}},
+      {const_cast<char *>("Version"), QV_INT32, SR_STANDARD, 0, nullptr, {}},
+      {const_cast<char *>("Payload"), QV_CHAR_PTR, SR_STANDARD, 0, nullptr, {}}};
+  return sr_create_hashed_key_table_1(tree, p_path, columns, 3, mode, Hash_Buckets, hash_id,
+                                      compare_ids, p_table);
+}
+
+inline int32_t open_table(sr_opaque_handle_t tree, const char *p_path, int32_t mode,
+                          sr_opaque_handle_t *p_table) {
+  return sr_open_hashed_key_table_1(tree, p_path, mode, Hash_Buckets, hash_id, compare_ids,
+                                    p_table);
 }
 
 // 40 to 40 + `spread` - 1 bytes, different for every version of every row.
@@ -48,14 +69,6 @@ inline std::string payload(int32_t id, int32_t version, uint32_t spread) {
     text.push_back(static_cast<char>('a' + (hash + at * 7) % 26));
   }
   return text;
-}
-
-inline std::vector<sr_column_t> table_columns() {
-  std::vector<sr_column_t> columns(3);
-  columns[0] = {const_cast<char *>("Id"), QV_INT32, SR_PRIMARY_KEY, 0, nullptr, {}};
-  columns[1] = {const_cast<char *>("Version"), QV_INT32, SR_STANDARD, 0, nullptr, {}};
-  columns[2] = {const_cast<char *>("Payload"), QV_CHAR_PTR, SR_STANDARD, 0, nullptr, {}};
-  return columns;
 }
 
 inline int32_t add_row(sr_opaque_handle_t table, int32_t id, int32_t version, uint32_t spread) {
@@ -145,16 +158,14 @@ inline std::string read_rows(sr_opaque_handle_t table, table_state &state, uint3
 inline std::string read_table(const std::string &directory, const char *p_registry_path,
                               table_state &state, uint32_t spread) {
   state = table_state{};
-  sr_opaque_handle_t tree = nullptr;
-  if (sr_open_tree_1(&tree, 0, 0) != 0) {
-    return "no tree";
+  sr_opaque_handle_t tree = mounted_tree(directory);
+  if (tree == nullptr) {
+    return "no tree with the mount point";
   }
   std::string problem;
   sr_opaque_handle_t table = nullptr;
-  if (sr_mount_local_tree_1(tree, "/disk", directory.c_str(), 0) != 0) {
-    problem = "no mount point";
-  } else if (const int32_t rc = sr_open_table_1(tree, p_registry_path, 1, &table);
-             rc != 0 && rc != SR_E_NO_TABLE) {
+  if (const int32_t rc = sr_open_table_1(tree, p_registry_path, Open_For_Reading, &table);
+      rc != 0 && rc != SR_E_NO_TABLE) {
     problem = "sr_open_table_1 gave " + std::to_string(rc);
   } else if (rc == 0) {
     problem = read_rows(table, state, spread);
@@ -162,6 +173,104 @@ inline std::string read_table(const std::string &directory, const char *p_regist
   sr_close_tree_1(tree);
   return problem;
 }
+
+// Random changes that keep the row count between `fewest` and `most`: new
+// rows get fresh ids, sets raise a row's version, deletions take any row.
+// Each call returns an empty string, or the call that failed.
+class random_changes {
+ public:
+  using listener = std::function<void(const table_state &)>;
+
+  random_changes(std::mt19937 &rng, uint32_t spread, size_t fewest, size_t most)
+      : rng_(rng), spread_(spread), fewest_(fewest), most_(most) {}
+
+  int32_t next_id = 1;
+
+  // One change through an implicitly controlled handle, which commits it:
+  // `state` becomes the new committed state. `announce` hears of that state
+  // before the call. A row is deleted by its packed index (`by_index`) or
+  // by a selection of its Id.
+  std::string implicit_change(sr_opaque_handle_t table, table_state &state, bool by_index,
+                              const listener &announce = {}) {
+    table_state next = state;
+    ++next.counter;
+    if (const int32_t rc = change(table, next, by_index, announce, nullptr); rc != 0) {
+      return "an implicit change gave " + std::to_string(rc);
+    }
+    state = next;
+    return "";
+  }
+
+  // `changes` changes of an explicitly controlled transaction on top of
+  // `committed`, recorded in `next`; now and then a row deleted earlier in
+  // the transaction comes back.
+  std::string transaction(sr_opaque_handle_t table, const table_state &committed, table_state &next,
+                          uint32_t changes) {
+    std::set<int32_t> deleted;
+    for (; changes > 0; --changes) {
+      int32_t rc = 0;
+      if (!deleted.empty() && rng_() % 4 == 0) {
+        const int32_t id = *deleted.begin();
+        deleted.erase(deleted.begin());
+        const auto old = committed.rows.find(id);
+        next.rows[id] = old == committed.rows.end() ? 1 : old->second + 1;
+        rc = add_row(table, id, next.rows[id], spread_);
+      } else {
+        rc = change(table, next, false, {}, &deleted);
+      }
+      if (rc != 0) {
+        return "a change in a transaction gave " + std::to_string(rc);
+      }
+    }
+    return "";
+  }
+
+ private:
+  // A new row, a new version of any row, or any row deleted, as `next`
+  // records it; the row count stays within its bounds.
+  int32_t change(sr_opaque_handle_t table, table_state &next, bool by_index,
+                 const listener &announce, std::set<int32_t> *p_deleted) {
+    enum kind_t { Add, Set, Remove };
+    const size_t rows = next.rows.size();
+    const auto kind = rows < fewest_ ? Add : rows > most_ ? Remove : kind_t(rng_() % 3);
+    qv_value_t id = int32_value(kind == Add ? next_id++ : 0);
+    const auto at = static_cast<int32_t>(kind == Add ? 0 : rng_() % rows);
+    if (kind != Add) {
+      id.val_int32 = std::next(next.rows.begin(), at)->first;
+    }
+    // The row at a packed index is looked up in the table itself.
+    if (kind == Remove && by_index) {
+      if (const int32_t rc = sr_get_field_by_index_1(table, at, "Id", &id); rc != 0) {
+        return rc;
+      }
+    }
+    if (kind == Remove) {
+      next.rows.erase(id.val_int32);
+      if (p_deleted != nullptr) {
+        p_deleted->insert(id.val_int32);
+      }
+    } else {
+      ++next.rows[id.val_int32];
+    }
+    if (announce) {
+      announce(next);
+    }
+    switch (kind) {
+      case Add:
+        return add_row(table, id.val_int32, 1, spread_);
+      case Set:
+        return set_row(table, id.val_int32, next.rows[id.val_int32], spread_);
+      default:
+        return by_index ? sr_delete_row_by_index_1(table, static_cast<uint32_t>(at))
+                        : sr_delete_rows_1(table, "Id == $i", id.val_int32);
+    }
+  }
+
+  std::mt19937 &rng_;
+  uint32_t spread_;
+  size_t fewest_;
+  size_t most_;
+};
 
 }  // namespace sr_versioned
 

@@ -71,16 +71,6 @@ bool fill(row_map &map, uint32_t rows) {
   return map.size() == rows;
 }
 
-// The keys of reads 0 .. rows-1; read n uses keys[n % rows].
-std::vector<std::string> lookup_keys(uint32_t rows) {
-  std::vector<std::string> keys;
-  keys.reserve(rows);
-  for (uint32_t n = 0; n < rows; ++n) {
-    keys.emplace_back(make_row(lookup_row(n, rows)).key);
-  }
-  return keys;
-}
-
 void map_read_by_key(benchmark::State &state) {
   const auto rows = static_cast<uint32_t>(state.range(0));
   row_map map;

@@ -92,24 +92,6 @@ bool environment::open(const std::string &path, unsigned flags) {
   return txn.begun() && mdb_dbi_open(txn.handle(), nullptr, 0, &table_) == 0 && txn.commit();
 }
 
-std::vector<config_row> make_rows(uint32_t first, uint64_t count) {
-  std::vector<config_row> rows(count);
-  for (uint64_t i = 0; i < count; ++i) {
-    rows[i] = make_row(static_cast<uint32_t>(first + i));
-  }
-  return rows;
-}
-
-// The keys of reads 0 .. rows-1; read n uses keys[n % rows].
-std::vector<std::string> lookup_keys(uint32_t rows) {
-  std::vector<std::string> keys;
-  keys.reserve(rows);
-  for (uint32_t n = 0; n < rows; ++n) {
-    keys.emplace_back(make_row(lookup_row(n, rows)).key);
-  }
-  return keys;
-}
-
 MDB_val key_of(const char *key) {
   return MDB_val{Key_Length, const_cast<char *>(key)};
 }

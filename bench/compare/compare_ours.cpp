@@ -150,15 +150,6 @@ struct read_row {
   }
 };
 
-// The keys of the n-th reads, formatted once so the timed loop only reads.
-std::vector<std::string> lookup_keys(uint32_t rows) {
-  std::vector<std::string> keys(rows);
-  for (uint32_t n = 0; n < rows; ++n) {
-    keys[n] = make_row(lookup_row(n, rows)).key;
-  }
-  return keys;
-}
-
 // Loaded transient tables are kept for the whole run, one per size, since
 // Google Benchmark calls a benchmark several times while it settles on an
 // iteration count and loading a million rows each time would dominate.

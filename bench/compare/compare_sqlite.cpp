@@ -95,24 +95,6 @@ class statement {
   sqlite3_stmt *stmt_ = nullptr;
 };
 
-std::vector<config_row> make_rows(uint32_t first, uint64_t count) {
-  std::vector<config_row> rows(count);
-  for (uint64_t i = 0; i < count; ++i) {
-    rows[i] = make_row(static_cast<uint32_t>(first + i));
-  }
-  return rows;
-}
-
-// The keys of reads 0 .. rows-1; read n uses keys[n % rows].
-std::vector<std::string> lookup_keys(uint32_t rows) {
-  std::vector<std::string> keys;
-  keys.reserve(rows);
-  for (uint32_t n = 0; n < rows; ++n) {
-    keys.emplace_back(make_row(lookup_row(n, rows)).key);
-  }
-  return keys;
-}
-
 bool bind_text(sqlite3_stmt *stmt, int parameter, const char *text) {
   return sqlite3_bind_text(stmt, parameter, text, -1, SQLITE_STATIC) == SQLITE_OK;
 }

@@ -84,6 +84,26 @@ inline uint32_t lookup_row(uint64_t n, uint32_t rows) {
   return static_cast<uint32_t>((n * 7919u) % rows);
 }
 
+// Rows first .. first+count-1, formatted before a timed loop.
+inline std::vector<config_row> make_rows(uint32_t first, uint64_t count) {
+  std::vector<config_row> rows(count);
+  for (uint64_t i = 0; i < count; ++i) {
+    rows[i] = make_row(static_cast<uint32_t>(first + i));
+  }
+  return rows;
+}
+
+// The keys of reads 0 .. rows-1, formatted before a timed loop; read n uses
+// keys[n % rows].
+inline std::vector<std::string> lookup_keys(uint32_t rows) {
+  std::vector<std::string> keys;
+  keys.reserve(rows);
+  for (uint32_t n = 0; n < rows; ++n) {
+    keys.emplace_back(make_row(lookup_row(n, rows)).key);
+  }
+  return keys;
+}
+
 // A fresh directory for a benchmark's files, removed with everything in it
 // when the object goes away. It lies below $QV_BENCH_DIR, or /var/tmp, so
 // that durable workloads flush to a real disk rather than to memory.

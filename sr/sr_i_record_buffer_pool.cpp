@@ -108,7 +108,7 @@ void note_free_record_inserted(sr_i_record_buffer_pool_t *p_pool, sr_i_record_me
       p_pool->search_bound = 0;  // the merged record's own predecessor is unknown
       return;
     }
-    p_pool->p_search_start = p_merged;
+    p_pool->p_search_start = p_merged;  // the bound still holds below it
     p_pool->p_search_start_previous = p_previous;
     return;
   }
@@ -116,6 +116,24 @@ void note_free_record_inserted(sr_i_record_buffer_pool_t *p_pool, sr_i_record_me
   if (p_merged->p_next == p_start) {
     p_pool->p_search_start_previous = p_merged;
   }
+}
+
+// Links a free record into the pool's chain, starting the walk from the
+// search hint where it can, and keeps the hint true. Returns what
+// sr_i_rb_insert_free_record returns.
+uint32_t link_free_record(sr_i_record_buffer_pool_t *p_pool, sr_i_record_metadata_t *p_record,
+                          sr_i_record_metadata_t **pp_previous) {
+  const uint32_t bytes_out_of_use = insert_free_record_above(
+      p_record, &p_pool->p_free_chain, free_record_below(p_pool, p_record), pp_previous);
+  note_free_record_inserted(p_pool, p_record, *pp_previous);
+  return bytes_out_of_use;
+}
+
+void set_search_start(sr_i_record_buffer_pool_t *p_pool, sr_i_record_metadata_t *p_start,
+                      sr_i_record_metadata_t *p_previous, uint32_t bound) {
+  p_pool->p_search_start = p_start;
+  p_pool->p_search_start_previous = p_previous;
+  p_pool->search_bound = bound;
 }
 
 // A zeroed block of `block_size` bytes appended to the pool, its data area
@@ -145,9 +163,7 @@ int32_t add_block(sr_i_record_buffer_pool_t *p_pool, uint64_t block_size,
   p_record->type = SR_I_RECORD_FREE;
   // A fresh block touches no other free record, so nothing merges and the
   // count returned is only the new data area, which is not in use.
-  insert_free_record_above(p_record, &p_pool->p_free_chain, free_record_below(p_pool, p_record),
-                           pp_previous);
-  note_free_record_inserted(p_pool, p_record, *pp_previous);
+  link_free_record(p_pool, p_record, pp_previous);
   *pp_record = p_record;
   return 0;
 }
@@ -210,9 +226,7 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
     // reaching further along the chain is kept.
     if (p_pool->search_bound == 0 || (p_pool->p_search_start != nullptr &&
                                       address_of(p_record) >= address_of(p_pool->p_search_start))) {
-      p_pool->p_search_start = p_record;
-      p_pool->p_search_start_previous = p_previous;
-      p_pool->search_bound = data_length;
+      set_search_start(p_pool, p_record, p_previous, data_length);
     }
   } else {
     // A new block comes zeroed from calloc.
@@ -224,9 +238,7 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
       return rc;
     }
     // No other free record holds data_length bytes.
-    p_pool->p_search_start = p_record;
-    p_pool->p_search_start_previous = p_previous;
-    p_pool->search_bound = data_length;
+    set_search_start(p_pool, p_record, p_previous, data_length);
   }
   *pp_data = sr_i_rb_record_data(p_record);
   *pp_previous_free_record = p_previous;
@@ -289,9 +301,7 @@ int32_t sr_i_rb_free_record(sr_i_record_buffer_pool_t *p_pool, void *p_data) {
   sr_i_record_metadata_t *p_record = sr_i_rb_record_header(p_data);
   p_record->type = SR_I_RECORD_FREE;
   sr_i_record_metadata_t *p_previous = nullptr;
-  p_pool->used_bytes -= insert_free_record_above(p_record, &p_pool->p_free_chain,
-                                                 free_record_below(p_pool, p_record), &p_previous);
-  note_free_record_inserted(p_pool, p_record, p_previous);
+  p_pool->used_bytes -= link_free_record(p_pool, p_record, &p_previous);
   return 0;
 }
 
@@ -370,9 +380,7 @@ int32_t sr_i_rb_duplicate_record_buffer_pool(
   }
   p_to->p_first_record_buffer = p_copy;
   p_to->p_last_record_buffer = p_copy;
-  p_to->p_search_start = nullptr;
-  p_to->p_search_start_previous = nullptr;
-  p_to->search_bound = 0;
+  set_search_start(p_to, nullptr, nullptr, 0);
 
   // The free chain of the copy is linked afresh in the copy's own address
   // order: the source's blocks lie end to end in allocation order, which

@@ -290,17 +290,10 @@ void durable_add(benchmark::State &state) {
     return;
   }
   // Rows past the table's first ones, formatted before timing.
-  std::vector<config_row> new_rows;
-  uint32_t next = 0;
+  const std::vector<config_row> added = make_rows(Durable_Table_Rows, state.max_iterations);
+  size_t next = 0;
   for (auto _ : state) {
-    if (next == new_rows.size()) {
-      state.PauseTiming();
-      for (uint32_t i = 0; i < 10000; ++i) {
-        new_rows.push_back(make_row(Durable_Table_Rows + next + i));
-      }
-      state.ResumeTiming();
-    }
-    if (!check(state, add_row(durable.table, new_rows[next++]) == 0, "sr_add_row_1")) {
+    if (!check(state, add_row(durable.table, added[next++]) == 0, "sr_add_row_1")) {
       return;
     }
   }

@@ -5,11 +5,14 @@
 // good. New elements go to the head of their chain, so among equal keys the
 // newest is found first. Every bucket number a hash function produces is
 // checked against the bucket count before it is used, since a client's
-// function is outside our control. Allocation uses nothrow new, so a failure
-// is a code and never an exception.
+// function is outside our control. Elements come from the table's own
+// element blocks (see sr_hash_table_t); allocation uses nothrow new and
+// catches the block list's growth, so a failure is a code and never an
+// exception.
 
 #include "sr_i_hash_table.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <cstring>
 #include <new>
@@ -20,6 +23,11 @@
 namespace {
 
 constexpr uint32_t Resource_Handle_Bucket_Mask = Sr_Resource_Handle_Hash_Buckets - 1;
+
+// Element blocks start small, so that a table of a few keys stays small, and
+// double up to a size that keeps each block well inside the heap.
+constexpr uint32_t First_Element_Block = 32;
+constexpr uint32_t Largest_Element_Block = 4096;
 
 // Keys inside row records are not aligned: the handles are read through
 // copies.
@@ -59,6 +67,9 @@ int32_t sr_i_hash_table_open(uint32_t total_hash_buckets, sr_hash_function_t p_h
   p_hash_table->p_hash_function = p_hash_function;
   p_hash_table->p_compare_function = p_compare_function;
   p_hash_table->p_elements = p_elements;
+  p_hash_table->last_block_capacity = 0;
+  p_hash_table->unused_in_last_block = 0;
+  p_hash_table->p_free_elements = nullptr;
   *p_p_hash_table = p_hash_table;
   return 0;
 }
@@ -67,16 +78,8 @@ int32_t sr_i_hash_table_close(sr_hash_table_t *p_hash_table) {
   if (p_hash_table == nullptr) {
     return 0;
   }
-  for (uint32_t bucket = 0; bucket < p_hash_table->total_hash_buckets; ++bucket) {
-    sr_hash_table_element_t *p_element = p_hash_table->p_elements[bucket];
-    while (p_element != nullptr) {
-      sr_hash_table_element_t *p_next = p_element->p_next;
-      delete p_element;
-      p_element = p_next;
-    }
-  }
   delete[] p_hash_table->p_elements;
-  delete p_hash_table;
+  delete p_hash_table;  // with it the element blocks
   return 0;
 }
 
@@ -96,6 +99,40 @@ int32_t sr_i_hash_table_bucket(const sr_hash_table_t *p_hash_table, const void *
 }
 
 namespace {
+
+// An unused element: a removed one if any waits, else the next of the last
+// block, else the first of a new block. Null when memory runs out.
+sr_hash_table_element_t *new_element(sr_hash_table_t *p_hash_table) {
+  if (sr_hash_table_element_t *p_element = p_hash_table->p_free_elements) {
+    p_hash_table->p_free_elements = p_element->p_next;
+    return p_element;
+  }
+  if (p_hash_table->unused_in_last_block == 0) {
+    const uint32_t capacity =
+        p_hash_table->element_blocks.empty()
+            ? First_Element_Block
+            : std::min(p_hash_table->last_block_capacity * 2, Largest_Element_Block);
+    std::unique_ptr<sr_hash_table_element_t[]> block(new (std::nothrow)
+                                                         sr_hash_table_element_t[capacity]);
+    if (block == nullptr) {
+      return nullptr;
+    }
+    try {
+      p_hash_table->element_blocks.push_back(std::move(block));
+    } catch (const std::bad_alloc &) {
+      return nullptr;
+    }
+    p_hash_table->last_block_capacity = capacity;
+    p_hash_table->unused_in_last_block = capacity;
+  }
+  const uint32_t next = p_hash_table->last_block_capacity - p_hash_table->unused_in_last_block--;
+  return &p_hash_table->element_blocks.back()[next];
+}
+
+void free_element(sr_hash_table_t *p_hash_table, sr_hash_table_element_t *p_element) {
+  p_element->p_next = p_hash_table->p_free_elements;
+  p_hash_table->p_free_elements = p_element;
+}
 
 // The link that points at the newest element with a key equal to
 // `p_key_value` in `bucket` (the bucket head or a predecessor's `p_next`),
@@ -128,7 +165,7 @@ int32_t sr_i_hash_table_add(sr_hash_table_t *p_hash_table, const void *p_key_val
       return SR_E_DUPLICATE_KEY;
     }
   }
-  auto *p_element = new (std::nothrow) sr_hash_table_element_t;
+  sr_hash_table_element_t *p_element = new_element(p_hash_table);
   if (p_element == nullptr) {
     return sr_i_raise_no_memory();
   }
@@ -167,7 +204,7 @@ int32_t sr_i_hash_table_remove_element(sr_hash_table_t *p_hash_table, uint32_t h
        p_link = &(*p_link)->p_next) {
     if (*p_link == p_hash_table_element) {
       *p_link = p_hash_table_element->p_next;
-      delete p_hash_table_element;
+      free_element(p_hash_table, p_hash_table_element);
       return 0;
     }
   }
@@ -185,7 +222,7 @@ int32_t sr_i_hash_table_remove(sr_hash_table_t *p_hash_table, const void *p_key_
   }
   sr_hash_table_element_t *p_element = *p_link;
   *p_link = p_element->p_next;
-  delete p_element;
+  free_element(p_hash_table, p_element);
   return 0;
 }
 

@@ -13,11 +13,13 @@
 // used, so a damaged or hostile file fails with 14, 213, 214 or 215 and is
 // never read out of bounds.
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <new>
-#include <unordered_map>
+#include <span>
 #include <vector>
 
 #include "sr_i_application_metadata.h"
@@ -35,7 +37,15 @@ namespace {
 constexpr uint32_t Read_Margin = 4096;
 constexpr uint32_t Rows_Without_Estimate = 100;
 
-uint32_t word_at(const std::vector<unsigned char> &bytes, size_t offset) {
+// The file as read: its bytes are not cleared before the read fills them,
+// since a large table's file is tens of megabytes.
+struct file_image {
+  std::unique_ptr<unsigned char[]> buffer;
+  uint32_t size = 0;
+  std::span<const unsigned char> bytes() const { return {buffer.get(), size}; }
+};
+
+uint32_t word_at(std::span<const unsigned char> bytes, size_t offset) {
   uint32_t word;
   std::memcpy(&word, bytes.data() + offset, sizeof word);
   return word;
@@ -103,7 +113,7 @@ int32_t open_table_file(sr_i_table_t *p_table, bool writable) {
 
 // Reads the whole file; a read that fills the buffer means the file grew
 // meanwhile, and it is measured and read again.
-int32_t read_whole_file(int fd, std::vector<unsigned char> &bytes) {
+int32_t read_whole_file(int fd, file_image &image) {
   for (;;) {
     const off_t end = Sr_File_System.lseek(fd, 0, SEEK_END);
     if (end < 0) {
@@ -117,16 +127,16 @@ int32_t read_whole_file(int fd, std::vector<unsigned char> &bytes) {
     }
     const auto capacity = static_cast<uint32_t>(end) + Read_Margin;
     try {
-      bytes.resize(capacity);
+      image.buffer = std::make_unique_for_overwrite<unsigned char[]>(capacity);
     } catch (const std::bad_alloc &) {
       return sr_i_raise_no_memory();
     }
     uint32_t read = 0;
-    if (const int32_t rc = sr_i_read(fd, bytes.data(), capacity, &read); rc != 0) {
+    if (const int32_t rc = sr_i_read(fd, image.buffer.get(), capacity, &read); rc != 0) {
       return rc;
     }
     if (read < capacity) {
-      bytes.resize(read);
+      image.size = read;
       return read < Sr_Shortest_Table_File ? sr_i_raise(SR_E_TABLE_UNREADABLE) : 0;
     }
   }
@@ -136,10 +146,11 @@ int32_t read_whole_file(int fd, std::vector<unsigned char> &bytes) {
 struct committed_extent {
   uint32_t commit_record_offset = 0;
   uint32_t memory_length = 0;  // the records behind the metadata record, in memory form
+  uint32_t row_records = 0;
 };
 
 // Checks every record header up to the first live commit record.
-int32_t find_committed_extent(const std::vector<unsigned char> &bytes, uint32_t first_record,
+int32_t find_committed_extent(std::span<const unsigned char> bytes, uint32_t first_record,
                               committed_extent &extent) {
   const auto size = static_cast<uint32_t>(bytes.size());
   for (uint32_t offset = first_record;;) {
@@ -157,6 +168,7 @@ int32_t find_committed_extent(const std::vector<unsigned char> &bytes, uint32_t 
       return sr_i_raise(SR_E_TABLE_UNREADABLE);
     }
     extent.memory_length += length + Sr_Memory_Record_Extra;
+    extent.row_records += type == Sr_Row_Record ? 1 : 0;
     if (type == Sr_Live_Commit_Record) {
       extent.commit_record_offset = offset;
       return 0;
@@ -196,10 +208,15 @@ bool valid_row_record(const sr_i_table_t *p_table, const unsigned char *p_row, u
 // Replays the records of the committed state into the table.
 class replay {
  public:
-  replay(sr_i_table_t *p_table, const std::vector<unsigned char> &bytes)
+  replay(sr_i_table_t *p_table, std::span<const unsigned char> bytes)
       : p_table_(p_table), bytes_(bytes) {}
 
-  int32_t run(uint32_t first_record) {
+  int32_t run(uint32_t first_record, uint32_t row_records) {
+    try {
+      current_records_.reserve(row_records);
+    } catch (const std::bad_alloc &) {
+      return sr_i_raise_no_memory();
+    }
     uint32_t ordinal = 1;
     for (uint32_t offset = first_record;; ++ordinal) {
       const uint32_t length = word_at(bytes_, offset);
@@ -233,12 +250,12 @@ class replay {
     const uint32_t replaced = word_at(bytes_, offset + Sr_File_Record_Header_Length);
     sr_i_index_entry_t *p_entry = nullptr;
     if (replaced != 0) {
-      const auto current = current_records_.find(replaced);
-      if (current == current_records_.end()) {
+      current_record *p_current = find_current(replaced);
+      if (p_current == nullptr) {
         return sr_i_raise(SR_E_NO_REPLACED_ROW);
       }
-      p_entry = &p_table_->p_rows_fixed_index[current->second];
-      current_records_.erase(current);
+      p_entry = &p_table_->p_rows_fixed_index[p_current->position];
+      p_current->position = Gone;
       sr_i_rb_free_record(&p_table_->record_buffer_pool, p_entry->p_committed);
     } else {
       p_entry = sr_i_rows_free_chain_remove(p_table_);
@@ -262,11 +279,8 @@ class replay {
     p_entry->p_committed = p_record;
     p_entry->file_offset = offset;
     p_entry->applied_file_offset = 0;
-    try {
-      current_records_[offset] = sr_i_fixed_position(p_table_, p_entry);
-    } catch (const std::bad_alloc &) {
-      return sr_i_raise_no_memory();
-    }
+    // Reserved for every row record of the file, so this cannot allocate.
+    current_records_.push_back({offset, sr_i_fixed_position(p_table_, p_entry)});
     return 0;
   }
 
@@ -280,12 +294,12 @@ class replay {
     }
     for (uint32_t at = 0; at < count; ++at) {
       const uint32_t deleted = word_at(bytes_, offset + Sr_File_Record_Header_Length + 4 + 4 * at);
-      const auto current = current_records_.find(deleted);
-      if (current == current_records_.end()) {
+      current_record *p_current = find_current(deleted);
+      if (p_current == nullptr) {
         return sr_i_raise(SR_E_NO_DELETED_ROW);
       }
-      sr_i_index_entry_t *p_entry = &p_table_->p_rows_fixed_index[current->second];
-      current_records_.erase(current);
+      sr_i_index_entry_t *p_entry = &p_table_->p_rows_fixed_index[p_current->position];
+      p_current->position = Gone;
       sr_i_rb_free_record(&p_table_->record_buffer_pool, p_entry->p_committed);
       sr_i_rows_free_chain_insert(p_table_, p_entry);
       --p_table_->total_applied_rows;
@@ -315,10 +329,29 @@ class replay {
     return 0;
   }
 
+  // Where a row's current record starts in the file, and the row's fixed
+  // index. Records are replayed in ascending file order, so appending keeps
+  // the list sorted and a lookup is a binary search; a record replaced or
+  // deleted keeps its place, marked gone.
+  struct current_record {
+    uint32_t file_offset;
+    uint32_t position;
+  };
+  static constexpr uint32_t Gone = UINT32_MAX;
+
+  current_record *find_current(uint32_t file_offset) {
+    const auto at = std::lower_bound(
+        current_records_.begin(), current_records_.end(), file_offset,
+        [](const current_record &record, uint32_t offset) { return record.file_offset < offset; });
+    if (at == current_records_.end() || at->file_offset != file_offset || at->position == Gone) {
+      return nullptr;
+    }
+    return &*at;
+  }
+
   sr_i_table_t *p_table_;
-  const std::vector<unsigned char> &bytes_;
-  // File offset of each row's current record -> the row's fixed index.
-  std::unordered_map<uint32_t, uint32_t> current_records_;
+  std::span<const unsigned char> bytes_;
+  std::vector<current_record> current_records_;
 };
 
 // The table's row index and pool, sized from the file so that its rows and
@@ -350,10 +383,11 @@ int32_t load(sr_i_table_t *p_table, bool writable) {
   if (const int32_t rc = open_table_file(p_table, writable); rc != 0) {
     return rc;
   }
-  std::vector<unsigned char> bytes;
-  if (const int32_t rc = read_whole_file(p_table->file_fd, bytes); rc != 0) {
+  file_image image;
+  if (const int32_t rc = read_whole_file(p_table->file_fd, image); rc != 0) {
     return rc;
   }
+  const std::span<const unsigned char> bytes = image.bytes();
   p_table->file_length = static_cast<uint32_t>(bytes.size());
   p_table->disk_file_length = p_table->file_length;
   const uint32_t metadata_length = word_at(bytes, 0);
@@ -383,7 +417,7 @@ int32_t load(sr_i_table_t *p_table, bool writable) {
       rc != 0) {
     return rc;
   }
-  if (const int32_t rc = replay(p_table, bytes).run(metadata_length); rc != 0) {
+  if (const int32_t rc = replay(p_table, bytes).run(metadata_length, extent.row_records); rc != 0) {
     return rc;
   }
   p_table->total_committed_rows = p_table->total_applied_rows;

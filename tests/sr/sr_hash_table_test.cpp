@@ -1,13 +1,17 @@
 // The key hash table: client and built-in hashing, bucket numbers out of
-// range, the statistics, and a random sequence of operations under both key
-// qualifiers, with unlinking by identity, checked against a std::multimap.
+// range, the statistics, a random sequence of operations under both key
+// qualifiers, with unlinking by identity, checked against a std::multimap,
+// and enough elements to span many element blocks with removed ones reused.
 
 #include <gtest/gtest.h>
 
 #include <iterator>
 #include <map>
 #include <random>
+#include <set>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "qv_cu.h"
 #include "sr_i_hash_table.h"
@@ -191,6 +195,35 @@ TEST_F(ClientHashTable, RandomOperationsAgreeWithAMultimap) {
       const int64_t newest_row = first == last ? int64_t{-1} : int64_t{std::prev(last)->second.row};
       ASSERT_EQ(row_for(p_table, probe), newest_row);
     }
+  }
+}
+
+// Elements live in blocks the table carves them from, and removed ones are
+// handed out again: thousands of keys, half removed and replaced by new
+// keys, must all stay findable, each element distinct from every other.
+TEST_F(ClientHashTable, ManyElementsSurviveRemovalAndReuseAcrossBlocks) {
+  constexpr uint32_t Keys = 6000;
+  std::vector<uint32_t> keys(2 * Keys);
+  std::vector<std::pair<uint32_t, sr_hash_table_element_t *>> placed(2 * Keys);
+  for (uint32_t key = 0; key < Keys; ++key) {
+    keys[key] = key;
+    ASSERT_EQ(add(keys[key], key, SR_PRIMARY_KEY), 0);
+    placed[key] = {bucket, p_element};
+  }
+  for (uint32_t key = 0; key < Keys; key += 2) {
+    ASSERT_EQ(sr_i_hash_table_remove_element(p_table, placed[key].first, placed[key].second), 0);
+  }
+  std::set<sr_hash_table_element_t *> live;
+  for (uint32_t key = 1; key < Keys; key += 2) {
+    live.insert(placed[key].second);
+  }
+  for (uint32_t key = Keys; key < Keys + Keys / 2; ++key) {
+    keys[key] = key;
+    ASSERT_EQ(add(keys[key], key, SR_PRIMARY_KEY), 0);
+    ASSERT_TRUE(live.insert(p_element).second) << "element of key " << key << " is in use";
+  }
+  for (uint32_t key = 0; key < Keys + Keys / 2; ++key) {
+    ASSERT_EQ(row_for(p_table, key), key < Keys && key % 2 == 0 ? -1 : int64_t{key}) << key;
   }
 }
 

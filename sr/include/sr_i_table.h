@@ -34,7 +34,9 @@ inline constexpr uint32_t Sr_Mode_Writable = 2;
 inline constexpr uint32_t Sr_Initial_Transient_Rows = 100;
 inline constexpr uint32_t Sr_Default_Index_Rows = 10;
 
-/* One position of the fixed row index. */
+/* One position of the fixed row index. The two 32-bit positions share one
+ * 8-byte word so that an entry takes 48 bytes, not 56: the index holds an
+ * entry for every row and doubles as it grows. */
 typedef struct sr_i_index_entry_struct_t {
   void *p_applied;   /* the row record as applied, or null */
   void *p_committed; /* the row record as committed; null: no committed row */
@@ -43,9 +45,10 @@ typedef struct sr_i_index_entry_struct_t {
   /* The row's pending change; while the entry is free, the next free entry. */
   void *p_pending_change;
   uint32_t hash_index;
-  struct sr_hash_table_element_struct_t *p_hash_table_element;
   uint32_t packed_index;
+  struct sr_hash_table_element_struct_t *p_hash_table_element;
 } sr_i_index_entry_t;
+static_assert(sizeof(sr_i_index_entry_t) == 48);
 
 /* A pending change of one row. */
 typedef struct sr_i_change_entry_struct_t {

@@ -7,6 +7,15 @@
 // Blocks stay with the pool until it is uninitialised, even when wholly
 // free. Two blocks never touch (each begins with its own header), so a merge
 // of free records can only happen inside one block.
+//
+// Two aids keep first fit fast and leave its answer exact. The search hint
+// (see the pool structure) lets a request start past the free records it
+// knows to be too short. The directory lists the blocks in address order
+// with each block's lowest and highest free record and a bound on its
+// longest: when the hint has not brought a search to a fit within a few
+// steps, the search goes on block by block, stepping over blocks whose bound
+// is too short, and a record entering the chain finds the free record below
+// it through its own block or the nearest block below that has one.
 
 #include "sr_i_record_buffer_pool.h"
 
@@ -26,6 +35,12 @@ constexpr uint32_t Large_Request_Length = 65536;
 constexpr uint32_t Small_Request_Block_Factor = 100;
 // A block header plus the header of the one record a new block starts with.
 constexpr uint32_t New_Block_Overhead = Sr_Record_Buffer_Header_Length + Sr_Record_Header_Length;
+// Free records a search walks from its start before it turns to the
+// directory.
+constexpr uint32_t Chain_Steps_Before_Directory = 8;
+constexpr uint32_t First_Directory_Capacity = 8;
+
+using directory_entry = sr_i_record_buffer_directory_entry_t;
 
 uintptr_t address_of(const void *p_address) {
   return reinterpret_cast<uintptr_t>(p_address);
@@ -37,6 +52,38 @@ uintptr_t end_of(const sr_i_record_metadata_t *p_record) {
 
 uint32_t data_area_length(const sr_i_record_metadata_t *p_record) {
   return p_record->record_length - Sr_Record_Header_Length;
+}
+
+bool in_block(const sr_i_record_buffer_t *p_block, const void *p_address) {
+  const uintptr_t address = address_of(p_address);
+  return address >= address_of(p_block) && address < address_of(p_block) + p_block->total_bytes;
+}
+
+// The directory entry of the block that holds `p_address`.
+directory_entry &entry_of(const sr_i_record_buffer_pool_t *p_pool, const void *p_address) {
+  directory_entry *p_first = p_pool->p_directory;
+  if (p_pool->total_blocks == 1) {
+    return *p_first;
+  }
+  directory_entry *p_after =
+      std::upper_bound(p_first, p_first + p_pool->total_blocks, address_of(p_address),
+                       [](uintptr_t address, const directory_entry &entry) {
+                         return address < address_of(entry.p_block);
+                       });
+  return *(p_after - 1);
+}
+
+// The highest free record in the blocks below directory entry `p_entry`, or
+// null when they have none.
+sr_i_record_metadata_t *last_free_record_before(const sr_i_record_buffer_pool_t *p_pool,
+                                                const directory_entry *p_entry) {
+  while (p_entry != p_pool->p_directory) {
+    --p_entry;
+    if (p_entry->p_last_free != nullptr) {
+      return p_entry->p_last_free;
+    }
+  }
+  return nullptr;
 }
 
 // Links a free record into the address-ordered chain, as
@@ -73,20 +120,31 @@ uint32_t insert_free_record_above(sr_i_record_metadata_t *p_record,
   return bytes_out_of_use;
 }
 
-// A free record of the chain below `p_record` to start an insertion walk
-// from: the search hint's start or its neighbour when below, else null.
+// The highest free record below `p_record`, which lies in the block of
+// `entry`: walked to from the hint's start or its neighbour, or from the
+// block's lowest free record, when one of them lies below it in the same
+// block; else the highest free record of the blocks below.
 sr_i_record_metadata_t *free_record_below(const sr_i_record_buffer_pool_t *p_pool,
+                                          const directory_entry &entry,
                                           const sr_i_record_metadata_t *p_record) {
-  if (p_pool->search_bound == 0) {
-    return nullptr;
+  auto below_in_block = [&](sr_i_record_metadata_t *p_candidate) {
+    return p_candidate != nullptr && in_block(entry.p_block, p_candidate) &&
+           address_of(p_candidate) < address_of(p_record);
+  };
+  sr_i_record_metadata_t *p_below = nullptr;
+  if (p_pool->search_bound != 0 && below_in_block(p_pool->p_search_start)) {
+    p_below = p_pool->p_search_start;
+  } else if (p_pool->search_bound != 0 && below_in_block(p_pool->p_search_start_previous)) {
+    p_below = p_pool->p_search_start_previous;
+  } else if (below_in_block(entry.p_first_free)) {
+    p_below = entry.p_first_free;
+  } else {
+    return last_free_record_before(p_pool, &entry);
   }
-  for (sr_i_record_metadata_t *p_candidate :
-       {p_pool->p_search_start, p_pool->p_search_start_previous}) {
-    if (p_candidate != nullptr && address_of(p_candidate) < address_of(p_record)) {
-      return p_candidate;
-    }
+  while (p_below->p_next != nullptr && address_of(p_below->p_next) < address_of(p_record)) {
+    p_below = p_below->p_next;
   }
-  return nullptr;
+  return p_below;
 }
 
 // Keeps the search hint true after the free record `p_record` went into the
@@ -118,15 +176,78 @@ void note_free_record_inserted(sr_i_record_buffer_pool_t *p_pool, sr_i_record_me
   }
 }
 
-// Links a free record into the pool's chain, starting the walk from the
-// search hint where it can, and keeps the hint true. Returns what
-// sr_i_rb_insert_free_record returns.
+// Keeps a block's directory entry true after the free record `p_record`
+// went into the chain, `p_previous` being as for note_free_record_inserted.
+// The record, merged or not, may be the block's new lowest or highest free
+// record, or have swallowed either.
+void note_free_record_in_block(directory_entry &entry, sr_i_record_metadata_t *p_record,
+                               sr_i_record_metadata_t *p_previous) {
+  const bool absorbed = p_previous != nullptr && end_of(p_previous) > address_of(p_record);
+  sr_i_record_metadata_t *p_merged = absorbed ? p_previous : p_record;
+  if (entry.p_first_free == nullptr || address_of(entry.p_first_free) >= address_of(p_merged)) {
+    entry.p_first_free = p_merged;
+  }
+  if (entry.p_last_free == nullptr || address_of(entry.p_last_free) < end_of(p_merged)) {
+    entry.p_last_free = p_merged;
+  }
+  entry.largest_free_bound = std::max(entry.largest_free_bound, data_area_length(p_merged));
+}
+
+// Links a free record into the pool's chain, starting the walk next to it
+// where the hint or the directory knows a free record below it, and keeps
+// the hint and the directory true. Returns what sr_i_rb_insert_free_record
+// returns.
 uint32_t link_free_record(sr_i_record_buffer_pool_t *p_pool, sr_i_record_metadata_t *p_record,
                           sr_i_record_metadata_t **pp_previous) {
+  directory_entry &entry = entry_of(p_pool, p_record);
   const uint32_t bytes_out_of_use = insert_free_record_above(
-      p_record, &p_pool->p_free_chain, free_record_below(p_pool, p_record), pp_previous);
+      p_record, &p_pool->p_free_chain, free_record_below(p_pool, entry, p_record), pp_previous);
   note_free_record_inserted(p_pool, p_record, *pp_previous);
+  note_free_record_in_block(entry, p_record, *pp_previous);
   return bytes_out_of_use;
+}
+
+// First fit for `data_length` bytes among the free records from `p_from`
+// on, every free record below `p_from` being shorter; `*pp_previous` comes
+// in as the free record before `p_from` and goes out as the one before the
+// record found. Blocks are taken in address order, and one whose bound is
+// short of `data_length` is stepped over without being touched; a block
+// looked at in full gets its exact longest free record as its bound. Null
+// when nothing fits.
+sr_i_record_metadata_t *search_by_directory(sr_i_record_buffer_pool_t *p_pool, uint32_t data_length,
+                                            sr_i_record_metadata_t *p_from,
+                                            sr_i_record_metadata_t **pp_previous) {
+  directory_entry *p_start = &entry_of(p_pool, p_from);
+  directory_entry *p_end = p_pool->p_directory + p_pool->total_blocks;
+  sr_i_record_metadata_t *p_previous = *pp_previous;
+  sr_i_record_metadata_t *p_record = p_from;
+  for (directory_entry *p_entry = p_start; p_entry != p_end; ++p_entry) {
+    if (p_entry != p_start) {
+      if (p_entry->p_first_free == nullptr) {
+        continue;
+      }
+      if (p_entry->largest_free_bound < data_length) {
+        p_previous = p_entry->p_last_free;
+        continue;
+      }
+      p_record = p_entry->p_first_free;
+    }
+    uint32_t longest = 0;
+    for (; p_record != nullptr && in_block(p_entry->p_block, p_record);
+         p_previous = p_record, p_record = p_record->p_next) {
+      if (data_area_length(p_record) >= data_length) {
+        *pp_previous = p_previous;
+        return p_record;
+      }
+      longest = std::max(longest, data_area_length(p_record));
+    }
+    // In the first block only the records from p_from on were looked at;
+    // those before it are shorter than data_length too.
+    p_entry->largest_free_bound =
+        p_entry == p_start ? std::min(p_entry->largest_free_bound, data_length - 1) : longest;
+  }
+  *pp_previous = p_previous;
+  return nullptr;
 }
 
 void set_search_start(sr_i_record_buffer_pool_t *p_pool, sr_i_record_metadata_t *p_start,
@@ -148,6 +269,26 @@ int32_t add_block(sr_i_record_buffer_pool_t *p_pool, uint64_t block_size,
   if (p_block == nullptr) {
     return sr_i_raise_no_memory();
   }
+  if (p_pool->total_blocks == p_pool->directory_capacity) {
+    const uint32_t capacity = std::max(First_Directory_Capacity, p_pool->directory_capacity * 2);
+    auto *p_directory = static_cast<directory_entry *>(
+        realloc(p_pool->p_directory, capacity * sizeof(directory_entry)));
+    if (p_directory == nullptr) {
+      free(p_block);
+      return sr_i_raise_no_memory();
+    }
+    p_pool->p_directory = p_directory;
+    p_pool->directory_capacity = capacity;
+  }
+  directory_entry *p_entry =
+      std::upper_bound(p_pool->p_directory, p_pool->p_directory + p_pool->total_blocks,
+                       address_of(p_block), [](uintptr_t address, const directory_entry &entry) {
+                         return address < address_of(entry.p_block);
+                       });
+  std::memmove(p_entry + 1, p_entry,
+               (p_pool->p_directory + p_pool->total_blocks - p_entry) * sizeof(directory_entry));
+  *p_entry = directory_entry{p_block, nullptr, nullptr, 0};
+  ++p_pool->total_blocks;
   p_block->total_bytes = static_cast<uint32_t>(block_size);
   if (p_pool->p_last_record_buffer == nullptr) {
     p_pool->p_first_record_buffer = p_block;
@@ -198,6 +339,7 @@ int32_t sr_i_rb_uninitialize_record_buffer_pool(sr_i_record_buffer_pool_t *p_poo
     free(p_block);
     p_block = p_next;
   }
+  free(p_pool->p_directory);
   *p_pool = sr_i_record_buffer_pool_t{};
   return 0;
 }
@@ -212,7 +354,12 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
     p_previous = p_pool->p_search_start_previous;
     p_record = p_pool->p_search_start;
   }
-  while (p_record != nullptr && data_area_length(p_record) < data_length) {
+  for (uint32_t steps = 0; p_record != nullptr && data_area_length(p_record) < data_length;
+       ++steps) {
+    if (steps == Chain_Steps_Before_Directory && p_pool->total_blocks > 1) {
+      p_record = search_by_directory(p_pool, data_length, p_record, &p_previous);
+      break;
+    }
     p_previous = p_record;
     p_record = p_record->p_next;
   }
@@ -284,6 +431,17 @@ int32_t sr_i_rb_allocate_record(sr_i_record_buffer_pool_t *p_pool, void *p_data,
     p_pool->used_bytes += data_length + Sr_Record_Header_Length;
   }
   replace_in_chain(p_successor);
+  directory_entry &entry = entry_of(p_pool, p_record);
+  if (entry.p_first_free == p_record) {
+    entry.p_first_free = in_block(entry.p_block, p_successor) ? p_successor : nullptr;
+  }
+  if (entry.p_last_free == p_record) {
+    entry.p_last_free =
+        !taken_whole ? p_successor
+        : p_previous_free_record != nullptr && in_block(entry.p_block, p_previous_free_record)
+            ? p_previous_free_record
+            : nullptr;
+  }
   // Records only shrink or leave here, so the hint's bound stays true; its
   // start and the start's neighbour may have to follow the change.
   if (p_record == p_pool->p_search_start) {
@@ -350,14 +508,18 @@ int32_t sr_i_rb_duplicate_record_buffer_pool(
   }
   p_map->total = total_blocks;
   sr_i_record_buffer_t *p_copy = nullptr;
+  directory_entry *p_directory = nullptr;
   if (total_blocks > 0) {
     p_map->p_begin = static_cast<unsigned char **>(malloc(total_blocks * sizeof(unsigned char *)));
     p_map->p_end = static_cast<unsigned char **>(malloc(total_blocks * sizeof(unsigned char *)));
     p_map->p_offset = static_cast<int64_t *>(malloc(total_blocks * sizeof(int64_t)));
-    if (p_map->p_begin != nullptr && p_map->p_end != nullptr && p_map->p_offset != nullptr) {
+    p_directory = static_cast<directory_entry *>(malloc(sizeof(directory_entry)));
+    if (p_map->p_begin != nullptr && p_map->p_end != nullptr && p_map->p_offset != nullptr &&
+        p_directory != nullptr) {
       p_copy = static_cast<sr_i_record_buffer_t *>(malloc(p_to->total_bytes));
     }
     if (p_copy == nullptr) {
+      free(p_directory);
       sr_i_rb_free_duplication_map(p_map);
       return sr_i_raise_no_memory();
     }
@@ -381,6 +543,9 @@ int32_t sr_i_rb_duplicate_record_buffer_pool(
   p_to->p_first_record_buffer = p_copy;
   p_to->p_last_record_buffer = p_copy;
   set_search_start(p_to, nullptr, nullptr, 0);
+  p_to->p_directory = p_directory;
+  p_to->total_blocks = total_blocks == 0 ? 0 : 1;
+  p_to->directory_capacity = p_to->total_blocks;
 
   // The free chain of the copy is linked afresh in the copy's own address
   // order: the source's blocks lie end to end in allocation order, which
@@ -405,6 +570,12 @@ int32_t sr_i_rb_duplicate_record_buffer_pool(
         p_last_free->p_next = p_record;
       }
       p_last_free = p_record;
+    }
+    *p_directory = directory_entry{p_copy, p_to->p_free_chain, p_last_free, 0};
+    for (const sr_i_record_metadata_t *p_free = p_to->p_free_chain; p_free != nullptr;
+         p_free = p_free->p_next) {
+      p_directory->largest_free_bound =
+          std::max(p_directory->largest_free_bound, data_area_length(p_free));
     }
   }
   *pp_duplication_map = p_map;

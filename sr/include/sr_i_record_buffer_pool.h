@@ -49,6 +49,17 @@ inline constexpr uint32_t Sr_Smallest_Split_Remainder = 22;
 static_assert(sizeof(sr_i_record_metadata_t) == Sr_Record_Header_Length);
 static_assert(offsetof(sr_i_record_buffer_t, data) == Sr_Record_Buffer_Header_Length);
 
+/* What the pool knows of one block, kept in its directory of blocks. */
+typedef struct sr_i_record_buffer_directory_entry_struct_t {
+  sr_i_record_buffer_t *p_block;
+  sr_i_record_metadata_t *p_first_free; /* the block's lowest free record, or null */
+  sr_i_record_metadata_t *p_last_free;  /* its highest, or null */
+  /* No free record of the block has a longer data area. Raised when a
+   * record is freed into the block; lowered when a search has looked at
+   * every free record of the block. */
+  uint32_t largest_free_bound;
+} sr_i_record_buffer_directory_entry_t;
+
 typedef struct sr_i_record_buffer_pool_struct_t {
   uint32_t total_bytes; /* sum of the sizes of all blocks */
   /* Every block header, every record header (free records too) and the
@@ -67,6 +78,16 @@ typedef struct sr_i_record_buffer_pool_struct_t {
   sr_i_record_metadata_t *p_search_start;
   sr_i_record_metadata_t *p_search_start_previous; /* the free record before it, or null */
   uint32_t search_bound;
+  /* Every block in address order. The heap may hand out blocks at falling
+   * addresses; the short tails stranded in older blocks then lie above the
+   * newest one, where the hint cannot cover them. With the directory a
+   * search steps over a block whose free records are all too short without
+   * touching it, and a record entering the chain finds its neighbour below
+   * in its own block or the nearest block below, not by walking the chain
+   * from its head. */
+  sr_i_record_buffer_directory_entry_t *p_directory;
+  uint32_t total_blocks;
+  uint32_t directory_capacity;
 } sr_i_record_buffer_pool_t;
 
 /*

@@ -5,10 +5,12 @@
 //
 // Index entries are handed out lowest position first: the free chain is
 // kept in ascending address order, linked through p_pending_change, which a
-// free entry does not otherwise use.
+// free entry does not otherwise use. Entries that were never handed out
+// follow one another without links (see p_rows_never_used).
 
 #include "sr_i_table.h"
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
@@ -22,15 +24,12 @@
 
 namespace {
 
-sr_i_index_entry_t *next_free(const sr_i_index_entry_t *p_entry) {
-  return static_cast<sr_i_index_entry_t *>(p_entry->p_pending_change);
-}
-
-// Chains entries [first, last) in ascending order, the last one ending it.
-void chain_free_entries(sr_i_index_entry_t *p_first, sr_i_index_entry_t *p_last) {
-  for (sr_i_index_entry_t *p_entry = p_first; p_entry != p_last; ++p_entry) {
-    p_entry->p_pending_change = p_entry + 1 == p_last ? nullptr : p_entry + 1;
+sr_i_index_entry_t *next_free(const sr_i_table_t *p_table, sr_i_index_entry_t *p_entry) {
+  if (p_entry >= p_table->p_rows_never_used) {
+    sr_i_index_entry_t *p_end = p_table->p_rows_fixed_index + p_table->maximum_rows;
+    return p_entry + 1 < p_end ? p_entry + 1 : nullptr;
   }
+  return static_cast<sr_i_index_entry_t *>(p_entry->p_pending_change);
 }
 
 void free_change_list(sr_i_change_entry_t *p_entry) {
@@ -98,10 +97,10 @@ int32_t sr_i_establish_rows_index(sr_i_table_t *p_table, uint32_t maximum_rows) 
     std::free(p_packed);
     return sr_i_raise_no_memory();
   }
-  chain_free_entries(p_fixed, p_fixed + maximum_rows);
   p_table->p_rows_fixed_index = p_fixed;
   p_table->p_rows_packed_index = p_packed;
   p_table->p_rows_free_chain = p_fixed;
+  p_table->p_rows_never_used = p_fixed;
   p_table->maximum_rows = maximum_rows;
   return 0;
 }
@@ -132,8 +131,8 @@ int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows) {
   std::memset(static_cast<void *>(p_fixed + old_rows), 0,
               total_new_rows * sizeof(sr_i_index_entry_t));
   std::memset(p_packed + old_rows, 0, total_new_rows * sizeof(uint32_t));
-  chain_free_entries(p_fixed + old_rows, p_fixed + new_rows);
   p_table->p_rows_free_chain = p_fixed + old_rows;
+  p_table->p_rows_never_used = p_fixed + old_rows;
   p_table->maximum_rows = static_cast<uint32_t>(new_rows);
   if (reinterpret_cast<uintptr_t>(p_fixed) != old_base) {
     for (sr_i_change_entry_t *p_list :
@@ -157,7 +156,7 @@ void sr_i_rows_free_chain_insert(sr_i_table_t *p_table, sr_i_index_entry_t *p_en
   sr_i_index_entry_t *p_next = p_table->p_rows_free_chain;
   while (p_next != nullptr && p_next < p_entry) {
     p_previous = p_next;
-    p_next = next_free(p_next);
+    p_next = next_free(p_table, p_next);
   }
   p_entry->p_pending_change = p_next;
   if (p_previous == nullptr) {
@@ -170,7 +169,8 @@ void sr_i_rows_free_chain_insert(sr_i_table_t *p_table, sr_i_index_entry_t *p_en
 sr_i_index_entry_t *sr_i_rows_free_chain_remove(sr_i_table_t *p_table) {
   sr_i_index_entry_t *p_entry = p_table->p_rows_free_chain;
   if (p_entry != nullptr) {
-    p_table->p_rows_free_chain = next_free(p_entry);
+    p_table->p_rows_free_chain = next_free(p_table, p_entry);
+    p_table->p_rows_never_used = std::max(p_table->p_rows_never_used, p_entry + 1);
     p_entry->p_pending_change = nullptr;
   }
   return p_entry;

@@ -104,6 +104,11 @@ typedef struct sr_i_table_struct_t {
   char *p_persistent_table_registry_path;
   struct sr_hash_table_struct_t *p_rows_hash_table;
   sr_i_index_entry_t *p_rows_free_chain;
+  /* The lowest index entry never handed out. It and every entry above it
+   * are free, zero and chained without links, each to the next: making or
+   * growing the index does not walk the new entries to chain them, so the
+   * part of a large index no row has reached yet is never touched. */
+  sr_i_index_entry_t *p_rows_never_used;
   struct sr_i_application_metadata_struct_t *p_application_metadata;
   void *p_packed_rows_array;
   sr_i_read_write_lock_t lock;

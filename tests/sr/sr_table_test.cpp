@@ -1,8 +1,12 @@
-// The table object: the row index hands out the lowest free position, and
-// answers block containment for the file writer.
+// The table object: the row index hands out the lowest free position, also
+// as it grows and while part of it was never used, and answers block
+// containment for the file writer.
 
 #include <gtest/gtest.h>
 
+#include <cstddef>
+#include <random>
+#include <set>
 #include <vector>
 
 #include "sr_i_table.h"
@@ -50,6 +54,42 @@ TEST_F(TableObject, FreedPositionsAreReusedLowestFirst) {
   EXPECT_EQ(position_of(p_seven), 7u);
   EXPECT_EQ(p_seven->p_committed, nullptr);
   EXPECT_EQ(sr_i_rows_free_chain_remove(p_table_), nullptr);
+}
+
+// Positions given back while part of the index was never handed out, and
+// growth whenever nothing is free: every take is the lowest free position.
+TEST_F(TableObject, TakesAgreeWithASetOfFreePositionsThroughReturnsAndGrowth) {
+  ASSERT_EQ(sr_i_establish_rows_index(p_table_, 16), 0);
+  std::set<size_t> free_positions;
+  for (size_t position = 0; position < 16; ++position) {
+    free_positions.insert(position);
+  }
+  std::vector<size_t> taken;
+  std::mt19937 random(3);
+  for (int step = 0; step < 3000; ++step) {
+    if (taken.empty() || random() % 3 != 0) {
+      sr_i_index_entry_t *p_entry = sr_i_rows_free_chain_remove(p_table_);
+      if (free_positions.empty()) {
+        ASSERT_EQ(p_entry, nullptr);
+        const uint32_t old_rows = p_table_->maximum_rows;
+        ASSERT_EQ(sr_i_grow_index(p_table_, old_rows), 0);
+        for (size_t position = old_rows; position < 2 * size_t{old_rows}; ++position) {
+          free_positions.insert(position);
+        }
+        continue;
+      }
+      ASSERT_NE(p_entry, nullptr);
+      ASSERT_EQ(position_of(p_entry), *free_positions.begin()) << "step " << step;
+      free_positions.erase(free_positions.begin());
+      taken.push_back(position_of(p_entry));
+    } else {
+      const size_t at = random() % taken.size();
+      sr_i_rows_free_chain_insert(p_table_, p_table_->p_rows_fixed_index + taken[at]);
+      free_positions.insert(taken[at]);
+      taken.erase(taken.begin() + static_cast<std::ptrdiff_t>(at));
+    }
+  }
+  EXPECT_GT(p_table_->maximum_rows, 16u);
 }
 
 TEST_F(TableObject, RecordEndingOnABlockBoundaryIsNotContained) {

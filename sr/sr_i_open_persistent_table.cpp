@@ -372,11 +372,7 @@ int32_t size_table(sr_i_table_t *p_table, const committed_extent &extent) {
   if (wanted > UINT32_MAX / 2) {
     return sr_i_raise_no_memory();
   }
-  void *p_data = nullptr;
-  sr_i_record_metadata_t *p_previous = nullptr;
-  uint32_t available = 0;
-  return sr_i_rb_find_suitable_record(&p_table->record_buffer_pool, static_cast<uint32_t>(wanted),
-                                      &p_data, &p_previous, &available);
+  return sr_i_rb_make_room(&p_table->record_buffer_pool, static_cast<uint32_t>(wanted));
 }
 
 int32_t load(sr_i_table_t *p_table, bool writable) {

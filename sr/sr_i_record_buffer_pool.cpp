@@ -257,15 +257,17 @@ void set_search_start(sr_i_record_buffer_pool_t *p_pool, sr_i_record_metadata_t 
   p_pool->search_bound = bound;
 }
 
-// A zeroed block of `block_size` bytes appended to the pool, its data area
-// one free record linked into the chain. 12 (raised) when the block cannot
+// A block of `block_size` bytes appended to the pool, its data area one
+// free record linked into the chain. The block is not cleared: a record's
+// bytes are cleared when a search hands it out, so a large block a table
+// grows into slowly is touched only as far as it is used. 12 (raised) when the block cannot
 // be had or its size would not fit the pool's 32-bit count.
 int32_t add_block(sr_i_record_buffer_pool_t *p_pool, uint64_t block_size,
                   sr_i_record_metadata_t **pp_record, sr_i_record_metadata_t **pp_previous) {
   if (block_size > UINT32_MAX - p_pool->total_bytes) {
     return sr_i_raise_no_memory();
   }
-  auto *p_block = static_cast<sr_i_record_buffer_t *>(calloc(1, block_size));
+  auto *p_block = static_cast<sr_i_record_buffer_t *>(malloc(block_size));
   if (p_block == nullptr) {
     return sr_i_raise_no_memory();
   }
@@ -289,6 +291,7 @@ int32_t add_block(sr_i_record_buffer_pool_t *p_pool, uint64_t block_size,
                (p_pool->p_directory + p_pool->total_blocks - p_entry) * sizeof(directory_entry));
   *p_entry = directory_entry{p_block, nullptr, nullptr, 0};
   ++p_pool->total_blocks;
+  p_block->p_next = nullptr;
   p_block->total_bytes = static_cast<uint32_t>(block_size);
   if (p_pool->p_last_record_buffer == nullptr) {
     p_pool->p_first_record_buffer = p_block;
@@ -302,6 +305,7 @@ int32_t add_block(sr_i_record_buffer_pool_t *p_pool, uint64_t block_size,
   auto *p_record = reinterpret_cast<sr_i_record_metadata_t *>(p_block->data);
   p_record->record_length = p_block->total_bytes - Sr_Record_Buffer_Header_Length;
   p_record->type = SR_I_RECORD_FREE;
+  p_record->disk_table_offset = 0;
   // A fresh block touches no other free record, so nothing merges and the
   // count returned is only the new data area, which is not in use.
   link_free_record(p_pool, p_record, pp_previous);
@@ -344,10 +348,12 @@ int32_t sr_i_rb_uninitialize_record_buffer_pool(sr_i_record_buffer_pool_t *p_poo
   return 0;
 }
 
-int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t data_length,
-                                     void **pp_data,
-                                     sr_i_record_metadata_t **pp_previous_free_record,
-                                     uint32_t *p_actual_data_length) {
+namespace {
+
+// First fit for `data_length` bytes, adding a block when nothing fits:
+// the record and the free record before it. Clears nothing.
+int32_t find_first_fit(sr_i_record_buffer_pool_t *p_pool, uint32_t data_length,
+                       sr_i_record_metadata_t **pp_record, sr_i_record_metadata_t **pp_previous) {
   sr_i_record_metadata_t *p_previous = nullptr;
   sr_i_record_metadata_t *p_record = p_pool->p_free_chain;
   if (p_pool->search_bound != 0 && data_length >= p_pool->search_bound) {
@@ -364,11 +370,6 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
     p_record = p_record->p_next;
   }
   if (p_record != nullptr) {
-    // Beyond what a record of data_length bytes takes, the area is split
-    // off as a free record again, so its bytes need no clearing; clearing
-    // them would cost a whole block's worth for every row added to it.
-    const uint32_t taken = data_length + Sr_Smallest_Split_Remainder - 1;
-    memset(sr_i_rb_record_data(p_record), 0, std::min(data_area_length(p_record), taken));
     // Every free record before this one is shorter than data_length. A hint
     // reaching further along the chain is kept.
     if (p_pool->search_bound == 0 || (p_pool->p_search_start != nullptr &&
@@ -376,7 +377,6 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
       set_search_start(p_pool, p_record, p_previous, data_length);
     }
   } else {
-    // A new block comes zeroed from calloc.
     const uint64_t block_size =
         data_length < Large_Request_Length
             ? uint64_t{data_length} * Small_Request_Block_Factor + New_Block_Overhead
@@ -387,10 +387,37 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
     // No other free record holds data_length bytes.
     set_search_start(p_pool, p_record, p_previous, data_length);
   }
+  *pp_record = p_record;
+  *pp_previous = p_previous;
+  return 0;
+}
+
+}  // namespace
+
+int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t data_length,
+                                     void **pp_data,
+                                     sr_i_record_metadata_t **pp_previous_free_record,
+                                     uint32_t *p_actual_data_length) {
+  sr_i_record_metadata_t *p_record = nullptr;
+  if (const int32_t rc = find_first_fit(p_pool, data_length, &p_record, pp_previous_free_record);
+      rc != 0) {
+    return rc;
+  }
+  // This is the one place a record's bytes are cleared: blocks are not.
+  // Beyond what a record of data_length bytes takes, the area is split off
+  // as a free record again and needs no clearing; clearing it would cost a
+  // whole block's worth for every row added to it.
+  const uint32_t taken = data_length + Sr_Smallest_Split_Remainder - 1;
+  memset(sr_i_rb_record_data(p_record), 0, std::min(data_area_length(p_record), taken));
   *pp_data = sr_i_rb_record_data(p_record);
-  *pp_previous_free_record = p_previous;
   *p_actual_data_length = data_area_length(p_record);
   return 0;
+}
+
+int32_t sr_i_rb_make_room(sr_i_record_buffer_pool_t *p_pool, uint32_t data_length) {
+  sr_i_record_metadata_t *p_record = nullptr;
+  sr_i_record_metadata_t *p_previous = nullptr;
+  return find_first_fit(p_pool, data_length, &p_record, &p_previous);
 }
 
 int32_t sr_i_rb_allocate_record(sr_i_record_buffer_pool_t *p_pool, void *p_data,

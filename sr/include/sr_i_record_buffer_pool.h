@@ -138,6 +138,14 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
                                      uint32_t *p_actual_data_length);
 
 /*
+ * Makes sure a free record holds `data_length` bytes, adding a block when
+ * none does, and clears nothing: how a caller that is about to fill a pool
+ * sizes it in one block. Returns 0, or 12 (raised) leaving the pool as it
+ * was.
+ */
+int32_t sr_i_rb_make_room(sr_i_record_buffer_pool_t *p_pool, uint32_t data_length);
+
+/*
  * Takes the free record found by sr_i_rb_find_suitable_record for
  * `data_length` bytes of type `record_type`, splitting off what is left when
  * the remainder is big enough to be a record. Returns 0, or 15 (raised) when

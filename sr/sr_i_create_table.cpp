@@ -103,14 +103,11 @@ int32_t sr_i_create_transient_table(sr_i_tree_t *p_tree, const char *p_name, sr_
   }
   table_closer table{p_new_table};
   // One block big enough for the first hundred rows of a typical size, so
-  // that they do not each find the pool full.
+  // that they do not each find the pool full. Nothing of it is touched until
+  // rows arrive.
   const uint32_t row_estimate =
       p_new_table->total_variable_length_columns * 100 + (p_new_table->total_columns + 3) * 8;
-  void *p_data = nullptr;
-  sr_i_record_metadata_t *p_previous = nullptr;
-  uint32_t available = 0;
-  if (const int32_t rc = sr_i_rb_find_suitable_record(
-          &p_new_table->record_buffer_pool, row_estimate * 100, &p_data, &p_previous, &available);
+  if (const int32_t rc = sr_i_rb_make_room(&p_new_table->record_buffer_pool, row_estimate * 100);
       rc != 0) {
     return rc;
   }

@@ -71,15 +71,33 @@ constexpr uint32_t First_Guess_Per_Variable_Column = 32;
 }  // namespace
 
 sr_i_row_builder::sr_i_row_builder(const sr_i_table_t *p_table)
-    : p_table_(p_table),
-      fixed_length_(sr_i_row_fixed_length(p_table)),
-      bytes_(fixed_length_ +
-             First_Guess_Per_Variable_Column * p_table->total_variable_length_columns) {}
+    : p_table_(p_table), fixed_length_(sr_i_row_fixed_length(p_table)) {
+  const size_t first_guess = fixed_length_ + size_t{First_Guess_Per_Variable_Column} *
+                                                 p_table->total_variable_length_columns;
+  if (first_guess > capacity_) {
+    grow(first_guess);
+  }
+  // The header word and the slots: every one is written before the record
+  // is used, but a record never carries bytes nobody wrote.
+  std::memset(p_bytes_, 0, fixed_length_);
+}
+
+// Moves the row to a heap buffer of at least `capacity` bytes, keeping what
+// was built. Throws std::bad_alloc, which the entry point turns into 12.
+void sr_i_row_builder::grow(size_t capacity) {
+  capacity = std::max(capacity, capacity_ * 2);
+  if (p_bytes_ == inline_bytes_) {
+    heap_bytes_.assign(inline_bytes_, inline_bytes_ + capacity_);
+  }
+  heap_bytes_.resize(capacity);
+  p_bytes_ = heap_bytes_.data();
+  capacity_ = capacity;
+}
 
 void sr_i_row_builder::reserve_variable(uint32_t length) {
   const size_t needed = size_t{fixed_length_} + used_ + length;
-  if (needed > bytes_.size()) {
-    bytes_.resize(std::max(needed, bytes_.size() * 2));
+  if (needed > capacity_) {
+    grow(needed);
   }
 }
 
@@ -93,7 +111,7 @@ int32_t sr_i_row_builder::put_value(uint32_t column, const qv_value_t &value,
   const qv_value_t stored = sr_i_dup_nonscalar_value(type, value);
   qv_pmsg_value_t slot{};
   for (;;) {
-    const auto room = static_cast<uint32_t>(bytes_.size() - fixed_length_);
+    const auto room = static_cast<uint32_t>(capacity_ - fixed_length_);
     const int32_t rc = qv_pmsg_build_conv_protocol_value_1(p_conversion, 0, type, &stored, &slot,
                                                            variable_part(), room, &used_);
     if (rc == 0) {
@@ -102,14 +120,14 @@ int32_t sr_i_row_builder::put_value(uint32_t column, const qv_value_t &value,
     if (rc != QV_PMSG_RESULT_NO_ROOM) {
       return sr_i_raise_library_call("qv_pmsg_build_conv_protocol_value", rc);
     }
-    bytes_.resize(bytes_.size() * 2);
+    grow(capacity_ * 2);
   }
   put_slot(column, &slot);
   return 0;
 }
 
 void sr_i_row_builder::put_slot(uint32_t column, const void *p_slot) {
-  std::memcpy(sr_i_row_slot(bytes_.data(), column), p_slot, Sr_Row_Slot_Length);
+  std::memcpy(sr_i_row_slot(p_bytes_, column), p_slot, Sr_Row_Slot_Length);
 }
 
 void sr_i_row_builder::put_body(uint32_t column, const void *p_body, uint32_t length) {

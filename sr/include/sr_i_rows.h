@@ -118,19 +118,30 @@ class sr_i_row_builder {
   /* Copies the column's default value. */
   void copy_default(uint32_t column);
 
-  void set_header_word(uint32_t word) { sr_i_set_row_header_word(bytes_.data(), word); }
+  void set_header_word(uint32_t word) { sr_i_set_row_header_word(p_bytes_, word); }
 
   uint32_t length() const { return fixed_length_ + used_; }
-  const unsigned char *data() const { return bytes_.data(); }
+  const unsigned char *data() const { return p_bytes_; }
+
+  sr_i_row_builder(const sr_i_row_builder &) = delete;
+  sr_i_row_builder &operator=(const sr_i_row_builder &) = delete;
 
  private:
-  unsigned char *variable_part() { return bytes_.data() + fixed_length_; }
+  /* A row of ordinary size is built in the builder itself, with no
+   * allocation; a longer one moves to the heap. */
+  static constexpr size_t Inline_Bytes = 512;
+
+  unsigned char *variable_part() { return p_bytes_ + fixed_length_; }
   void reserve_variable(uint32_t length);
+  void grow(size_t capacity);
 
   const sr_i_table_t *p_table_;
   uint32_t fixed_length_;
   uint32_t used_ = 0; /* bytes of the variable part in use */
-  std::vector<unsigned char> bytes_;
+  unsigned char inline_bytes_[Inline_Bytes];
+  std::vector<unsigned char> heap_bytes_;
+  unsigned char *p_bytes_ = inline_bytes_;
+  size_t capacity_ = Inline_Bytes;
 };
 
 /*

@@ -230,9 +230,9 @@ int32_t sr_i_common_add_change_entry(sr_i_table_t *p_table, sr_i_index_entry_t *
     }
     unlink(list_for(p_table, p_change->deletion), p_change);
   } else {
-    p_change = static_cast<sr_i_change_entry_t *>(std::calloc(1, sizeof *p_change));
+    p_change = sr_i_new_change_entry(p_table);
     if (p_change == nullptr) {
-      return sr_i_raise_no_memory();
+      return SR_E_NO_MEMORY;
     }
   }
   p_change->p_index_entry = p_index_entry;
@@ -245,7 +245,7 @@ int32_t sr_i_common_add_change_entry(sr_i_table_t *p_table, sr_i_index_entry_t *
 void sr_i_remove_change_entry(sr_i_table_t *p_table, sr_i_change_entry_t *p_change) {
   unlink(list_for(p_table, p_change->deletion), p_change);
   p_change->p_index_entry->p_pending_change = nullptr;
-  std::free(p_change);
+  sr_i_free_change_entry(p_table, p_change);
 }
 
 // ---- Packed index and row states -------------------------------------------

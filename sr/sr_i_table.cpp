@@ -1,7 +1,8 @@
 // sr_i_table.cpp - the table object: making and freeing it (freeing drops
-// whatever is pending or applied and not committed), the fixed row
-// index with its free chain and growth, the change lists, block
-// containment and the data/rewrite file name switch.
+// whatever is pending or applied and not committed), the fixed row index
+// with its free chain and growth, the change lists and the blocks their
+// entries come from, block containment and the data/rewrite file name
+// switch.
 //
 // Index entries are handed out lowest position first: the free chain is
 // kept in ascending address order, linked through p_pending_change, which a
@@ -32,12 +33,22 @@ sr_i_index_entry_t *next_free(const sr_i_table_t *p_table, sr_i_index_entry_t *p
   return static_cast<sr_i_index_entry_t *>(p_entry->p_pending_change);
 }
 
-void free_change_list(sr_i_change_entry_t *p_entry) {
-  while (p_entry != nullptr) {
-    sr_i_change_entry_t *p_next = p_entry->p_next;
-    std::free(p_entry);
-    p_entry = p_next;
+// Puts a whole change list, head to tail, in front of the free entries.
+void free_change_list(sr_i_table_t *p_table, sr_i_change_entry_t *p_head,
+                      sr_i_change_entry_t *p_tail) {
+  if (p_head != nullptr) {
+    p_tail->p_next = p_table->p_free_change_entries;
+    p_table->p_free_change_entries = p_head;
   }
+}
+
+void free_change_entry_blocks(sr_i_table_t *p_table) {
+  while (sr_i_change_entry_block_t *p_block = p_table->p_change_entry_blocks) {
+    p_table->p_change_entry_blocks = p_block->p_next;
+    std::free(p_block);
+  }
+  p_table->unused_change_entries = 0;
+  p_table->p_free_change_entries = nullptr;
 }
 
 }  // namespace
@@ -70,7 +81,7 @@ void sr_i_close_table(sr_i_table_t *p_table) {
   sr_i_hash_table_close(p_table->p_rows_hash_table);
   std::free(p_table->p_rows_fixed_index);
   std::free(p_table->p_rows_packed_index);
-  sr_i_free_change_lists(p_table);
+  free_change_entry_blocks(p_table);
   std::free(p_table->p_name);
   std::free(p_table->p_file_path);
   // Closing the descriptors also ends their file locks.
@@ -177,12 +188,41 @@ sr_i_index_entry_t *sr_i_rows_free_chain_remove(sr_i_table_t *p_table) {
 }
 
 void sr_i_free_change_lists(sr_i_table_t *p_table) {
-  free_change_list(p_table->p_rows_change_list);
-  free_change_list(p_table->p_delete_rows_change_list);
+  free_change_list(p_table, p_table->p_rows_change_list, p_table->p_rows_change_list_tail);
+  free_change_list(p_table, p_table->p_delete_rows_change_list,
+                   p_table->p_delete_rows_change_list_tail);
   p_table->p_rows_change_list = nullptr;
   p_table->p_rows_change_list_tail = nullptr;
   p_table->p_delete_rows_change_list = nullptr;
   p_table->p_delete_rows_change_list_tail = nullptr;
+}
+
+sr_i_change_entry_t *sr_i_new_change_entry(sr_i_table_t *p_table) {
+  sr_i_change_entry_t *p_change = p_table->p_free_change_entries;
+  if (p_change != nullptr) {
+    p_table->p_free_change_entries = p_change->p_next;
+  } else {
+    if (p_table->unused_change_entries == 0) {
+      auto *p_block =
+          static_cast<sr_i_change_entry_block_t *>(std::malloc(sizeof(sr_i_change_entry_block_t)));
+      if (p_block == nullptr) {
+        sr_i_raise_no_memory();
+        return nullptr;
+      }
+      p_block->p_next = p_table->p_change_entry_blocks;
+      p_table->p_change_entry_blocks = p_block;
+      p_table->unused_change_entries = Sr_Change_Entries_Per_Block;
+    }
+    p_change = &p_table->p_change_entry_blocks
+                    ->entries[Sr_Change_Entries_Per_Block - p_table->unused_change_entries--];
+  }
+  *p_change = sr_i_change_entry_t{};
+  return p_change;
+}
+
+void sr_i_free_change_entry(sr_i_table_t *p_table, sr_i_change_entry_t *p_change) {
+  p_change->p_next = p_table->p_free_change_entries;
+  p_table->p_free_change_entries = p_change;
 }
 
 bool sr_i_record_contained_in_block(const sr_i_table_t *p_table, uint32_t offset, uint32_t length,

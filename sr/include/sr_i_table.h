@@ -58,6 +58,14 @@ typedef struct sr_i_change_entry_struct_t {
   struct sr_i_change_entry_struct_t *p_prev;
 } sr_i_change_entry_t;
 
+/* Change entries are carved from blocks of this many, owned by the table. */
+inline constexpr uint32_t Sr_Change_Entries_Per_Block = 128;
+
+typedef struct sr_i_change_entry_block_struct_t {
+  struct sr_i_change_entry_block_struct_t *p_next; /* the block made before */
+  sr_i_change_entry_t entries[Sr_Change_Entries_Per_Block];
+} sr_i_change_entry_block_t;
+
 typedef struct sr_i_table_struct_t {
   char *p_name; /* absolute registry path, or null for an unnamed table */
   uint32_t references;
@@ -111,6 +119,14 @@ typedef struct sr_i_table_struct_t {
   sr_i_index_entry_t *p_rows_never_used;
   struct sr_i_application_metadata_struct_t *p_application_metadata;
   void *p_packed_rows_array;
+  /* Where change entries come from: the newest block first in the chain,
+   * whose last `unused_change_entries` entries were never handed out, and
+   * the entries of finished changes, waiting for the next change. One
+   * allocation serves many changes, and ending a transaction gives its
+   * entries back in one step. */
+  sr_i_change_entry_block_t *p_change_entry_blocks;
+  uint32_t unused_change_entries;
+  sr_i_change_entry_t *p_free_change_entries; /* linked through p_next */
   sr_i_read_write_lock_t lock;
   sr_i_record_buffer_pool_t record_buffer_pool;
   struct iovec io_vector[16];
@@ -144,8 +160,16 @@ void sr_i_rows_free_chain_insert(sr_i_table_t *p_table, sr_i_index_entry_t *p_en
 /* Takes the lowest free entry, or null when none is free. */
 sr_i_index_entry_t *sr_i_rows_free_chain_remove(sr_i_table_t *p_table);
 
-/* Frees every change entry of both lists and empties them. */
+/* Gives every change entry of both lists back to the table and empties
+ * them. */
 void sr_i_free_change_lists(sr_i_table_t *p_table);
+
+/* A cleared change entry of the table's own, or null (12 raised). */
+sr_i_change_entry_t *sr_i_new_change_entry(sr_i_table_t *p_table);
+
+/* Gives one change entry, already unlinked from its list, back to the
+ * table for the next change. */
+void sr_i_free_change_entry(sr_i_table_t *p_table, sr_i_change_entry_t *p_change);
 
 /* Whether `length` bytes from `offset` lie in one file block of the
  * table's block size (a record ending on a boundary does not); the block

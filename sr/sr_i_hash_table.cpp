@@ -83,15 +83,22 @@ int32_t sr_i_hash_table_close(sr_hash_table_t *p_hash_table) {
   return 0;
 }
 
-int32_t sr_i_hash_table_bucket(const sr_hash_table_t *p_hash_table, const void *p_key_value,
-                               uint32_t *p_hash_index) {
+bool sr_i_hash_table_try_bucket(const sr_hash_table_t *p_hash_table, const void *p_key_value,
+                                uint32_t *p_hash_index) {
   uint32_t bucket = 0;
   if (p_hash_table->p_hash_function == nullptr) {
     bucket = resource_handle_at(p_key_value).id.id4 & Resource_Handle_Bucket_Mask;
   } else {
     bucket = p_hash_table->p_hash_function(p_key_value);
   }
-  if (bucket >= p_hash_table->total_hash_buckets) {
+  *p_hash_index = bucket;
+  return bucket < p_hash_table->total_hash_buckets;
+}
+
+int32_t sr_i_hash_table_bucket(const sr_hash_table_t *p_hash_table, const void *p_key_value,
+                               uint32_t *p_hash_index) {
+  uint32_t bucket = 0;
+  if (!sr_i_hash_table_try_bucket(p_hash_table, p_key_value, &bucket)) {
     return sr_i_raise_internal();
   }
   *p_hash_index = bucket;
@@ -158,6 +165,14 @@ int32_t sr_i_hash_table_add(sr_hash_table_t *p_hash_table, const void *p_key_val
   if (const int32_t rc = sr_i_hash_table_bucket(p_hash_table, p_key_value, &bucket); rc != 0) {
     return rc;
   }
+  return sr_i_hash_table_add_to_bucket(p_hash_table, bucket, p_key_value, row_index,
+                                       p_p_hash_table_element, qualifier, p_hash_index);
+}
+
+int32_t sr_i_hash_table_add_to_bucket(sr_hash_table_t *p_hash_table, uint32_t bucket,
+                                      const void *p_key_value, uint32_t row_index,
+                                      sr_hash_table_element_t **p_p_hash_table_element,
+                                      sr_qualifier_t qualifier, uint32_t *p_hash_index) {
   if ((qualifier & 15) == SR_PRIMARY_KEY) {
     if (sr_hash_table_element_t **p_link = find_link_to_key(p_hash_table, bucket, p_key_value)) {
       *p_hash_index = bucket;

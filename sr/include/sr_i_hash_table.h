@@ -77,6 +77,11 @@ int32_t sr_i_hash_table_open_for_client(uint32_t total_hash_buckets,
 int32_t sr_i_hash_table_bucket(const sr_hash_table_t *p_hash_table, const void *p_key_value,
                                uint32_t *p_hash_index);
 
+/* The same without raising: false when the hash function's bucket is not
+ * one of the table's. For a caller that only wants a hint. */
+bool sr_i_hash_table_try_bucket(const sr_hash_table_t *p_hash_table, const void *p_key_value,
+                                uint32_t *p_hash_index);
+
 /*
  * Adds an element for the key at `p_key_value` (kept, not copied) and row
  * `row_index` at the head of its bucket, and returns the bucket and the
@@ -95,6 +100,13 @@ int32_t sr_i_hash_table_add(sr_hash_table_t *p_hash_table, const void *p_key_val
                             uint32_t row_index, uint32_t *p_hash_index,
                             sr_hash_table_element_t **p_p_hash_table_element,
                             sr_qualifier_t qualifier);
+
+/* sr_i_hash_table_add for a caller that has already hashed the key: `bucket`
+ * must be what sr_i_hash_table_bucket gives for it. */
+int32_t sr_i_hash_table_add_to_bucket(sr_hash_table_t *p_hash_table, uint32_t bucket,
+                                      const void *p_key_value, uint32_t row_index,
+                                      sr_hash_table_element_t **p_p_hash_table_element,
+                                      sr_qualifier_t qualifier, uint32_t *p_hash_index);
 
 /*
  * Finds the most recently added element whose key equals the key at

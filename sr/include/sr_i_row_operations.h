@@ -30,12 +30,14 @@ int32_t sr_i_add_row(sr_i_table_t *p_table, const char *const *p_column_names,
  * of the applied view holds under SR_PRIMARY_KEY. With a hash table, a key
  * whose row is deleted in the applied view revives that row: the record
  * becomes its applied record and `*pp_existing_hash_table_element` is set
- * (else null). Returns 0, 108 (raised), 12 (raised).
+ * (else null). `p_known_bucket`, when not null, is the key's bucket as the
+ * caller already computed it. Returns 0, 108 (raised), 12 (raised).
  */
 int32_t sr_i_add_row_raw(sr_i_table_t *p_table, void *p_record_data,
                          const qv_value_t *p_input_key_value,
                          sr_i_index_entry_t **pp_new_index_entry,
-                         sr_hash_table_element_t **pp_existing_hash_table_element);
+                         sr_hash_table_element_t **pp_existing_hash_table_element,
+                         const uint32_t *p_known_bucket);
 
 /* ---- Reading (sr_i_get_values.cpp) -------------------------------------- */
 

@@ -6,6 +6,7 @@
 
 #include <clocale>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <string>
 #include <thread>
@@ -68,6 +69,16 @@ TEST(Trees, ManyThreadsOpenAndCloseTreesAtOnce) {
   EXPECT_EQ(failures, 0);
 }
 
+// Every key a hash function was given, and a comparison for string keys.
+std::vector<std::string> Hashed_Keys;
+uint32_t remember_key(const void *p_key) {
+  Hashed_Keys.emplace_back(static_cast<const char *>(p_key));
+  return 0;
+}
+int32_t compare_strings(const void *p_stored_key, const void *p_key) {
+  return std::strcmp(static_cast<const char *>(p_stored_key), static_cast<const char *>(p_key));
+}
+
 // Converts with one of a tree's handles.
 std::string convert(cu_iconv_t *p_handle, const std::string &text) {
   char *p_out = nullptr;
@@ -105,6 +116,23 @@ TEST(TreeConversion, Latin1LocaleIsConvertedAndKeptForTheLifeOfTheTree) {
   auto *p_tree = static_cast<sr_i_tree_t *>(handle);
   EXPECT_EQ(convert(p_tree->p_to_table_string_conversion_handle, "caf\xe9"), "caf\xc3\xa9");
   EXPECT_EQ(convert(p_tree->p_from_table_string_conversion_handle, "caf\xc3\xa9"), "caf\xe9");
+
+  // A row's key is hashed as it is stored, converted, not as the caller
+  // passed it: the hash table finds keys by their stored bytes.
+  sr_column_t columns[1] = {};
+  columns[0].name = const_cast<char *>("key");
+  columns[0].type = QV_CHAR_PTR;
+  columns[0].qualifier = SR_PRIMARY_KEY;
+  sr_opaque_handle_t table = nullptr;
+  ASSERT_EQ(sr_create_hashed_key_table_1(handle, "/latin1", columns, 1, 2, 4, remember_key,
+                                         compare_strings, &table),
+            0);
+  qv_value_t key{};
+  key.ptr_char = const_cast<char *>("caf\xe9");
+  qv_value_t *const values[1] = {&key};
+  const char *names[1] = {"key"};
+  ASSERT_EQ(sr_add_row_1(table, names, values, 1), 0);
+  EXPECT_EQ(Hashed_Keys, std::vector<std::string>{"caf\xc3\xa9"});
   EXPECT_EQ(sr_close_tree_1(handle), 0);
 }
 

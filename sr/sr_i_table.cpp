@@ -33,15 +33,6 @@ sr_i_index_entry_t *next_free(const sr_i_table_t *p_table, sr_i_index_entry_t *p
   return static_cast<sr_i_index_entry_t *>(p_entry->p_pending_change);
 }
 
-// Puts a whole change list, head to tail, in front of the free entries.
-void free_change_list(sr_i_table_t *p_table, sr_i_change_entry_t *p_head,
-                      sr_i_change_entry_t *p_tail) {
-  if (p_head != nullptr) {
-    p_tail->p_next = p_table->p_free_change_entries;
-    p_table->p_free_change_entries = p_head;
-  }
-}
-
 void free_change_entry_blocks(sr_i_table_t *p_table) {
   while (sr_i_change_entry_block_t *p_block = p_table->p_change_entry_blocks) {
     p_table->p_change_entry_blocks = p_block->p_next;
@@ -81,7 +72,7 @@ void sr_i_close_table(sr_i_table_t *p_table) {
   sr_i_hash_table_close(p_table->p_rows_hash_table);
   std::free(p_table->p_rows_fixed_index);
   std::free(p_table->p_rows_packed_index);
-  free_change_entry_blocks(p_table);
+  sr_i_free_change_lists(p_table);
   std::free(p_table->p_name);
   std::free(p_table->p_file_path);
   // Closing the descriptors also ends their file locks.
@@ -187,10 +178,11 @@ sr_i_index_entry_t *sr_i_rows_free_chain_remove(sr_i_table_t *p_table) {
   return p_entry;
 }
 
+// Every change entry is on one of the two lists or free, so once both lists
+// are let go no entry is in use and the blocks go back to the heap: a table
+// does not keep the memory of its largest transaction.
 void sr_i_free_change_lists(sr_i_table_t *p_table) {
-  free_change_list(p_table, p_table->p_rows_change_list, p_table->p_rows_change_list_tail);
-  free_change_list(p_table, p_table->p_delete_rows_change_list,
-                   p_table->p_delete_rows_change_list_tail);
+  free_change_entry_blocks(p_table);
   p_table->p_rows_change_list = nullptr;
   p_table->p_rows_change_list_tail = nullptr;
   p_table->p_delete_rows_change_list = nullptr;

@@ -121,9 +121,9 @@ typedef struct sr_i_table_struct_t {
   void *p_packed_rows_array;
   /* Where change entries come from: the newest block first in the chain,
    * whose last `unused_change_entries` entries were never handed out, and
-   * the entries of finished changes, waiting for the next change. One
-   * allocation serves many changes, and ending a transaction gives its
-   * entries back in one step. */
+   * entries given back during the transaction, waiting for the next change.
+   * One allocation serves many changes, and ending the transaction frees
+   * the blocks in one step. */
   sr_i_change_entry_block_t *p_change_entry_blocks;
   uint32_t unused_change_entries;
   sr_i_change_entry_t *p_free_change_entries; /* linked through p_next */
@@ -160,8 +160,8 @@ void sr_i_rows_free_chain_insert(sr_i_table_t *p_table, sr_i_index_entry_t *p_en
 /* Takes the lowest free entry, or null when none is free. */
 sr_i_index_entry_t *sr_i_rows_free_chain_remove(sr_i_table_t *p_table);
 
-/* Gives every change entry of both lists back to the table and empties
- * them. */
+/* Frees every change entry, of both lists and given back, and empties the
+ * lists. */
 void sr_i_free_change_lists(sr_i_table_t *p_table);
 
 /* A cleared change entry of the table's own, or null (12 raised). */

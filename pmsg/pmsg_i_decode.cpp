@@ -319,8 +319,22 @@ int32_t pmsg_i_decode_value(cu_iconv_t *p_conversion, int32_t type, const unsign
   if (p_conversion != nullptr && cu_iconv_is_unchanged_1(p_conversion)) {
     p_conversion = nullptr;
   }
-  decoder state{p_conversion, {}};
   const unsigned char *p_body = p_area + offset;
+  // The commonest value, a string that passes as it is, is checked and
+  // copied in one step, without the walk that nested values need.
+  if (kind == pmsg_i_kind::string && p_conversion == nullptr) {
+    if (!pmsg_i_string_body_ok(p_body, length)) {
+      return QV_PMSG_RESULT_MALFORMED;
+    }
+    auto *p_copy = static_cast<char *>(std::malloc(static_cast<size_t>(round_up(length))));
+    if (p_copy == nullptr) {
+      return QV_PMSG_RESULT_NO_MEMORY;
+    }
+    std::memcpy(p_copy, p_body, length);
+    p_value->ptr_char = p_copy;
+    return QV_PMSG_RESULT_OK;
+  }
+  decoder state{p_conversion, {}};
   uint64_t size = 0;
   int32_t result = measure_body(state, type, p_body, length, 0, &size);
   if (result != QV_PMSG_RESULT_OK) {

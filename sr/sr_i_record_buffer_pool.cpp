@@ -257,11 +257,37 @@ void set_search_start(sr_i_record_buffer_pool_t *p_pool, sr_i_record_metadata_t 
   p_pool->search_bound = bound;
 }
 
+// Enters a new block in the directory at its place by address, with no
+// free record yet. 12 (raised) when the directory cannot grow; the pool is
+// then unchanged.
+int32_t enter_in_directory(sr_i_record_buffer_pool_t *p_pool, sr_i_record_buffer_t *p_block) {
+  if (p_pool->total_blocks == p_pool->directory_capacity) {
+    const uint32_t capacity = std::max(First_Directory_Capacity, p_pool->directory_capacity * 2);
+    auto *p_directory = static_cast<directory_entry *>(
+        realloc(p_pool->p_directory, capacity * sizeof(directory_entry)));
+    if (p_directory == nullptr) {
+      return sr_i_raise_no_memory();
+    }
+    p_pool->p_directory = p_directory;
+    p_pool->directory_capacity = capacity;
+  }
+  directory_entry *p_end = p_pool->p_directory + p_pool->total_blocks;
+  directory_entry *p_entry = std::upper_bound(p_pool->p_directory, p_end, address_of(p_block),
+                                              [](uintptr_t address, const directory_entry &entry) {
+                                                return address < address_of(entry.p_block);
+                                              });
+  std::memmove(p_entry + 1, p_entry, (p_end - p_entry) * sizeof(directory_entry));
+  *p_entry = directory_entry{p_block, nullptr, nullptr, 0};
+  ++p_pool->total_blocks;
+  return 0;
+}
+
 // A block of `block_size` bytes appended to the pool, its data area one
 // free record linked into the chain. The block is not cleared: a record's
-// bytes are cleared when a search hands it out, so a large block a table
-// grows into slowly is touched only as far as it is used. 12 (raised) when the block cannot
-// be had or its size would not fit the pool's 32-bit count.
+// bytes are cleared when a search hands it out, so a large block that a
+// table grows into slowly is touched only as far as it is used. 12 (raised)
+// when the block cannot be had or its size would not fit the pool's 32-bit
+// count.
 int32_t add_block(sr_i_record_buffer_pool_t *p_pool, uint64_t block_size,
                   sr_i_record_metadata_t **pp_record, sr_i_record_metadata_t **pp_previous) {
   if (block_size > UINT32_MAX - p_pool->total_bytes) {
@@ -271,26 +297,10 @@ int32_t add_block(sr_i_record_buffer_pool_t *p_pool, uint64_t block_size,
   if (p_block == nullptr) {
     return sr_i_raise_no_memory();
   }
-  if (p_pool->total_blocks == p_pool->directory_capacity) {
-    const uint32_t capacity = std::max(First_Directory_Capacity, p_pool->directory_capacity * 2);
-    auto *p_directory = static_cast<directory_entry *>(
-        realloc(p_pool->p_directory, capacity * sizeof(directory_entry)));
-    if (p_directory == nullptr) {
-      free(p_block);
-      return sr_i_raise_no_memory();
-    }
-    p_pool->p_directory = p_directory;
-    p_pool->directory_capacity = capacity;
+  if (const int32_t rc = enter_in_directory(p_pool, p_block); rc != 0) {
+    free(p_block);
+    return rc;
   }
-  directory_entry *p_entry =
-      std::upper_bound(p_pool->p_directory, p_pool->p_directory + p_pool->total_blocks,
-                       address_of(p_block), [](uintptr_t address, const directory_entry &entry) {
-                         return address < address_of(entry.p_block);
-                       });
-  std::memmove(p_entry + 1, p_entry,
-               (p_pool->p_directory + p_pool->total_blocks - p_entry) * sizeof(directory_entry));
-  *p_entry = directory_entry{p_block, nullptr, nullptr, 0};
-  ++p_pool->total_blocks;
   p_block->p_next = nullptr;
   p_block->total_bytes = static_cast<uint32_t>(block_size);
   if (p_pool->p_last_record_buffer == nullptr) {
@@ -458,16 +468,21 @@ int32_t sr_i_rb_allocate_record(sr_i_record_buffer_pool_t *p_pool, void *p_data,
     p_pool->used_bytes += data_length + Sr_Record_Header_Length;
   }
   replace_in_chain(p_successor);
+  // The block's lowest or highest free record may have been this one: a
+  // split leaves its rest in its place; a record taken whole hands the role
+  // to its neighbour in the chain, when that lies in the same block.
   directory_entry &entry = entry_of(p_pool, p_record);
   if (entry.p_first_free == p_record) {
     entry.p_first_free = in_block(entry.p_block, p_successor) ? p_successor : nullptr;
   }
   if (entry.p_last_free == p_record) {
-    entry.p_last_free =
-        !taken_whole ? p_successor
-        : p_previous_free_record != nullptr && in_block(entry.p_block, p_previous_free_record)
-            ? p_previous_free_record
-            : nullptr;
+    if (!taken_whole) {
+      entry.p_last_free = p_successor;
+    } else if (in_block(entry.p_block, p_previous_free_record)) {
+      entry.p_last_free = p_previous_free_record;
+    } else {
+      entry.p_last_free = nullptr;
+    }
   }
   // Records only shrink or leave here, so the hint's bound stays true; its
   // start and the start's neighbour may have to follow the change.

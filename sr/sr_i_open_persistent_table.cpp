@@ -27,6 +27,7 @@
 #include "sr_i_errors.h"
 #include "sr_i_file_system.h"
 #include "sr_i_files.h"
+#include "sr_i_prefault.h"
 #include "sr_i_rows.h"
 #include "sr_i_table_file.h"
 #include "sr_i_tree.h"
@@ -131,6 +132,7 @@ int32_t read_whole_file(int fd, file_image &image) {
     } catch (const std::bad_alloc &) {
       return sr_i_raise_no_memory();
     }
+    sr_i_prefault(image.buffer.get(), capacity);
     uint32_t read = 0;
     if (const int32_t rc = sr_i_read(fd, image.buffer.get(), capacity, &read); rc != 0) {
       return rc;
@@ -355,7 +357,8 @@ class replay {
 };
 
 // The table's row index and pool, sized from the file so that its rows and
-// about a hundred more fit without growing.
+// about a hundred more fit without growing. The parts the load fills, the
+// image's room and an index entry per row record, are mapped in advance.
 int32_t size_table(sr_i_table_t *p_table, const committed_extent &extent) {
   const uint32_t per_row = p_table->total_columns * 8 + 20;
   uint32_t maximum_rows = extent.memory_length / per_row;
@@ -365,6 +368,8 @@ int32_t size_table(sr_i_table_t *p_table, const committed_extent &extent) {
   if (const int32_t rc = sr_i_establish_rows_index(p_table, maximum_rows); rc != 0) {
     return rc;
   }
+  sr_i_prefault(p_table->p_rows_fixed_index,
+                size_t{std::min(extent.row_records, maximum_rows)} * sizeof(sr_i_index_entry_t));
   const uint64_t growth =
       uint64_t{p_table->total_variable_length_columns * 100u + (p_table->total_columns + 3) * 8u} *
       100u;
@@ -372,7 +377,14 @@ int32_t size_table(sr_i_table_t *p_table, const committed_extent &extent) {
   if (wanted > UINT32_MAX / 2) {
     return sr_i_raise_no_memory();
   }
-  return sr_i_rb_make_room(&p_table->record_buffer_pool, static_cast<uint32_t>(wanted));
+  void *p_room = nullptr;
+  if (const int32_t rc =
+          sr_i_rb_make_room(&p_table->record_buffer_pool, static_cast<uint32_t>(wanted), &p_room);
+      rc != 0) {
+    return rc;
+  }
+  sr_i_prefault(p_room, extent.memory_length);
+  return 0;
 }
 
 int32_t load(sr_i_table_t *p_table, bool writable) {

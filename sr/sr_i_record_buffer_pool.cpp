@@ -424,10 +424,16 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
   return 0;
 }
 
-int32_t sr_i_rb_make_room(sr_i_record_buffer_pool_t *p_pool, uint32_t data_length) {
+int32_t sr_i_rb_make_room(sr_i_record_buffer_pool_t *p_pool, uint32_t data_length, void **pp_room) {
   sr_i_record_metadata_t *p_record = nullptr;
   sr_i_record_metadata_t *p_previous = nullptr;
-  return find_first_fit(p_pool, data_length, &p_record, &p_previous);
+  if (const int32_t rc = find_first_fit(p_pool, data_length, &p_record, &p_previous); rc != 0) {
+    return rc;
+  }
+  if (pp_room != nullptr) {
+    *pp_room = sr_i_rb_record_data(p_record);
+  }
+  return 0;
 }
 
 int32_t sr_i_rb_allocate_record(sr_i_record_buffer_pool_t *p_pool, void *p_data,

@@ -140,10 +140,12 @@ int32_t sr_i_rb_find_suitable_record(sr_i_record_buffer_pool_t *p_pool, uint32_t
 /*
  * Makes sure a free record holds `data_length` bytes, adding a block when
  * none does, and clears nothing: how a caller that is about to fill a pool
- * sizes it in one block. Returns 0, or 12 (raised) leaving the pool as it
- * was.
+ * sizes it in one block. `pp_room`, when not null, receives where that free
+ * record's data area begins. Returns 0, or 12 (raised) leaving the pool as
+ * it was.
  */
-int32_t sr_i_rb_make_room(sr_i_record_buffer_pool_t *p_pool, uint32_t data_length);
+int32_t sr_i_rb_make_room(sr_i_record_buffer_pool_t *p_pool, uint32_t data_length,
+                          void **pp_room = nullptr);
 
 /*
  * Takes the free record found by sr_i_rb_find_suitable_record for

@@ -4,10 +4,14 @@
 // free neighbours, the free chain, the directory of blocks, both byte
 // counts) against a model of the live records and their contents, and that
 // every request gets exactly the record first fit chooses, also when the
-// heap hands out blocks at falling addresses.
+// heap hands out blocks at falling addresses. Prefaulting a large buffer
+// before it is filled, a memory hint of its own, is checked here too.
 
 #include <gtest/gtest.h>
+#include <sys/mman.h>
 #include <unistd.h>
+
+#include <cerrno>
 
 #include <algorithm>
 #include <cstring>
@@ -18,6 +22,7 @@
 #include <vector>
 
 #include "qv_sr.h"
+#include "sr_i_prefault.h"
 #include "sr_i_record_buffer_pool.h"
 #include "sr_row_test_support.h"
 
@@ -208,6 +213,65 @@ TEST(RecordBufferPool, FirstRequestCountsBytesExactly) {
     EXPECT_EQ(pool.total_bytes + pool.used_bytes, 0u);
     EXPECT_EQ(pool.p_first_record_buffer, nullptr);
   }
+}
+
+// Making room finds, without taking, the record the next request of that
+// size gets: in the existing block when it fits there, else in a new one.
+TEST(RecordBufferPool, MakingRoomNamesTheRecordTheNextRequestGets) {
+  for (const uint32_t length : {100u, 200000u}) {
+    sr_i_record_buffer_pool_t pool{};
+    ASSERT_EQ(sr_i_rb_initialize_record_buffer_pool(1, &pool), 0);
+    const uint32_t blocks_before = pool.total_blocks;
+    void *p_room = nullptr;
+    ASSERT_EQ(sr_i_rb_make_room(&pool, length, &p_room), 0);
+    EXPECT_EQ(pool.total_blocks, blocks_before + (length > 1000 ? 1 : 0)) << length;
+    void *p_data = nullptr;
+    ASSERT_EQ(sr_i_reserve_record(&pool, length, SR_I_RECORD_ROW, &p_data), 0);
+    EXPECT_EQ(p_data, p_room) << length;
+    fill(p_data, {length, 3});
+    check_pool(pool, {{p_data, {length, 3}}});
+    sr_i_rb_uninitialize_record_buffer_pool(&pool);
+  }
+}
+
+// Prefaulting maps pages and changes no byte, neither inside the range nor
+// in the partial pages at its ends, which may belong to other blocks.
+TEST(Prefault, MapsEveryWholePageAndKeepsEveryByte) {
+  const size_t page = page_size(), pages = 512;
+  void *p_region =
+      mmap(nullptr, pages * page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+  ASSERT_NE(p_region, MAP_FAILED);
+  auto *p_bytes = static_cast<unsigned char *>(p_region);
+  // Written: the first page and the last; never touched: all between.
+  std::memset(p_bytes, 0xA5, page);
+  std::memset(p_bytes + (pages - 1) * page, 0x5A, page);
+
+  const int rc = sr_i_prefault(p_bytes + page / 2, (pages - 1) * page);
+  if (rc == EINVAL) {
+    munmap(p_region, pages * page);
+    GTEST_SKIP() << "this kernel cannot populate pages on request";
+  }
+  ASSERT_EQ(rc, 0);
+  std::vector<unsigned char> resident(pages);
+  ASSERT_EQ(mincore(p_region, pages * page, resident.data()), 0);
+  for (size_t at = 0; at < pages; ++at) {
+    EXPECT_EQ(resident[at] & 1, 1) << "page " << at;
+  }
+  EXPECT_EQ(std::count(p_bytes, p_bytes + page, 0xA5), static_cast<std::ptrdiff_t>(page));
+  EXPECT_EQ(std::count(p_bytes + page, p_bytes + (pages - 1) * page, 0),
+            static_cast<std::ptrdiff_t>((pages - 2) * page));
+  EXPECT_EQ(std::count(p_bytes + (pages - 1) * page, p_bytes + pages * page, 0x5A),
+            static_cast<std::ptrdiff_t>(page));
+
+  // A buffer below the threshold is left to fault page by page.
+  void *p_small = mmap(nullptr, Sr_Prefault_Minimum_Length - page, PROT_READ | PROT_WRITE,
+                       MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+  ASSERT_NE(p_small, MAP_FAILED);
+  EXPECT_EQ(sr_i_prefault(p_small, Sr_Prefault_Minimum_Length - page), 0);
+  ASSERT_EQ(mincore(p_small, page, resident.data()), 0);
+  EXPECT_EQ(resident[0] & 1, 0);
+  munmap(p_small, Sr_Prefault_Minimum_Length - page);
+  munmap(p_region, pages * page);
 }
 
 TEST(RecordBufferPool, RaisesAndLeavesThePoolAsItWas) {

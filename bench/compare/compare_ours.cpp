@@ -171,11 +171,12 @@ void read_by_key(benchmark::State &state) {
     return;
   }
   const std::vector<std::string> keys = lookup_keys(rows);
-  uint64_t n = 0;
+  size_t next = 0;
   for (auto _ : state) {
     read_row row;
     qv_value_t key{};
-    key.ptr_char = const_cast<char *>(keys[n++ % rows].c_str());
+    key.ptr_char = const_cast<char *>(keys[next].c_str());
+    next = next + 1 == keys.size() ? 0 : next + 1;
     const int32_t rc = sr_get_fields_by_key_1(table, key, Column_Names.data(), row.results().data(),
                                               Total_Columns);
     if (!check(state, rc == 0, "sr_get_fields_by_key_1")) {

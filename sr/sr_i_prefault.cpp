@@ -6,7 +6,7 @@
 // table fills the file buffer, the image of its records and the used part
 // of its row index, each known in size beforehand. MADV_POPULATE_WRITE maps
 // all their pages in one call, as if each had been written, without
-// touching what they hold.
+// touching what they hold. A block the heap reused is left alone.
 
 #include "sr_i_prefault.h"
 
@@ -15,6 +15,16 @@
 
 #include <cerrno>
 #include <cstdint>
+
+namespace {
+
+bool is_mapped(uintptr_t page, uintptr_t page_size) {
+  unsigned char residence = 0;
+  return mincore(reinterpret_cast<void *>(page), page_size, &residence) == 0 &&
+         (residence & 1) != 0;
+}
+
+}  // namespace
 
 int sr_i_prefault(void *p_memory, size_t length) {
   if (p_memory == nullptr || length < Sr_Prefault_Minimum_Length) {
@@ -27,6 +37,12 @@ int sr_i_prefault(void *p_memory, size_t length) {
   const uintptr_t first_page = (start + page_size - 1) & ~(page_size - 1);
   const uintptr_t end_page = (start + length) & ~(page_size - 1);
   if (end_page <= first_page) {
+    return 0;
+  }
+  // A block whose first and last pages are both mapped is memory the heap
+  // has handed out before and is mapped throughout; asking for it again
+  // would walk every page for nothing, at a tenth of what faulting it costs.
+  if (is_mapped(first_page, page_size) && is_mapped(end_page - page_size, page_size)) {
     return 0;
   }
   if (madvise(reinterpret_cast<void *>(first_page), end_page - first_page, MADV_POPULATE_WRITE) !=

@@ -13,8 +13,10 @@ inline constexpr size_t Sr_Prefault_Minimum_Length = size_t{1} << 20;
 
 /*
  * Maps the whole pages inside [p_memory, p_memory + length) of a heap block
- * the caller owns, writable, without changing a byte of them. Only a hint:
- * returns 0 when the kernel did it or the buffer is too short to bother,
+ * the caller owns, writable, without changing a byte of them, unless the
+ * first and last of those pages are mapped already. Only a hint: returns 0
+ * when the kernel did it, the pages were mapped or the buffer is too short
+ * to bother,
  * otherwise the errno of madvise (EINVAL on kernels before 5.14), which
  * callers may ignore.
  */

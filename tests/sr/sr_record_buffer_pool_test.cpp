@@ -235,7 +235,8 @@ TEST(RecordBufferPool, MakingRoomNamesTheRecordTheNextRequestGets) {
 }
 
 // Prefaulting maps pages and changes no byte, neither inside the range nor
-// in the partial pages at its ends, which may belong to other blocks.
+// in the partial pages at its ends, which may belong to other blocks; a
+// block already mapped at both ends is left as it is.
 TEST(Prefault, MapsEveryWholePageAndKeepsEveryByte) {
   const size_t page = page_size(), pages = 512;
   void *p_region =
@@ -262,6 +263,17 @@ TEST(Prefault, MapsEveryWholePageAndKeepsEveryByte) {
             static_cast<std::ptrdiff_t>((pages - 2) * page));
   EXPECT_EQ(std::count(p_bytes + (pages - 1) * page, p_bytes + pages * page, 0x5A),
             static_cast<std::ptrdiff_t>(page));
+
+  // A block mapped at both ends is taken as reused memory, mapped
+  // throughout, and not walked again.
+  EXPECT_EQ(madvise(p_bytes + 200 * page, 300 * page, MADV_DONTNEED), 0);
+  std::memset(p_bytes + 200 * page, 1, page);
+  std::memset(p_bytes + 499 * page, 1, page);
+  EXPECT_EQ(sr_i_prefault(p_bytes + 200 * page, 300 * page), 0);
+  ASSERT_EQ(mincore(p_bytes + 200 * page, 300 * page, resident.data()), 0);
+  EXPECT_EQ(resident[0] & 1, 1);
+  EXPECT_EQ(resident[150] & 1, 0);
+  EXPECT_EQ(resident[299] & 1, 1);
 
   // A buffer below the threshold is left to fault page by page.
   void *p_small = mmap(nullptr, Sr_Prefault_Minimum_Length - page, PROT_READ | PROT_WRITE,

@@ -32,7 +32,11 @@ int sr_i_prefault(void *p_memory, size_t length) {
   }
   // madvise takes whole pages; the partial pages at either end belong in
   // part to other heap blocks and are left alone.
-  const auto page_size = static_cast<uintptr_t>(sysconf(_SC_PAGESIZE));
+  const long system_page_size = sysconf(_SC_PAGESIZE);
+  if (system_page_size <= 0) {
+    return 0;
+  }
+  const auto page_size = static_cast<uintptr_t>(system_page_size);
   const auto start = reinterpret_cast<uintptr_t>(p_memory);
   const uintptr_t first_page = (start + page_size - 1) & ~(page_size - 1);
   const uintptr_t end_page = (start + length) & ~(page_size - 1);

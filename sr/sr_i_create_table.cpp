@@ -10,7 +10,6 @@
 #include <cstring>
 #include <vector>
 
-#include "sr_i_application_metadata.h"
 #include "sr_i_columns.h"
 #include "sr_i_create_table.h"
 #include "sr_i_errors.h"
@@ -74,16 +73,7 @@ int32_t create_transient_table_common(sr_i_tree_t *p_tree, const char *p_name,
       rc != 0) {
     return rc;
   }
-  if (p_new_table->p_rows_hash_table == nullptr && columns[0].type == QV_RSRC_HANDLE_PTR) {
-    if (const int32_t rc =
-            sr_i_hash_table_open(0, nullptr, nullptr, &p_new_table->p_rows_hash_table);
-        rc != 0) {
-      return rc;
-    }
-  }
-  if (const int32_t rc =
-          sr_i_allocate_application_metadata_buffer(1, &p_new_table->p_application_metadata);
-      rc != 0) {
+  if (const int32_t rc = sr_i_open_key_hash_and_metadata(p_new_table); rc != 0) {
     return rc;
   }
   *pp_table = table.release();

@@ -414,15 +414,7 @@ int32_t load(sr_i_table_t *p_table, bool writable) {
   if (const int32_t rc = size_table(p_table, extent); rc != 0) {
     return rc;
   }
-  if (p_table->p_rows_hash_table == nullptr && p_table->p_columns[0].type == QV_RSRC_HANDLE_PTR) {
-    if (const int32_t rc = sr_i_hash_table_open(0, nullptr, nullptr, &p_table->p_rows_hash_table);
-        rc != 0) {
-      return rc;
-    }
-  }
-  if (const int32_t rc =
-          sr_i_allocate_application_metadata_buffer(1, &p_table->p_application_metadata);
-      rc != 0) {
+  if (const int32_t rc = sr_i_open_key_hash_and_metadata(p_table); rc != 0) {
     return rc;
   }
   if (const int32_t rc = replay(p_table, bytes).run(metadata_length, extent.row_records); rc != 0) {

@@ -1,5 +1,6 @@
 // sr_i_table.cpp - the table object: making and freeing it (freeing drops
-// whatever is pending or applied and not committed), the fixed row index
+// whatever is pending or applied and not committed), the key hash table and
+// application metadata container it gets with its columns, the fixed row index
 // with its free chain and growth, the change lists and the blocks their
 // entries come from, block containment and the data/rewrite file name
 // switch.
@@ -150,6 +151,16 @@ int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows) {
   }
   p_table->p_rows_fixed_index = p_fixed;
   return 0;
+}
+
+int32_t sr_i_open_key_hash_and_metadata(sr_i_table_t *p_table) {
+  if (p_table->p_rows_hash_table == nullptr && p_table->p_columns[0].type == QV_RSRC_HANDLE_PTR) {
+    if (const int32_t rc = sr_i_hash_table_open(0, nullptr, nullptr, &p_table->p_rows_hash_table);
+        rc != 0) {
+      return rc;
+    }
+  }
+  return sr_i_allocate_application_metadata_buffer(1, &p_table->p_application_metadata);
 }
 
 void sr_i_rows_free_chain_insert(sr_i_table_t *p_table, sr_i_index_entry_t *p_entry) {

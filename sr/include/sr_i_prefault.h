@@ -16,9 +16,8 @@ inline constexpr size_t Sr_Prefault_Minimum_Length = size_t{1} << 20;
  * the caller owns, writable, without changing a byte of them, unless the
  * first and last of those pages are mapped already. Only a hint: returns 0
  * when the kernel did it, the pages were mapped or the buffer is too short
- * to bother,
- * otherwise the errno of madvise (EINVAL on kernels before 5.14), which
- * callers may ignore.
+ * to bother, otherwise the errno of madvise (EINVAL on kernels before
+ * 5.14), which callers may ignore.
  */
 int sr_i_prefault(void *p_memory, size_t length);
 

@@ -154,6 +154,12 @@ int32_t sr_i_establish_rows_index(sr_i_table_t *p_table, uint32_t maximum_rows);
  * after a failure the table must only be freed. */
 int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows);
 
+/* What a table gets once its columns are known, whether created or loaded:
+ * the built-in key hash table when the key is a resource handle and the
+ * caller brought no hash table, and the application metadata container.
+ * 12 (raised) when either cannot be had. */
+int32_t sr_i_open_key_hash_and_metadata(sr_i_table_t *p_table);
+
 /* Clears an entry and gives it back; the chain stays in address order. */
 void sr_i_rows_free_chain_insert(sr_i_table_t *p_table, sr_i_index_entry_t *p_entry);
 

@@ -11,9 +11,8 @@
 #include <sys/mman.h>
 #include <unistd.h>
 
-#include <cerrno>
-
 #include <algorithm>
+#include <cerrno>
 #include <cstring>
 #include <functional>
 #include <map>

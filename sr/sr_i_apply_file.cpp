@@ -67,18 +67,27 @@ class record_writer {
   uint32_t written_ = 0;
 };
 
-// Adds the commit record at file offset `offset`, behind the dead record
-// that keeps its type word inside one disk sector when it needs one; the
-// offset moves to the commit record's start.
-int32_t add_commit_record(record_writer &writer, uint32_t &offset,
-                          const std::vector<unsigned char> &commit_record) {
+// Ends a write of records to `fd`: adds the commit record at file offset
+// `offset`, behind the dead record that keeps its type word inside one disk
+// sector when it needs one (the offset moves to the commit record's start),
+// writes what the writer still holds and flushes the file.
+int32_t finish_with_commit_record(record_writer &writer, uint32_t &offset,
+                                  const std::vector<unsigned char> &commit_record, int fd) {
   if (const uint32_t padding = sr_i_commit_record_padding(offset); padding != 0) {
     if (const int32_t rc = writer.add(Sr_Commit_Record_Padding, padding); rc != 0) {
       return rc;
     }
     offset += padding;
   }
-  return writer.add(commit_record.data(), static_cast<uint32_t>(commit_record.size()));
+  if (const int32_t rc =
+          writer.add(commit_record.data(), static_cast<uint32_t>(commit_record.size()));
+      rc != 0) {
+    return rc;
+  }
+  if (const int32_t rc = writer.finish(); rc != 0) {
+    return rc;
+  }
+  return sr_i_fdatasync(fd);
 }
 
 // The disk form of a row record: header, then the memory record's data.
@@ -153,14 +162,8 @@ int32_t append(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_r
     }
     offset += length;
   }
-  if (const int32_t rc = add_commit_record(writer, offset, commit_record); rc != 0) {
-    return report_write_failure(p_table, rc);
-  }
-  int32_t rc = writer.finish();
-  if (rc == 0) {
-    rc = sr_i_fdatasync(p_table->file_fd);
-  }
-  if (rc != 0) {
+  if (const int32_t rc = finish_with_commit_record(writer, offset, commit_record, p_table->file_fd);
+      rc != 0) {
     return report_write_failure(p_table, rc);
   }
   p_table->disk_applied_commit_record_offset =
@@ -233,14 +236,9 @@ int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned cha
     at += disk_length;
     offset += disk_length;
   }
-  if (const int32_t rc = add_commit_record(writer, offset, commit_record); rc != 0) {
-    return report_write_failure(p_table, rc);
-  }
-  int32_t rc = writer.finish();
-  if (rc == 0) {
-    rc = sr_i_fdatasync(p_table->rewrite_file_fd);
-  }
-  if (rc != 0) {
+  if (const int32_t rc =
+          finish_with_commit_record(writer, offset, commit_record, p_table->rewrite_file_fd);
+      rc != 0) {
     return report_write_failure(p_table, rc);
   }
   p_table->disk_applied_commit_record_offset = offset;

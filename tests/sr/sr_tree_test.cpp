@@ -133,6 +133,13 @@ TEST(TreeConversion, Latin1LocaleIsConvertedAndKeptForTheLifeOfTheTree) {
   const char *names[1] = {"key"};
   ASSERT_EQ(sr_add_row_1(table, names, values, 1), 0);
   EXPECT_EQ(Hashed_Keys, std::vector<std::string>{"caf\xc3\xa9"});
+
+  // Reading it back converts the stored bytes to the caller's code set again.
+  qv_value_t read{};
+  qv_value_t *const results[1] = {&read};
+  ASSERT_EQ(sr_get_fields_by_index_and_visibility_1(table, 0, names, results, 1, 1, nullptr), 0);
+  EXPECT_STREQ(read.ptr_char, "caf\xe9");
+  std::free(read.ptr_char);
   EXPECT_EQ(sr_close_tree_1(handle), 0);
 }
 

@@ -7,7 +7,7 @@
 
 #include <string>
 
-#include "sr_i_rows.h"
+#include "rows/sr_i_rows.h"
 #include "sr_row_test_support.h"
 
 namespace {

@@ -11,8 +11,8 @@
 #include <string>
 #include <vector>
 
-#include "sr_i_application_metadata.h"
-#include "sr_i_table.h"
+#include "schema/sr_i_application_metadata.h"
+#include "tables/sr_i_table.h"
 
 namespace {
 

@@ -9,7 +9,7 @@
 #include <vector>
 
 #include "qv_sr.h"
-#include "sr_i_commit_record.h"
+#include "storage/sr_i_commit_record.h"
 
 namespace {
 

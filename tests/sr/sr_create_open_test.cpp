@@ -12,9 +12,9 @@
 #include <thread>
 #include <vector>
 
-#include "sr_i_hash_table.h"
-#include "sr_i_table.h"
-#include "sr_i_tree.h"
+#include "tables/sr_i_hash_table.h"
+#include "tables/sr_i_table.h"
+#include "frame/sr_i_tree.h"
 #include "sr_row_test_support.h"
 
 namespace {

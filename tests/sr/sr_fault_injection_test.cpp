@@ -23,9 +23,9 @@
 #include <vector>
 
 #include "qv_sr.h"
-#include "sr_i_errors.h"
-#include "sr_i_file_system.h"
-#include "sr_i_transaction.h"
+#include "frame/sr_i_errors.h"
+#include "storage/sr_i_system_calls.h"
+#include "rows/sr_i_transaction.h"
 #include "sr_row_test_support.h"
 
 namespace {
@@ -480,7 +480,7 @@ class FaultInjection : public ::testing::Test {
                                    " system call unexpectedly returned an errno of " +
                                    std::to_string(fault.error) + " to the "))
           << text;
-      EXPECT_NE(text.find(" of file sr/sr_"), std::string::npos) << text;
+      EXPECT_NE(text.find(" of file sr/storage/sr_"), std::string::npos) << text;
     } else {
       EXPECT_TRUE(text.starts_with("2605-" + std::to_string(code) + " ")) << text;
     }

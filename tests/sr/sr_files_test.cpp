@@ -20,8 +20,8 @@
 #include <vector>
 
 #include "qv_sr.h"
-#include "sr_i_file_system.h"
-#include "sr_i_files.h"
+#include "storage/sr_i_system_calls.h"
+#include "storage/sr_i_files.h"
 #include "sr_row_test_support.h"
 
 namespace {

@@ -13,7 +13,7 @@
 #include <string>
 #include <thread>
 
-#include "sr_i_frame.h"
+#include "frame/sr_i_frame.h"
 #include "sr_row_test_support.h"
 
 namespace {

@@ -14,7 +14,7 @@
 #include <vector>
 
 #include "qv_cu.h"
-#include "sr_i_hash_table.h"
+#include "tables/sr_i_hash_table.h"
 #include "sr_row_test_support.h"
 
 namespace {

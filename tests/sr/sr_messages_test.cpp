@@ -11,7 +11,7 @@
 #include <fstream>
 #include <string>
 
-#include "sr_i_errors.h"
+#include "frame/sr_i_errors.h"
 
 namespace {
 

@@ -10,9 +10,9 @@
 #include <string>
 
 #include "qv_sr.h"
-#include "sr_i_errors.h"
-#include "sr_i_file_system.h"
-#include "sr_i_paths.h"
+#include "frame/sr_i_errors.h"
+#include "storage/sr_i_system_calls.h"
+#include "frame/sr_i_paths.h"
 #include "sr_row_test_support.h"
 
 namespace {

@@ -15,7 +15,7 @@
 #include <string>
 #include <vector>
 
-#include "sr_i_transaction.h"
+#include "rows/sr_i_transaction.h"
 #include "sr_row_test_support.h"
 
 namespace {

@@ -32,9 +32,9 @@
 #include <vector>
 
 #include "qv_sr.h"
-#include "sr_i_file_system.h"
-#include "sr_i_table.h"
-#include "sr_i_transaction.h"
+#include "storage/sr_i_system_calls.h"
+#include "tables/sr_i_table.h"
+#include "rows/sr_i_transaction.h"
 #include "sr_versioned_rows.h"
 
 namespace {

@@ -20,9 +20,9 @@
 #include <vector>
 
 #include "qv_sr.h"
-#include "sr_i_frame.h"
-#include "sr_i_table.h"
-#include "sr_i_transaction.h"
+#include "frame/sr_i_frame.h"
+#include "tables/sr_i_table.h"
+#include "rows/sr_i_transaction.h"
 #include "sr_versioned_rows.h"
 
 namespace {

@@ -10,7 +10,7 @@
 #include <thread>
 #include <vector>
 
-#include "sr_i_read_write_lock.h"
+#include "frame/sr_i_read_write_lock.h"
 
 namespace {
 

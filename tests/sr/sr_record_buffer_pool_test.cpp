@@ -21,8 +21,8 @@
 #include <vector>
 
 #include "qv_sr.h"
-#include "sr_i_prefault.h"
-#include "sr_i_record_buffer_pool.h"
+#include "storage/sr_i_prefault.h"
+#include "tables/sr_i_record_buffer_pool.h"
 #include "sr_row_test_support.h"
 
 namespace {

@@ -16,7 +16,7 @@
 #include <vector>
 
 #include "qv_sr.h"
-#include "sr_i_table.h"
+#include "tables/sr_i_table.h"
 
 namespace sr_test {
 

@@ -14,9 +14,9 @@
 #include <vector>
 
 #include "pmsg_test_values.h"
-#include "sr_i_rows.h"
-#include "sr_i_selection_criteria.h"
-#include "sr_i_tree.h"
+#include "rows/sr_i_rows.h"
+#include "queries/sr_i_selection_criteria.h"
+#include "frame/sr_i_tree.h"
 #include "sr_row_test_support.h"
 
 namespace {

@@ -13,7 +13,7 @@
 #include <utility>
 #include <vector>
 
-#include "sr_i_rows.h"
+#include "rows/sr_i_rows.h"
 #include "sr_row_test_support.h"
 
 namespace {

@@ -9,7 +9,7 @@
 #include <set>
 #include <vector>
 
-#include "sr_i_table.h"
+#include "tables/sr_i_table.h"
 
 namespace {
 

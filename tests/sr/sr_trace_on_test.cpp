@@ -47,7 +47,7 @@ TEST(TraceOn, EntryExitAndErrorRecordsAreWritten) {
   EXPECT_TRUE(has_record(text, "15")) << text;
   EXPECT_TRUE(has_record(text, "16 ")) << text;
   EXPECT_NE(text.find("sr_close_tree_1"), std::string::npos) << text;  // the error record
-  EXPECT_NE(text.find("sr/sr_x_close_tree"), std::string::npos) << text;
+  EXPECT_NE(text.find("sr/frame/sr_x_close_tree"), std::string::npos) << text;
 }
 
 }  // namespace

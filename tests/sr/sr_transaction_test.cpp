@@ -7,7 +7,7 @@
 
 #include <set>
 
-#include "sr_i_transaction.h"
+#include "rows/sr_i_transaction.h"
 #include "sr_row_test_support.h"
 
 namespace {

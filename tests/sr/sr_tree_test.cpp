@@ -13,7 +13,7 @@
 #include <vector>
 
 #include "qv_sr.h"
-#include "sr_i_tree.h"
+#include "frame/sr_i_tree.h"
 #include "sr_row_test_support.h"
 
 namespace {

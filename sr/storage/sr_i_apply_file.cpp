@@ -1,0 +1,376 @@
+// sr_i_apply_file.cpp - apply, commit and abort of a table with a file.
+//
+// Apply writes the pending changes where no reader looks yet: appended
+// behind the live commit record (changed rows, one deletion record, a new
+// live commit record), or, when the file is mostly dead records, as a
+// complete new file beside it (the rewrite file). Either way the file is
+// flushed before apply returns. Commit then makes the new state the
+// committed one with a single small step: the old commit record's type is
+// overwritten with 0 (so the reader goes on to the new one), or the rewrite
+// file is renamed onto the table file. A crash at any moment leaves the
+// file at the old committed state or at the new one. Abort cuts the
+// appended tail off again, or removes the rewrite file.
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <new>
+#include <string>
+#include <vector>
+
+#include "storage/sr_i_commit_record.h"
+#include "frame/sr_i_errors.h"
+#include "storage/sr_i_system_calls.h"
+#include "storage/sr_i_files.h"
+#include "rows/sr_i_rows.h"
+#include "frame/sr_i_source_location.h"
+#include "storage/sr_i_storage.h"
+#include "rows/sr_i_transaction.h"
+
+namespace {
+
+constexpr int Gathered_Records = 16;
+
+// The length of a record in the pool, the pool's header included; on disk
+// the same record is 8 bytes shorter.
+uint32_t memory_record_length(void *p_record) {
+  return sr_i_rb_record_header(p_record)->record_length;
+}
+
+// Collects records and writes them sixteen to a gathered write.
+class record_writer {
+ public:
+  explicit record_writer(int fd) : fd_(fd) {}
+
+  int32_t add(const void *p_bytes, uint32_t length) {
+    batch_[count_] = {const_cast<void *>(p_bytes), length};
+    batch_bytes_ += length;
+    return ++count_ == Gathered_Records ? flush_batch() : 0;
+  }
+
+  int32_t finish() { return count_ > 0 ? flush_batch() : 0; }
+
+  uint32_t written() const { return written_; }
+
+ private:
+  int32_t flush_batch() {
+    const int32_t rc = sr_i_writev(fd_, batch_, count_, batch_bytes_, &written_);
+    count_ = 0;
+    batch_bytes_ = 0;
+    return rc;
+  }
+
+  int fd_;
+  iovec batch_[Gathered_Records] = {};
+  int count_ = 0;
+  uint32_t batch_bytes_ = 0;
+  uint32_t written_ = 0;
+};
+
+// Ends a write of records to `fd`: adds the commit record at file offset
+// `offset`, behind the dead record that keeps its type word inside one disk
+// sector when it needs one (the offset moves to the commit record's start),
+// writes what the writer still holds and flushes the file.
+int32_t finish_with_commit_record(record_writer &writer, uint32_t &offset,
+                                  const std::vector<unsigned char> &commit_record, int fd) {
+  if (const uint32_t padding = sr_i_commit_record_padding(offset); padding != 0) {
+    if (const int32_t rc = writer.add(Sr_Commit_Record_Padding, padding); rc != 0) {
+      return rc;
+    }
+    offset += padding;
+  }
+  if (const int32_t rc =
+          writer.add(commit_record.data(), static_cast<uint32_t>(commit_record.size()));
+      rc != 0) {
+    return rc;
+  }
+  if (const int32_t rc = writer.finish(); rc != 0) {
+    return rc;
+  }
+  return sr_i_fdatasync(fd);
+}
+
+// The disk form of a row record: header, then the memory record's data.
+// `replaced` is written over the row's first word when it is given.
+void put_row_record(unsigned char *p_disk, void *p_record, const uint32_t *p_replaced) {
+  const uint32_t disk_length = memory_record_length(p_record) - Sr_Memory_Record_Extra;
+  const uint32_t header[3] = {disk_length, 0, Sr_Row_Record};
+  std::memcpy(p_disk, header, sizeof header);
+  std::memcpy(p_disk + sizeof header, p_record, disk_length - sizeof header);
+  if (p_replaced != nullptr) {
+    std::memcpy(p_disk + sizeof header, p_replaced, sizeof *p_replaced);
+  }
+}
+
+int32_t report_write_failure(sr_i_table_t *p_table, int32_t rc) {
+  return rc == SR_E_FILESYSTEM_FULL ? trace_filesystem_full_for_path(p_table->p_file_path) : rc;
+}
+
+// Appends the changed rows, a deletion record and the commit record behind
+// the live commit record, and flushes.
+int32_t append(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_record) {
+  const uint32_t start = p_table->disk_commit_record_offset + p_table->disk_commit_record_length;
+  if (Sr_File_System.lseek(p_table->file_fd, start, SEEK_SET) < 0) {
+    return sr_i_raise_system_call("lseek64", errno);
+  }
+  size_t row_bytes = 0;
+  for (auto *p_change = p_table->p_rows_change_list; p_change; p_change = p_change->p_next) {
+    if (p_change->p_index_entry->p_applied != nullptr) {
+      row_bytes += memory_record_length(p_change->p_index_entry->p_applied);
+    }
+  }
+  std::vector<unsigned char> rows;
+  std::vector<uint32_t> deletion;
+  try {
+    rows.resize(row_bytes);
+    deletion.assign(4 + p_table->applied_deletions, 0);
+  } catch (const std::bad_alloc &) {
+    return sr_i_raise_no_memory();
+  }
+  record_writer writer(p_table->file_fd);
+  uint32_t offset = start;
+  size_t at = 0;
+  for (auto *p_change = p_table->p_rows_change_list; p_change; p_change = p_change->p_next) {
+    sr_i_index_entry_t *p_entry = p_change->p_index_entry;
+    if (p_entry->p_applied == nullptr) {
+      continue;
+    }
+    const uint32_t disk_length = memory_record_length(p_entry->p_applied) - Sr_Memory_Record_Extra;
+    put_row_record(&rows[at], p_entry->p_applied, nullptr);
+    p_entry->applied_file_offset = offset;
+    sr_i_rb_record_header(p_entry->p_applied)->disk_table_offset = offset;
+    if (const int32_t rc = writer.add(&rows[at], disk_length); rc != 0) {
+      return report_write_failure(p_table, rc);
+    }
+    at += disk_length;
+    offset += disk_length;
+  }
+  // Rows added and deleted within the transaction never reached the file.
+  uint32_t deleted = 0;
+  for (auto *p_change = p_table->p_delete_rows_change_list; p_change; p_change = p_change->p_next) {
+    if (p_change->p_index_entry->p_committed != nullptr) {
+      deletion[4 + deleted++] = p_change->p_index_entry->file_offset;
+    }
+  }
+  if (deleted > 0) {
+    const uint32_t length = (deleted + 4) * 4;
+    deletion[0] = length;
+    deletion[2] = Sr_Deletion_Record;
+    deletion[3] = deleted;
+    if (const int32_t rc = writer.add(deletion.data(), length); rc != 0) {
+      return report_write_failure(p_table, rc);
+    }
+    offset += length;
+  }
+  if (const int32_t rc = finish_with_commit_record(writer, offset, commit_record, p_table->file_fd);
+      rc != 0) {
+    return report_write_failure(p_table, rc);
+  }
+  p_table->disk_applied_commit_record_offset =
+      start + writer.written() - static_cast<uint32_t>(commit_record.size());
+  const uint32_t end = start + writer.written();
+  if (end > p_table->disk_file_length) {
+    p_table->disk_file_length = end;
+  }
+  p_table->file_length = p_table->disk_file_length;
+  p_table->ready_for_commit = Sr_Applied_In_Place;
+  return 0;
+}
+
+// Removes a rewrite file that will not be committed.
+void discard_rewrite_file(sr_i_table_t *p_table) {
+  if (p_table->rewrite_file_fd >= 0) {
+    Sr_File_System.close(p_table->rewrite_file_fd);
+    p_table->rewrite_file_fd = -1;
+  }
+  sr_i_set_rewrite_path(p_table);
+  Sr_File_System.unlink(p_table->p_file_path);
+  sr_i_set_data_path(p_table);
+  p_table->rewrite_file_length = 0;
+}
+
+// Writes the live rows into the rewrite file.
+int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_record) {
+  std::vector<unsigned char> metadata;
+  if (const int32_t rc = sr_i_convert_metadata_memory_record_to_disk_record(p_table, metadata);
+      rc != 0) {
+    return rc;
+  }
+  const uint32_t live_rows = p_table->total_applied_rows - p_table->applied_deletions;
+  size_t row_bytes = 0;
+  uint32_t seen = 0;
+  for (uint32_t position = 0; position < p_table->maximum_rows && seen < live_rows; ++position) {
+    if (void *p_record = p_table->p_rows_fixed_index[position].p_applied) {
+      row_bytes += memory_record_length(p_record);
+      ++seen;
+    }
+  }
+  std::vector<unsigned char> rows;
+  try {
+    rows.resize(row_bytes);
+  } catch (const std::bad_alloc &) {
+    return sr_i_raise_no_memory();
+  }
+  record_writer writer(p_table->rewrite_file_fd);
+  if (const int32_t rc = writer.add(metadata.data(), static_cast<uint32_t>(metadata.size()));
+      rc != 0) {
+    return report_write_failure(p_table, rc);
+  }
+  auto offset = static_cast<uint32_t>(metadata.size());
+  size_t at = 0;
+  seen = 0;
+  const uint32_t no_earlier_version = 0;
+  for (uint32_t position = 0; position < p_table->maximum_rows && seen < live_rows; ++position) {
+    sr_i_index_entry_t &entry = p_table->p_rows_fixed_index[position];
+    if (entry.p_applied == nullptr) {
+      continue;
+    }
+    ++seen;
+    const uint32_t disk_length = memory_record_length(entry.p_applied) - Sr_Memory_Record_Extra;
+    put_row_record(&rows[at], entry.p_applied, &no_earlier_version);
+    entry.applied_file_offset = offset;
+    sr_i_rb_record_header(entry.p_applied)->disk_table_offset = offset;
+    if (const int32_t rc = writer.add(&rows[at], disk_length); rc != 0) {
+      return report_write_failure(p_table, rc);
+    }
+    at += disk_length;
+    offset += disk_length;
+  }
+  if (const int32_t rc =
+          finish_with_commit_record(writer, offset, commit_record, p_table->rewrite_file_fd);
+      rc != 0) {
+    return report_write_failure(p_table, rc);
+  }
+  p_table->disk_applied_commit_record_offset = offset;
+  p_table->rewrite_file_length = writer.written();
+  p_table->ready_for_commit = Sr_Applied_By_Rewrite;
+  return 0;
+}
+
+// Writes a complete new file beside the table file.
+int32_t rewrite(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_record) {
+  sr_i_set_rewrite_path(p_table);
+  p_table->rewrite_file_fd = sr_i_open_file(p_table->p_file_path, O_RDWR | O_CREAT, Sr_File_Mode);
+  if (p_table->rewrite_file_fd < 0) {
+    const int error_number = errno;
+    int32_t rc;
+    if (error_number == EACCES) {
+      rc = sr_i_raise(SR_E_ACCESS);
+    } else if (error_number == ENOSPC) {
+      rc = trace_filesystem_full_for_path(p_table->p_file_path);
+    } else {
+      rc = sr_i_raise_system_call("open", error_number);
+    }
+    sr_i_set_data_path(p_table);
+    return rc;
+  }
+  sr_i_set_data_path(p_table);
+  if (sr_i_lock_file(p_table->rewrite_file_fd, true) != 0) {
+    const int32_t rc = sr_i_raise_system_call("lockf", errno);
+    discard_rewrite_file(p_table);
+    return rc;
+  }
+  const int32_t rc = write_rewrite_file(p_table, commit_record);
+  if (rc != 0) {
+    discard_rewrite_file(p_table);
+  }
+  return rc;
+}
+
+// Writes the type word of the committed commit record.
+int32_t write_commit_record_type(sr_i_table_t *p_table, uint32_t type) {
+  if (Sr_File_System.lseek(p_table->file_fd, p_table->disk_commit_record_offset + 8, SEEK_SET) <
+      0) {
+    return sr_i_raise_system_call("lseek64", errno);
+  }
+  return report_write_failure(p_table, sr_i_write(p_table->file_fd, &type, sizeof type));
+}
+
+// Kills the old commit record, so that readers go on to the one apply
+// appended. When the flush fails it is unknown whether the 0 reached the
+// disk, so the record is made live again before the failure is returned.
+int32_t commit_appended(sr_i_table_t *p_table) {
+  if (const int32_t rc = write_commit_record_type(p_table, Sr_Dead_Record); rc != 0) {
+    return rc;
+  }
+  const int32_t flush_rc = sr_i_fdatasync(p_table->file_fd);
+  if (flush_rc == 0) {
+    return 0;
+  }
+  if (const int32_t rc = write_commit_record_type(p_table, Sr_Live_Commit_Record); rc != 0) {
+    return rc;
+  }
+  if (sr_i_fdatasync(p_table->file_fd) == SR_E_FILESYSTEM_FULL) {
+    trace_filesystem_full_for_path(p_table->p_file_path);
+  }
+  return report_write_failure(p_table, flush_rc);
+}
+
+int32_t commit_rewritten(sr_i_table_t *p_table) {
+  sr_i_set_rewrite_path(p_table);
+  std::string rewrite_path;
+  try {
+    rewrite_path = p_table->p_file_path;
+  } catch (const std::bad_alloc &) {
+    sr_i_set_data_path(p_table);
+    return sr_i_raise_no_memory();
+  }
+  sr_i_set_data_path(p_table);
+  // A failed rename leaves the rewrite file in place, complete and flushed:
+  // the commit can be tried again, or the abort removes it.
+  if (Sr_File_System.rename(rewrite_path.c_str(), p_table->p_file_path) != 0) {
+    const int error_number = errno;
+    if (error_number == EACCES) {
+      return sr_i_raise(SR_E_ACCESS);
+    }
+    if (error_number == ENOSPC) {
+      return trace_filesystem_full_for_path(p_table->p_file_path);
+    }
+    return sr_i_raise_system_call("rename", error_number);
+  }
+  Sr_File_System.close(p_table->file_fd);
+  p_table->file_fd = p_table->rewrite_file_fd;
+  p_table->rewrite_file_fd = -1;
+  p_table->file_length = p_table->rewrite_file_length;
+  p_table->disk_file_length = p_table->rewrite_file_length;
+  p_table->rewrite_file_length = 0;
+  return 0;
+}
+
+}  // namespace
+
+int32_t sr_i_apply_to_file(sr_i_table_t *p_table, uint32_t rewrite_file) {
+  std::vector<unsigned char> commit_record;
+  if (const int32_t rc = sr_i_create_commit_record(p_table->p_application_metadata,
+                                                   p_table->applied_change_counter, commit_record);
+      rc != 0) {
+    return rc;
+  }
+  p_table->disk_applied_commit_record_length = static_cast<uint32_t>(commit_record.size());
+  return rewrite_file != 0 ? rewrite(p_table, commit_record) : append(p_table, commit_record);
+}
+
+int32_t sr_i_commit_file(sr_i_table_t *p_table) {
+  if (p_table->ready_for_commit == Sr_Applied_By_Rewrite) {
+    return commit_rewritten(p_table);
+  }
+  return commit_appended(p_table);
+}
+
+void sr_i_abort_file(sr_i_table_t *p_table) {
+  if (p_table->ready_for_commit == Sr_Applied_By_Rewrite) {
+    discard_rewrite_file(p_table);
+  } else if (p_table->ready_for_commit == Sr_Applied_In_Place) {
+    const uint32_t committed_end =
+        p_table->disk_commit_record_offset + p_table->disk_commit_record_length;
+    if (Sr_File_System.ftruncate(p_table->file_fd, committed_end) == 0) {
+      p_table->disk_file_length = committed_end;
+      p_table->file_length = committed_end;
+    }
+    if (sr_i_fdatasync(p_table->file_fd) == SR_E_FILESYSTEM_FULL) {
+      trace_filesystem_full_for_path(p_table->p_file_path);
+    }
+  }
+  p_table->applied_commit_record_offset = 0;
+  p_table->applied_commit_record_length = 0;
+}

@@ -1,0 +1,276 @@
+// sr_i_hash_table.cpp - the key hash table: bucket arrays, chained elements,
+// the built-in hash for resource-handle keys and the diagnostic statistics.
+//
+// Buckets never grow: a client that chooses a bucket count chooses it for
+// good. New elements go to the head of their chain, so among equal keys the
+// newest is found first. Every bucket number a hash function produces is
+// checked against the bucket count before it is used, since a client's
+// function is outside our control. Elements come from the table's own
+// element blocks (see sr_hash_table_t); allocation uses nothrow new and
+// catches the block list's growth, so a failure is a code and never an
+// exception.
+
+#include "tables/sr_i_hash_table.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <cstring>
+#include <new>
+
+#include "qv_cu.h"
+#include "frame/sr_i_errors.h"
+
+namespace {
+
+constexpr uint32_t Resource_Handle_Bucket_Mask = Sr_Resource_Handle_Hash_Buckets - 1;
+
+// Element blocks start small, so that a table of a few keys stays small, and
+// double up to a size that keeps each block well inside the heap.
+constexpr uint32_t First_Element_Block = 32;
+constexpr uint32_t Largest_Element_Block = 4096;
+
+// Keys inside row records are not aligned: the handles are read through
+// copies.
+qv_resource_handle_t resource_handle_at(const void *p_key) {
+  qv_resource_handle_t handle;
+  std::memcpy(&handle, p_key, sizeof handle);
+  return handle;
+}
+
+int32_t compare_resource_handles(const void *p_stored_key, const void *p_key) {
+  const qv_resource_handle_t stored = resource_handle_at(p_stored_key);
+  const qv_resource_handle_t wanted = resource_handle_at(p_key);
+  return cu_rsrc_hndl_cmp_1(&stored, &wanted);
+}
+
+}  // namespace
+
+int32_t sr_i_hash_table_open(uint32_t total_hash_buckets, sr_hash_function_t p_hash_function,
+                             sr_hash_keys_compare_function_t p_compare_function,
+                             sr_hash_table_t **p_p_hash_table) {
+  if (p_hash_function == nullptr) {
+    total_hash_buckets = Sr_Resource_Handle_Hash_Buckets;
+    p_compare_function = compare_resource_handles;
+  } else if (p_compare_function == nullptr || total_hash_buckets == 0) {
+    return sr_i_raise_internal();
+  }
+  auto **p_elements = new (std::nothrow) sr_hash_table_element_t *[total_hash_buckets]();
+  if (p_elements == nullptr) {
+    return sr_i_raise_no_memory();
+  }
+  auto *p_hash_table = new (std::nothrow) sr_hash_table_t;
+  if (p_hash_table == nullptr) {
+    delete[] p_elements;
+    return sr_i_raise_no_memory();
+  }
+  p_hash_table->total_hash_buckets = total_hash_buckets;
+  p_hash_table->p_hash_function = p_hash_function;
+  p_hash_table->p_compare_function = p_compare_function;
+  p_hash_table->p_elements = p_elements;
+  p_hash_table->last_block_capacity = 0;
+  p_hash_table->unused_in_last_block = 0;
+  p_hash_table->p_free_elements = nullptr;
+  *p_p_hash_table = p_hash_table;
+  return 0;
+}
+
+int32_t sr_i_hash_table_close(sr_hash_table_t *p_hash_table) {
+  if (p_hash_table == nullptr) {
+    return 0;
+  }
+  delete[] p_hash_table->p_elements;
+  delete p_hash_table;  // with it the element blocks
+  return 0;
+}
+
+bool sr_i_hash_table_try_bucket(const sr_hash_table_t *p_hash_table, const void *p_key_value,
+                                uint32_t *p_hash_index) {
+  uint32_t bucket = 0;
+  if (p_hash_table->p_hash_function == nullptr) {
+    bucket = resource_handle_at(p_key_value).id.id4 & Resource_Handle_Bucket_Mask;
+  } else {
+    bucket = p_hash_table->p_hash_function(p_key_value);
+  }
+  *p_hash_index = bucket;
+  return bucket < p_hash_table->total_hash_buckets;
+}
+
+int32_t sr_i_hash_table_bucket(const sr_hash_table_t *p_hash_table, const void *p_key_value,
+                               uint32_t *p_hash_index) {
+  uint32_t bucket = 0;
+  if (!sr_i_hash_table_try_bucket(p_hash_table, p_key_value, &bucket)) {
+    return sr_i_raise_internal();
+  }
+  *p_hash_index = bucket;
+  return 0;
+}
+
+namespace {
+
+// An unused element: a removed one if any waits, else the next of the last
+// block, else the first of a new block. Null when memory runs out.
+sr_hash_table_element_t *new_element(sr_hash_table_t *p_hash_table) {
+  if (sr_hash_table_element_t *p_element = p_hash_table->p_free_elements) {
+    p_hash_table->p_free_elements = p_element->p_next;
+    return p_element;
+  }
+  if (p_hash_table->unused_in_last_block == 0) {
+    const uint32_t capacity =
+        p_hash_table->element_blocks.empty()
+            ? First_Element_Block
+            : std::min(p_hash_table->last_block_capacity * 2, Largest_Element_Block);
+    std::unique_ptr<sr_hash_table_element_t[]> block(new (std::nothrow)
+                                                         sr_hash_table_element_t[capacity]);
+    if (block == nullptr) {
+      return nullptr;
+    }
+    try {
+      p_hash_table->element_blocks.push_back(std::move(block));
+    } catch (const std::bad_alloc &) {
+      return nullptr;
+    }
+    p_hash_table->last_block_capacity = capacity;
+    p_hash_table->unused_in_last_block = capacity;
+  }
+  const uint32_t next = p_hash_table->last_block_capacity - p_hash_table->unused_in_last_block--;
+  return &p_hash_table->element_blocks.back()[next];
+}
+
+void free_element(sr_hash_table_t *p_hash_table, sr_hash_table_element_t *p_element) {
+  p_element->p_next = p_hash_table->p_free_elements;
+  p_hash_table->p_free_elements = p_element;
+}
+
+// The link that points at the newest element with a key equal to
+// `p_key_value` in `bucket` (the bucket head or a predecessor's `p_next`),
+// or null when there is none.
+sr_hash_table_element_t **find_link_to_key(const sr_hash_table_t *p_hash_table, uint32_t bucket,
+                                           const void *p_key_value) {
+  for (sr_hash_table_element_t **p_link = &p_hash_table->p_elements[bucket]; *p_link != nullptr;
+       p_link = &(*p_link)->p_next) {
+    if (p_hash_table->p_compare_function((*p_link)->p_key_value, p_key_value) == 0) {
+      return p_link;
+    }
+  }
+  return nullptr;
+}
+
+}  // namespace
+
+int32_t sr_i_hash_table_add(sr_hash_table_t *p_hash_table, const void *p_key_value,
+                            uint32_t row_index, uint32_t *p_hash_index,
+                            sr_hash_table_element_t **p_p_hash_table_element,
+                            sr_qualifier_t qualifier) {
+  uint32_t bucket = 0;
+  if (const int32_t rc = sr_i_hash_table_bucket(p_hash_table, p_key_value, &bucket); rc != 0) {
+    return rc;
+  }
+  return sr_i_hash_table_add_to_bucket(p_hash_table, bucket, p_key_value, row_index,
+                                       p_p_hash_table_element, qualifier, p_hash_index);
+}
+
+int32_t sr_i_hash_table_add_to_bucket(sr_hash_table_t *p_hash_table, uint32_t bucket,
+                                      const void *p_key_value, uint32_t row_index,
+                                      sr_hash_table_element_t **p_p_hash_table_element,
+                                      sr_qualifier_t qualifier, uint32_t *p_hash_index) {
+  if ((qualifier & 15) == SR_PRIMARY_KEY) {
+    if (sr_hash_table_element_t **p_link = find_link_to_key(p_hash_table, bucket, p_key_value)) {
+      *p_hash_index = bucket;
+      *p_p_hash_table_element = *p_link;
+      return SR_E_DUPLICATE_KEY;
+    }
+  }
+  sr_hash_table_element_t *p_element = new_element(p_hash_table);
+  if (p_element == nullptr) {
+    return sr_i_raise_no_memory();
+  }
+  p_element->row_index = row_index;
+  p_element->p_key_value = p_key_value;
+  p_element->p_next = p_hash_table->p_elements[bucket];
+  p_hash_table->p_elements[bucket] = p_element;
+  *p_hash_index = bucket;
+  *p_p_hash_table_element = p_element;
+  return 0;
+}
+
+int32_t sr_i_hash_table_get_index(const sr_hash_table_t *p_hash_table, const void *p_key_value,
+                                  uint32_t *p_row_index, const void ***p_p_p_key_value) {
+  uint32_t bucket = 0;
+  if (const int32_t rc = sr_i_hash_table_bucket(p_hash_table, p_key_value, &bucket); rc != 0) {
+    return rc;
+  }
+  sr_hash_table_element_t **p_link = find_link_to_key(p_hash_table, bucket, p_key_value);
+  if (p_link == nullptr) {
+    return SR_E_NO_ROW_FOR_KEY;
+  }
+  *p_row_index = (*p_link)->row_index;
+  if (p_p_p_key_value != nullptr) {
+    *p_p_p_key_value = &(*p_link)->p_key_value;
+  }
+  return 0;
+}
+
+int32_t sr_i_hash_table_remove_element(sr_hash_table_t *p_hash_table, uint32_t hash_index,
+                                       sr_hash_table_element_t *p_hash_table_element) {
+  if (hash_index >= p_hash_table->total_hash_buckets) {
+    return sr_i_raise_internal();
+  }
+  for (sr_hash_table_element_t **p_link = &p_hash_table->p_elements[hash_index]; *p_link != nullptr;
+       p_link = &(*p_link)->p_next) {
+    if (*p_link == p_hash_table_element) {
+      *p_link = p_hash_table_element->p_next;
+      free_element(p_hash_table, p_hash_table_element);
+      return 0;
+    }
+  }
+  return sr_i_raise(SR_E_NO_ROW_FOR_KEY);
+}
+
+int32_t sr_i_hash_table_remove(sr_hash_table_t *p_hash_table, const void *p_key_value) {
+  uint32_t bucket = 0;
+  if (const int32_t rc = sr_i_hash_table_bucket(p_hash_table, p_key_value, &bucket); rc != 0) {
+    return rc;
+  }
+  sr_hash_table_element_t **p_link = find_link_to_key(p_hash_table, bucket, p_key_value);
+  if (p_link == nullptr) {
+    return sr_i_raise(SR_E_NO_ROW_FOR_KEY);
+  }
+  sr_hash_table_element_t *p_element = *p_link;
+  *p_link = p_element->p_next;
+  free_element(p_hash_table, p_element);
+  return 0;
+}
+
+void sr_i_hash_table_output_stats(const sr_hash_table_t *p_hash_table) {
+  uint32_t longest_chain = 0;
+  uint32_t empty_buckets = 0;
+  for (uint32_t bucket = 0; bucket < p_hash_table->total_hash_buckets; ++bucket) {
+    uint32_t chain_length = 0;
+    for (const sr_hash_table_element_t *p_element = p_hash_table->p_elements[bucket];
+         p_element != nullptr; p_element = p_element->p_next) {
+      ++chain_length;
+    }
+    if (chain_length == 0) {
+      ++empty_buckets;
+      continue;
+    }
+    std::printf("%u %u\n", bucket, chain_length);
+    if (chain_length > longest_chain) {
+      longest_chain = chain_length;
+    }
+  }
+  std::printf("total hash buckets : %u\n", p_hash_table->total_hash_buckets);
+  std::printf("max_bucket_count   : %u\n", longest_chain);
+  std::printf("unused buckets     : %u\n", empty_buckets);
+}
+
+int32_t sr_i_hash_table_open_for_client(uint32_t total_hash_buckets,
+                                        sr_hash_function_t p_hash_function,
+                                        sr_hash_keys_compare_function_t p_compare_function,
+                                        sr_hash_table_t **p_p_hash_table) {
+  if (total_hash_buckets == 0 || p_hash_function == nullptr || p_compare_function == nullptr) {
+    return sr_i_raise(SR_E_NULL_POINTER);
+  }
+  return sr_i_hash_table_open(total_hash_buckets, p_hash_function, p_compare_function,
+                              p_p_hash_table);
+}

@@ -3,6 +3,8 @@
  * wins, malformed items, and the levels registration writes into a
  * component's array.
  */
+#include <algorithm>
+
 #include "tr_test_support.h"
 
 namespace {
@@ -39,23 +41,9 @@ TEST(LevelSettings, FormsAndOverridesGiveEachCategoryItsLevel) {
 }
 
 TEST(LevelSettings, MalformedItemIsSkippedAndTheOthersStillApply) {
-  const char *bad_items[] = {
-      "_SRA.API",
-      "=3",
-      ".API=3",
-      "_SRA.=3",
-      "_SRA.API=",
-      "_SRA.API=x",
-      "_SRA.API=256",
-      "_SRA.API=-1",
-      "_SRA.API=+1",
-      "_SRA.API=1 2",
-      "_SRA.API=1=2",
-      "_SRA.API=99999999999999999999",
-      "",
-      ",",
-  };
-  for (const char *p_bad : bad_items) {
+  for (const char *p_bad : {"_SRA.API", "=3", ".API=3", "_SRA.=3", "_SRA.API=", "_SRA.API=x",
+                            "_SRA.API=256", "_SRA.API=-1", "_SRA.API=+1", "_SRA.API=1 2",
+                            "_SRA.API=1=2", "_SRA.API=99999999999999999999", "", ","}) {
     for (const std::string &levels :
          {std::string(p_bad) + ",_SRA.Errors=2", "_SRA.Errors=2," + std::string(p_bad)}) {
       EXPECT_EQ(tr_i_parse_level_settings(levels).size(), 1u) << levels;
@@ -71,9 +59,14 @@ using Registration = TraceFileTest;
  * to no category: levels must go to p_levels[category_id] and nowhere else. */
 const tr_category_t kCategories[] = {{2, "API"}, {0, "Errors"}, {1, "Wherever"}};
 
-TEST_F(Registration, WritesEachCategoryLevelAtItsId) {
+TEST_F(Registration, WritesEachCategoryLevelAtItsIdAndNothingWithoutAnArgument) {
   Settings("_REG1.API=1,_REG1.Errors=2,_REG1.Nothing=9", nullptr);
   unsigned char *levels = LevelsForLife(4, 0xee);
+  EXPECT_EQ(tr_register_component_1(nullptr, levels, kCategories, 3), TR_RESULT_NULL_ARGUMENT);
+  EXPECT_EQ(tr_register_component_1("_REG1", nullptr, kCategories, 3), TR_RESULT_NULL_ARGUMENT);
+  EXPECT_EQ(tr_register_component_1("_REG1", levels, nullptr, 3), TR_RESULT_NULL_ARGUMENT);
+  EXPECT_FALSE(tr_i_component_is_registered("_REG1"));
+  EXPECT_EQ(std::count(levels, levels + 4, 0xee), 4) << "levels written by a refused call";
   ASSERT_EQ(tr_register_component_1("_REG1", levels, kCategories, 3), TR_RESULT_OK);
   EXPECT_EQ(levels[2], 1);
   EXPECT_EQ(levels[0], 2);
@@ -96,16 +89,6 @@ TEST_F(Registration, EnvironmentIsReadOnceAndReloadReachesRegisteredArrays) {
   EXPECT_EQ(levels[0], 7);
   EXPECT_EQ(levels[1], 7);
   EXPECT_EQ(levels[2], 7);
-}
-
-TEST_F(Registration, NullArgumentsAreRefusedAndWriteNothing) {
-  Settings("*=5", nullptr);
-  unsigned char *levels = LevelsForLife(3);
-  EXPECT_EQ(tr_register_component_1(nullptr, levels, kCategories, 3), TR_RESULT_NULL_ARGUMENT);
-  EXPECT_EQ(tr_register_component_1("_REG3", nullptr, kCategories, 3), TR_RESULT_NULL_ARGUMENT);
-  EXPECT_EQ(tr_register_component_1("_REG3", levels, nullptr, 3), TR_RESULT_NULL_ARGUMENT);
-  EXPECT_EQ(levels[0] | levels[1] | levels[2], 0);
-  EXPECT_FALSE(tr_i_component_is_registered("_REG3"));
 }
 
 }  // namespace

@@ -9,13 +9,13 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <cctype>
 #include <cstdio>
 #include <cstdlib>
 #include <ctime>
 #include <filesystem>
 #include <fstream>
 #include <memory>
+#include <regex>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -43,39 +43,32 @@ struct ParsedLine {
 };
 
 /* Takes a line apart; fails the test when it is not in the record format
- * "YYYY-MM-DDTHH:MM:SS.uuuuuuZ pid.tid component id[ payload]". */
+ * "YYYY-MM-DDTHH:MM:SS.uuuuuuZ pid.tid component id[ payload]", with one
+ * blank between fields and numbers without leading zeros. */
 inline ParsedLine ParseLine(const std::string &line) {
-  static constexpr char kTimeShape[] = "dddd-dd-ddTdd:dd:dd.ddddddZ ";
-  constexpr std::size_t kTimeLength = sizeof(kTimeShape) - 1;
+  static const std::regex kFields(
+      R"((\d{4})-(\d\d)-(\d\d)T(\d\d):(\d\d):(\d\d)\.\d{6}Z (0|[1-9]\d*)\.(0|[1-9]\d*) (\S+) )"
+      R"((0|[1-9]\d*)(?= |$))");
+  std::smatch match;
   ParsedLine parsed;
-  bool well_formed = line.size() > kTimeLength;
-  for (std::size_t index = 0; well_formed && index < kTimeLength; ++index) {
-    const char shape = kTimeShape[index];
-    well_formed = shape == 'd' ? std::isdigit(static_cast<unsigned char>(line[index])) != 0
-                               : line[index] == shape;
+  if (!std::regex_search(line, match, kFields, std::regex_constants::match_continuous)) {
+    ADD_FAILURE() << "not a record line: " << line;
+    return parsed;
   }
   struct tm utc = {};
-  char component[128] = {};
-  int consumed = 0;
-  well_formed =
-      well_formed &&
-      sscanf(line.c_str(), "%4d-%2d-%2dT%2d:%2d:%2d.%*6dZ %ld.%ld %127s %lu%n", &utc.tm_year,
-             &utc.tm_mon, &utc.tm_mday, &utc.tm_hour, &utc.tm_min, &utc.tm_sec, &parsed.pid,
-             &parsed.thread_id, component, &parsed.id, &consumed) == 10;
-  const std::string rest = well_formed ? line.substr(static_cast<std::size_t>(consumed)) : "";
-  /* One blank between fields, no leading zeros: the fields read back must
-   * spell the line exactly. */
-  const std::string fields = std::to_string(parsed.pid) + "." + std::to_string(parsed.thread_id) +
-                             " " + component + " " + std::to_string(parsed.id);
-  well_formed = well_formed && line.compare(kTimeLength, std::string::npos, fields + rest) == 0 &&
-                (rest.empty() || rest[0] == ' ');
-  EXPECT_TRUE(well_formed) << "not a record line: " << line;
+  int *fields[] = {&utc.tm_year, &utc.tm_mon, &utc.tm_mday, &utc.tm_hour, &utc.tm_min, &utc.tm_sec};
+  for (int at = 0; at < 6; ++at) {
+    *fields[at] = std::stoi(match[at + 1]);
+  }
   utc.tm_year -= 1900;
   utc.tm_mon -= 1;
   parsed.seconds = timegm(&utc);
-  parsed.component = component;
-  parsed.has_payload = !rest.empty();
-  parsed.payload = rest.empty() ? "" : rest.substr(1);
+  parsed.pid = std::stol(match[7]);
+  parsed.thread_id = std::stol(match[8]);
+  parsed.component = match[9];
+  parsed.id = std::stoul(match[10]);
+  parsed.has_payload = match.suffix().length() != 0;
+  parsed.payload = parsed.has_payload ? match.suffix().str().substr(1) : "";
   return parsed;
 }
 
@@ -112,12 +105,8 @@ class TraceFileTest : public ::testing::Test {
   /* The lines of the trace file; fails the test if the last one is open. */
   std::vector<std::string> ReadLines() const {
     std::ifstream file(trace_path_, std::ios::binary);
-    std::stringstream content;
-    content << file.rdbuf();
-    const std::string text = content.str();
-    if (!text.empty()) {
-      EXPECT_EQ(text.back(), '\n') << "the trace file ends inside a line";
-    }
+    const std::string text{std::istreambuf_iterator<char>(file), {}};
+    EXPECT_TRUE(text.empty() || text.back() == '\n') << "the trace file ends inside a line";
     std::vector<std::string> lines;
     std::istringstream stream(text);
     for (std::string line; std::getline(stream, line);) {

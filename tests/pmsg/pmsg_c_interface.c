@@ -1,6 +1,6 @@
-/* The codec's header compiled as C: a string and a structured value go
- * through the interface the way a C caller writes them. Returns 0, or the
- * line of the first check that failed. */
+/* The codec's header compiled as C: a structured value holding a string goes
+ * through the interface the way a C caller writes it. Returns 0, or the line
+ * of the first check that failed. */
 
 #include <stdlib.h>
 #include <string.h>
@@ -12,41 +12,34 @@ int pmsg_c_interface_round_trip(void);
 int pmsg_c_interface_round_trip(void) {
   unsigned char area[64];
   uint32_t offset = 0;
-  qv_pmsg_value_t slots[2];
-  qv_value_t text, decoded;
+  qv_pmsg_value_t slot;
+  qv_value_t value;
   int failed_line = 0;
-  qv_structured_data_t *p_structured;
+  qv_structured_data_t *p_structured =
+      calloc(1, sizeof *p_structured + sizeof(qv_structured_data_element_t));
 
-  text.ptr_char = "from C";
-  if (qv_pmsg_build_conv_protocol_value_1(NULL, 0, QV_CHAR_PTR, &text, &slots[0], area, sizeof area,
-                                          &offset) != QV_PMSG_RESULT_OK ||
-      offset != 7) {
-    return __LINE__;
-  }
-  p_structured = calloc(1, sizeof *p_structured + sizeof(qv_structured_data_element_t));
   if (p_structured == NULL) {
     return __LINE__;
   }
   p_structured->element_count = 1;
   p_structured->elements[0].data_type = QV_CHAR_PTR;
-  p_structured->elements[0].value = text;
-  decoded.ptr_sd = p_structured;
-  failed_line = qv_pmsg_build_conv_protocol_value_1(NULL, 0, QV_SD_PTR, &decoded, &slots[1], area,
-                                                    sizeof area, &offset) != QV_PMSG_RESULT_OK
-                    ? __LINE__
-                    : 0;
-  free(p_structured);
-  if (failed_line != 0) {
-    return failed_line;
-  }
-  if (qv_pmsg_build_conv_packed_client_value_1(NULL, 0, QV_SD_PTR, &decoded, &slots[1], area,
-                                               offset) != QV_PMSG_RESULT_OK) {
-    return __LINE__;
-  }
-  if (decoded.ptr_sd->element_count != 1 ||
-      strcmp(decoded.ptr_sd->elements[0].value.ptr_char, "from C") != 0) {
+  p_structured->elements[0].value.ptr_char = "from C";
+  value.ptr_sd = p_structured;
+  if (qv_pmsg_build_conv_protocol_value_1(NULL, 0, QV_SD_PTR, &value, &slot, area, sizeof area,
+                                          &offset) != QV_PMSG_RESULT_OK ||
+      slot.anchor.length != offset) {
     failed_line = __LINE__;
   }
-  free(decoded.ptr_sd);
+  free(p_structured);
+  if (failed_line != 0 ||
+      qv_pmsg_build_conv_packed_client_value_1(NULL, 0, QV_SD_PTR, &value, &slot, area, offset) !=
+          QV_PMSG_RESULT_OK) {
+    return failed_line != 0 ? failed_line : __LINE__;
+  }
+  if (value.ptr_sd->element_count != 1 ||
+      strcmp(value.ptr_sd->elements[0].value.ptr_char, "from C") != 0) {
+    failed_line = __LINE__;
+  }
+  free(value.ptr_sd);
   return failed_line;
 }

@@ -106,61 +106,49 @@ TEST(Results, ClientValuesThatCannotBeEncoded) {
   }
 }
 
-class StringConversion : public testing::Test {
- protected:
-  void SetUp() override {
-    ASSERT_EQ(cu_iconv_open_1("ISO-8859-1", CU_ICONV_TO_STORED, &p_to_stored_), 0);
-    ASSERT_EQ(cu_iconv_open_1("ISO-8859-1", CU_ICONV_FROM_STORED, &p_from_stored_), 0);
-    ASSERT_EQ(cu_iconv_open_1("ANSI_X3.4-1968", CU_ICONV_FROM_STORED, &p_to_ascii_), 0);
+// Strings go through the caller's handle: Latin-1 in and out around the
+// stored UTF-8; ASCII, which has holes, to make a conversion fail, which
+// fails the whole value and touches nothing.
+TEST(StringConversion, EveryStringGoesThroughTheHandleAndAFailureFailsTheCall) {
+  cu_iconv_t *p_handles[4] = {};
+  const std::pair<const char *, uint32_t> code_sets[4] = {{"ISO-8859-1", CU_ICONV_TO_STORED},
+                                                          {"ISO-8859-1", CU_ICONV_FROM_STORED},
+                                                          {"ANSI_X3.4-1968", CU_ICONV_TO_STORED},
+                                                          {"ANSI_X3.4-1968", CU_ICONV_FROM_STORED}};
+  for (int at = 0; at < 4; ++at) {
+    ASSERT_EQ(cu_iconv_open_1(code_sets[at].first, code_sets[at].second, &p_handles[at]), 0);
   }
-  void TearDown() override {
-    cu_iconv_close_1(p_to_stored_);
-    cu_iconv_close_1(p_from_stored_);
-    cu_iconv_close_1(p_to_ascii_);
-  }
-  cu_iconv_t *p_to_stored_ = nullptr, *p_from_stored_ = nullptr, *p_to_ascii_ = nullptr;
-};
-
-TEST_F(StringConversion, EveryStringGoesThroughTheHandle) {
+  const auto [p_to_stored, p_from_stored, p_from_ascii, p_to_ascii] = p_handles;
   value_arena arena;
   qv_value_t latin1 = arena.string("caf\xE9");
   qv_value_t structured = arena.structured(
       {{QV_CHAR_PTR, latin1}, {QV_CHAR_PTR_ARRAY, arena.array({latin1, arena.string("\xFC")})}});
   encoded_row row;
-  ASSERT_EQ(append_value(row, QV_CHAR_PTR, latin1, p_to_stored_), 0);
-  ASSERT_EQ(append_value(row, QV_SD_PTR, structured, p_to_stored_), 0);
+  ASSERT_EQ(append_value(row, QV_CHAR_PTR, latin1, p_to_stored), 0);
+  ASSERT_EQ(append_value(row, QV_SD_PTR, structured, p_to_stored), 0);
   EXPECT_EQ(row.slots[0].anchor.length, 6u);
   EXPECT_EQ(std::memcmp(row.area.data(), "caf\xC3\xA9", 6), 0) << "stored as UTF-8";
 
-  decoded_value stored, text, nested;
+  decoded_value stored, text, nested, untouched;
   ASSERT_EQ(decode_slot(row, 0, QV_CHAR_PTR, stored), 0);
   EXPECT_STREQ(stored.value.ptr_char, "caf\xC3\xA9");
-  ASSERT_EQ(decode_slot(row, 0, QV_CHAR_PTR, text, p_from_stored_), 0);
+  ASSERT_EQ(decode_slot(row, 0, QV_CHAR_PTR, text, p_from_stored), 0);
   EXPECT_STREQ(text.value.ptr_char, "caf\xE9");
-  ASSERT_EQ(decode_slot(row, 1, QV_SD_PTR, nested, p_from_stored_), 0);
+  ASSERT_EQ(decode_slot(row, 1, QV_SD_PTR, nested, p_from_stored), 0);
   EXPECT_TRUE(values_equal(QV_SD_PTR, structured, nested.value));
-}
 
-TEST_F(StringConversion, FailedConversionFailsTheCall) {
-  value_arena arena;
-  encoded_row row;
-  ASSERT_EQ(append_value(row, QV_CHAR_PTR, arena.string("caf\xC3\xA9")), 0);
-  decoded_value untouched;
   untouched.value.val_uint64 = 0x1234;
-  EXPECT_EQ(decode_slot(row, 0, QV_CHAR_PTR, untouched, p_to_ascii_),
+  EXPECT_EQ(decode_slot(row, 0, QV_CHAR_PTR, untouched, p_to_ascii),
             QV_PMSG_RESULT_CONVERSION_FAILED);
   EXPECT_EQ(untouched.value.val_uint64, 0x1234u);
-
-  // ISO-8859-1 maps every byte, so a failing encode needs a code set with
-  // holes: ASCII. A nested string fails the whole value.
-  cu_iconv_t *p_from_ascii = nullptr;
-  ASSERT_EQ(cu_iconv_open_1("ANSI_X3.4-1968", CU_ICONV_TO_STORED, &p_from_ascii), 0);
   encoded_row failed;
   EXPECT_EQ(append_value(failed, QV_CHAR_PTR_ARRAY,
                          arena.array({arena.string("ok"), arena.string("caf\xE9")}), p_from_ascii),
             QV_PMSG_RESULT_CONVERSION_FAILED);
   EXPECT_EQ(failed.used, 0u);
-  cu_iconv_close_1(p_from_ascii);
+  for (cu_iconv_t *p_handle : p_handles) {
+    cu_iconv_close_1(p_handle);
+  }
 }
 
 }  // namespace

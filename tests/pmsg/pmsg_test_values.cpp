@@ -54,30 +54,34 @@ void *value_arena::allocate(size_t bytes) {
   return blocks_.back();
 }
 
-qv_value_t value_arena::string(std::string_view text) {
-  auto *p_text = static_cast<char *>(allocate(text.size() + 1));
-  std::memcpy(p_text, text.data(), text.size());
+namespace {
+
+// A value holding a pointer: every pointer member of the union shares the
+// same eight bytes.
+qv_value_t pointing_to(void *p_data) {
   qv_value_t value{};
-  value.ptr_char = p_text;
+  value.ptr_char = static_cast<char *>(p_data);
   return value;
+}
+
+}  // namespace
+
+qv_value_t value_arena::string(std::string_view text) {
+  return pointing_to(std::memcpy(allocate(text.size() + 1), text.data(), text.size()));
 }
 
 qv_value_t value_arena::binary(std::string_view bytes) {
   auto *p_binary = static_cast<qv_binary_t *>(allocate(sizeof(qv_binary_t) + bytes.size()));
   p_binary->length = static_cast<uint32_t>(bytes.size());
   std::memcpy(p_binary->data, bytes.data(), bytes.size());
-  qv_value_t value{};
-  value.ptr_binary = p_binary;
-  return value;
+  return pointing_to(p_binary);
 }
 
 qv_value_t value_arena::handle(uint32_t header, uint32_t id1, uint32_t id2, uint32_t id3,
                                uint32_t id4) {
   auto *p_handle = static_cast<qv_resource_handle_t *>(allocate(sizeof(qv_resource_handle_t)));
   *p_handle = {header, {id1, id2, id3, id4}};
-  qv_value_t value{};
-  value.ptr_rsrc_handle = p_handle;
-  return value;
+  return pointing_to(p_handle);
 }
 
 qv_value_t value_arena::structured(const std::vector<std::pair<int32_t, qv_value_t>> &elements) {
@@ -85,12 +89,9 @@ qv_value_t value_arena::structured(const std::vector<std::pair<int32_t, qv_value
       sizeof(qv_structured_data_t) + elements.size() * sizeof(qv_structured_data_element_t)));
   p_structured->element_count = static_cast<uint32_t>(elements.size());
   for (size_t index = 0; index < elements.size(); ++index) {
-    p_structured->elements[index].data_type = as_type(elements[index].first);
-    p_structured->elements[index].value = elements[index].second;
+    p_structured->elements[index] = {as_type(elements[index].first), 0, elements[index].second};
   }
-  qv_value_t value{};
-  value.ptr_sd = p_structured;
-  return value;
+  return pointing_to(p_structured);
 }
 
 qv_value_t value_arena::array(const std::vector<qv_value_t> &elements) {
@@ -98,26 +99,21 @@ qv_value_t value_arena::array(const std::vector<qv_value_t> &elements) {
       allocate(sizeof(qv_array_t) + elements.size() * sizeof(qv_value_t)));
   p_array->element_count = static_cast<uint32_t>(elements.size());
   std::copy(elements.begin(), elements.end(), p_array->elements);
-  qv_value_t value{};
-  value.ptr_array = p_array;
-  return value;
+  return pointing_to(p_array);
 }
 
 qv_value_t value_arena::byte_string(const std::vector<field> &fields) {
   std::string packed;
   for (const field &one : fields) {
-    int16_t length = static_cast<int16_t>(one.data.size());
+    const auto length = static_cast<int16_t>(one.data.size());
     packed.append(reinterpret_cast<const char *>(&length), 2);
-    packed.push_back(static_cast<char>(one.type));
-    packed.push_back(static_cast<char>(one.serial));
+    packed += {static_cast<char>(one.type), static_cast<char>(one.serial)};
     packed += one.data;
   }
   auto *p_byte_string = static_cast<qv_sbs_t *>(allocate(sizeof(qv_sbs_t) + packed.size()));
   p_byte_string->length = static_cast<int32_t>(packed.size());
   std::memcpy(p_byte_string->fields, packed.data(), packed.size());
-  qv_value_t value{};
-  value.ptr_sbs = p_byte_string;
-  return value;
+  return pointing_to(p_byte_string);
 }
 
 qv_value_t number32(uint32_t bits) {
@@ -292,12 +288,17 @@ int32_t append_value(encoded_row &row, int32_t type, const qv_value_t &value,
                      cu_iconv_t *p_conversion) {
   row.slots.emplace_back();
   for (;;) {
-    int32_t result = qv_pmsg_build_conv_protocol_value_1(
+    std::memset(&row.slots.back(), 0x5C, sizeof(qv_pmsg_value_t));
+    uint32_t offset = row.used;
+    const int32_t result = qv_pmsg_build_conv_protocol_value_1(
         p_conversion, 0, as_type(type), &value, &row.slots.back(), row.area.data(),
-        static_cast<uint32_t>(row.area.size()), &row.used);
+        static_cast<uint32_t>(row.area.size()), &offset);
     if (result != QV_PMSG_RESULT_NO_ROOM) {
+      row.used = offset;
       return result;
     }
+    EXPECT_EQ(offset, row.used) << "NO_ROOM moved the offset, type " << type;
+    EXPECT_EQ(row.slots.back().val_uint64, 0x5C5C5C5C5C5C5C5Cull) << "NO_ROOM wrote the slot";
     row.area.resize(row.area.empty() ? 16 : row.area.size() * 2);
   }
 }

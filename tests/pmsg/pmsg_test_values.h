@@ -71,8 +71,9 @@ struct encoded_row {
   uint32_t used = 0;  // the running offset
 };
 
-// Appends a value the way the registry does: on NO_ROOM the area is doubled
-// and the call repeated. Returns the final result code.
+// Appends a value the way the registry does: on NO_ROOM, which must leave
+// the slot and the offset as they were, the area is doubled and the call
+// repeated. Returns the final result code.
 int32_t append_value(encoded_row &row, int32_t type, const qv_value_t &value,
                      cu_iconv_t *p_conversion = nullptr);
 

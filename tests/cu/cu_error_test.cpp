@@ -49,6 +49,8 @@ TEST(ErrorInformation, PositionalInsertsAreFilledFromTheArguments) {
   EXPECT_EQ(error.text,
             "2605-010 The write system call unexpectedly returned an errno of 28 to the "
             "sr_i_write function near line 212 of file sr/sr_i_files, version 1.2.\n");
+  EXPECT_EQ(cu_get_error_1(nullptr), CU_RESULT_NULL_ARGUMENT);
+  cu_rel_error_1(nullptr);  // must be harmless
 }
 
 TEST(ErrorInformation, EachThreadSeesOnlyItsOwnError) {
@@ -68,36 +70,28 @@ TEST(ErrorInformation, EachThreadSeesOnlyItsOwnError) {
   EXPECT_EQ(mine.text, "main thread here\n");
 }
 
-TEST(ErrorInformation, CatalogTextIsPreferredAndMayReorderInserts) {
-  catalog_path path(CU_TEST_CATALOG_DIR);
-  cu_set_error_1(11, 0, "cu_test.cat", 1, 1, "default: %1$s returned %2$d\n", "iconv", -1);
-  EXPECT_EQ(read_last_error().text, "CATALOG: iconv returned -1\n");
-  cu_set_error_1(11, 0, "cu_test.cat", 1, 2, "default: %1$s returned %2$d\n", "iconv", 4);
-  EXPECT_EQ(read_last_error().text, "CATALOG reordered: 4 came from iconv\n");
-}
-
-TEST(ErrorInformation, FaultyCatalogTextFallsBackToTheDefault) {
-  catalog_path path(CU_TEST_CATALOG_DIR);
-  // The translation reads argument 1 as a number where the default has a string.
-  cu_set_error_1(102, 0, "cu_test.cat", 1, 3, "default path %1$s\n", "/a b");
-  EXPECT_EQ(read_last_error().text, "default path /a b\n");
-  // The translation names an argument the default does not have.
-  cu_set_error_1(102, 0, "cu_test.cat", 1, 4, "default %1$s %2$s\n", "x", "y");
-  EXPECT_EQ(read_last_error().text, "default x y\n");
-  // A message the catalog lacks.
-  cu_set_error_1(102, 0, "cu_test.cat", 1, 9, "default only\n");
-  EXPECT_EQ(read_last_error().text, "default only\n");
-}
-
-TEST(ErrorInformation, MissingCatalogGivesTheDefaultText) {
+// The catalog's text is preferred and may reorder the inserts; a faulty
+// translation, a message the catalog lacks or a missing catalog give the
+// default text.
+TEST(ErrorInformation, CatalogTextIsPreferredUnlessFaultyOrMissing) {
+  {
+    catalog_path path(CU_TEST_CATALOG_DIR);
+    cu_set_error_1(11, 0, "cu_test.cat", 1, 1, "default: %1$s returned %2$d\n", "iconv", -1);
+    EXPECT_EQ(read_last_error().text, "CATALOG: iconv returned -1\n");
+    cu_set_error_1(11, 0, "cu_test.cat", 1, 2, "default: %1$s returned %2$d\n", "iconv", 4);
+    EXPECT_EQ(read_last_error().text, "CATALOG reordered: 4 came from iconv\n");
+    // The translation reads argument 1 as a number where the default has a string.
+    cu_set_error_1(102, 0, "cu_test.cat", 1, 3, "default path %1$s\n", "/a b");
+    EXPECT_EQ(read_last_error().text, "default path /a b\n");
+    // The translation names an argument the default does not have.
+    cu_set_error_1(102, 0, "cu_test.cat", 1, 4, "default %1$s %2$s\n", "x", "y");
+    EXPECT_EQ(read_last_error().text, "default x y\n");
+    cu_set_error_1(102, 0, "cu_test.cat", 1, 9, "default only\n");
+    EXPECT_EQ(read_last_error().text, "default only\n");
+  }
   catalog_path path("/nonexistent-directory");
   cu_set_error_1(11, 0, "cu_test.cat", 1, 1, "default: %1$s returned %2$d\n", "iconv", 3);
   EXPECT_EQ(read_last_error().text, "default: iconv returned 3\n");
-}
-
-TEST(ErrorInformation, NullArgumentsAreRefused) {
-  EXPECT_EQ(cu_get_error_1(nullptr), CU_RESULT_NULL_ARGUMENT);
-  cu_rel_error_1(nullptr);  // must be harmless
 }
 
 // The formatter through its internal seam, for shapes of text the messages
@@ -110,25 +104,21 @@ std::string format(const char *p_preferred, const char *p_default, ...) {
   return text;
 }
 
-TEST(MessageFormat, SequentialConversionsAndLengthModifiers) {
+TEST(MessageFormat, ConversionsLengthModifiersNullAndLongStrings) {
   EXPECT_EQ(format(nullptr, "%s=%lld (%5.1f) %u%%", "key", -5LL, 2.25, 7u), "key=-5 (  2.2) 7%");
   EXPECT_EQ(format(nullptr, "%2$s %1$llu", 18446744073709551615ULL, "max"),
             "max 18446744073709551615");
-}
-
-TEST(MessageFormat, NullStringAndLongStringArePrinted) {
   EXPECT_EQ(format(nullptr, "[%1$s]", static_cast<const char *>(nullptr)), "[(null)]");
   const std::string long_text(2000, 'x');
   EXPECT_EQ(format(nullptr, "%1$s!", long_text.c_str()), long_text + "!");
 }
 
+// A "*" width, a gap in the positions and clashing types all make the
+// argument list unknowable: the text is copied and no argument is read.
 TEST(MessageFormat, UnusableDefaultTextIsCopiedWithoutReadingArguments) {
-  // A "*" width, a gap in the positions and clashing types all make the
-  // argument list unknowable: no argument may be read.
-  EXPECT_EQ(format(nullptr, "width %*d"), "width %*d");
-  EXPECT_EQ(format(nullptr, "gap %1$s %3$s"), "gap %1$s %3$s");
-  EXPECT_EQ(format(nullptr, "clash %1$s %1$d"), "clash %1$s %1$d");
-  EXPECT_EQ(format(nullptr, "mixed %1$s %s"), "mixed %1$s %s");
+  for (const char *p_text : {"width %*d", "gap %1$s %3$s", "clash %1$s %1$d", "mixed %1$s %s"}) {
+    EXPECT_EQ(format(nullptr, p_text), p_text);
+  }
 }
 
 }  // namespace

@@ -42,16 +42,13 @@ bool locale_keeps_utf8_unchanged() {
 
 const std::string Utf8_Text = "caf\xc3\xa9 \xe2\x82\xac \xf0\x9f\x98\x80";  // café € 😀
 
-TEST(CodeSetConversion, CLocaleKeepsUtf8BytesUnchanged) {
+TEST(CodeSetConversion, CAndUtf8LocalesKeepUtf8BytesUnchanged) {
   ASSERT_NE(std::setlocale(LC_CTYPE, "C"), nullptr);
   EXPECT_TRUE(locale_keeps_utf8_unchanged());
   const converted stored =
       convert("ANSI_X3.4-1968", CU_ICONV_TO_STORED | CU_ICONV_UNCHANGED, Utf8_Text);
   EXPECT_EQ(stored.result, CU_RESULT_OK);
   EXPECT_EQ(stored.text, Utf8_Text);
-}
-
-TEST(CodeSetConversion, Utf8LocaleKeepsBytesUnchanged) {
   if (std::setlocale(LC_CTYPE, "C.UTF-8") == nullptr) {
     GTEST_SKIP() << "no C.UTF-8 locale on this machine";
   }
@@ -78,7 +75,8 @@ TEST(CodeSetConversion, LongStringsGrowTheOutput) {
   EXPECT_EQ(stored.text.substr(19998), "\xc3\xa9");
 }
 
-TEST(CodeSetConversion, BadArgumentsAreRefused) {
+// Bad arguments are refused; a null handle copies byte for byte.
+TEST(CodeSetConversion, BadArgumentsAreRefusedAndANullHandleCopies) {
   cu_iconv_t *p_handle = nullptr;
   EXPECT_EQ(cu_iconv_open_1("NO-SUCH-CODE-SET", 0, &p_handle), CU_RESULT_UNSUPPORTED_CODE_SET);
   EXPECT_EQ(cu_iconv_open_1("UTF-8", 2, &p_handle), CU_RESULT_BAD_FLAGS);
@@ -87,10 +85,6 @@ TEST(CodeSetConversion, BadArgumentsAreRefused) {
   EXPECT_EQ(cu_iconv_str_1(nullptr, nullptr, &p_out), CU_RESULT_NULL_ARGUMENT);
   EXPECT_EQ(cu_get_locale_info_1(nullptr), CU_RESULT_NULL_ARGUMENT);
   EXPECT_EQ(cu_utf8_is_not_modified_1(nullptr), 0);
-}
-
-TEST(CodeSetConversion, NullHandleCopiesByteForByte) {
-  char *p_out = nullptr;
   ASSERT_EQ(cu_iconv_str_1(nullptr, Utf8_Text.c_str(), &p_out), CU_RESULT_OK);
   EXPECT_EQ(std::string(p_out), Utf8_Text);
   std::free(p_out);

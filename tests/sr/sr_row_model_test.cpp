@@ -1,8 +1,10 @@
-// A randomised model test of rows and transactions: thousands of random
-// adds, sets, deletes, applies, commits and aborts run against a table and
-// against a plain reference model of its committed and applied views; after
-// every step each key reads back as the model says in both views, and the
-// table's indexes agree with each other.
+// Rows and transactions of transient tables. A randomised model test runs
+// thousands of random adds, sets, deletes, applies, commits and aborts
+// against a table and a plain reference model of its committed and applied
+// views: after every step each key reads back as the model says in both
+// views, the packed and fixed indexes name each other, and an abort gives
+// back every record the transaction took. Beside it: change counters, and
+// implicitly controlled tables committing every change.
 
 #include <gtest/gtest.h>
 
@@ -10,8 +12,10 @@
 #include <map>
 #include <optional>
 #include <random>
+#include <set>
 #include <string>
 
+#include "rows/sr_i_transaction.h"
 #include "sr_row_test_support.h"
 
 namespace {
@@ -28,8 +32,40 @@ struct row_values {
 struct reference_model {
   std::map<uint32_t, row_values> committed, applied;
   bool ready_for_commit = false;
-  bool changed = false;  // something pending or applied since the last commit or abort
+  bool changed = false;        // something pending or applied since the last commit or abort
+  uint64_t settled_bytes = 0;  // the records held after the last commit or abort
 };
+
+// Every packed position names a row index entry that names it back; with
+// nothing pending (`settled`) the packed rows are exactly the rows with an
+// applied or committed record.
+void expect_consistent_indexes(sr_opaque_handle_t table, bool settled) {
+  const sr_i_table_t *p = object(table);
+  std::set<uint32_t> packed;
+  for (uint32_t at = 0; at < p->total_applied_rows; ++at) {
+    const uint32_t fixed = p->p_rows_packed_index[at];
+    ASSERT_LT(fixed, p->maximum_rows);
+    ASSERT_EQ(p->p_rows_fixed_index[fixed].packed_index, at);
+    ASSERT_TRUE(packed.insert(fixed).second) << "row listed twice: " << fixed;
+  }
+  for (uint32_t fixed = 0; settled && fixed < p->maximum_rows; ++fixed) {
+    const sr_i_index_entry_t &entry = p->p_rows_fixed_index[fixed];
+    const bool holds_row = entry.p_applied != nullptr || entry.p_committed != nullptr;
+    ASSERT_EQ(holds_row, packed.count(fixed) == 1) << fixed;
+  }
+}
+
+// The bytes of the records the table's pool hands out, their headers
+// included: what the free records and the block headers leave of the
+// pool's used bytes.
+uint64_t allocated_bytes(sr_opaque_handle_t table) {
+  const sr_i_record_buffer_pool_t &pool = object(table)->record_buffer_pool;
+  uint64_t bytes = pool.used_bytes - uint64_t{pool.total_blocks} * Sr_Record_Buffer_Header_Length;
+  for (const sr_i_record_metadata_t *p = pool.p_free_chain; p != nullptr; p = p->p_next) {
+    bytes -= Sr_Record_Header_Length;
+  }
+  return bytes;
+}
 
 constexpr uint32_t Total_Keys = 12;
 
@@ -108,10 +144,12 @@ class RowModel : public RowTables {
     ASSERT_EQ(p->total_applied_rows - p->applied_deletions, model.applied.size()) << step;
     if (!model.changed) {
       ASSERT_EQ(p->total_committed_rows, model.committed.size()) << step;
+      ASSERT_EQ(p->ready_for_commit, Sr_Nothing_Applied) << step;
+      ASSERT_EQ(p->applied_deletions, 0u) << step;
+      ASSERT_EQ(p->p_rows_change_list, nullptr) << step;
+      ASSERT_EQ(p->p_delete_rows_change_list, nullptr) << step;
     }
-    for (uint32_t at = 0; at < p->total_applied_rows; ++at) {
-      ASSERT_EQ(p->p_rows_fixed_index[p->p_rows_packed_index[at]].packed_index, at) << step;
-    }
+    ASSERT_NO_FATAL_FAILURE(expect_consistent_indexes(table_, !model.changed)) << step;
   }
 
   sr_opaque_handle_t table_ = nullptr;
@@ -131,6 +169,8 @@ TEST_F(RowModel, RandomTransactionsMatchTheReferenceModel) {
   };
 
   reference_model model;
+  model.settled_bytes = allocated_bytes(table_);
+  const uint64_t empty_bytes = model.settled_bytes;
   for (int step = 0; step < 6000; ++step) {
     const uint32_t key = pick(Total_Keys);
     const uint32_t operation = pick(100);
@@ -206,18 +246,59 @@ TEST_F(RowModel, RandomTransactionsMatchTheReferenceModel) {
         model.committed = model.applied;
         model.ready_for_commit = false;
         model.changed = false;
+        model.settled_bytes = allocated_bytes(table_);
       }
     } else {
       ASSERT_EQ(sr_abort_1(table_), 0) << "abort, step " << step;
+      ASSERT_EQ(allocated_bytes(table_), model.settled_bytes) << "abort, step " << step;
       model.applied = model.committed;
       model.ready_for_commit = false;
       model.changed = false;
     }
     expect_table_matches(model, step);
+    if (model.committed.empty() && !model.changed) {
+      ASSERT_EQ(allocated_bytes(table_), empty_bytes) << "step " << step;
+    }
     if (HasFatalFailure()) {
       return;
     }
   }
+}
+
+using Transactions = RowTables;
+
+TEST_F(Transactions, TheCallersCounterCountsOnlyOnExplicitTables) {
+  sr_opaque_handle_t explicit_table = create_numbered("/tx/counter/explicit", Explicit);
+  EXPECT_EQ(object(explicit_table)->change_counter, 1u);
+  ASSERT_EQ(sr_apply_1(explicit_table, 42), 0);
+  ASSERT_EQ(sr_commit_1(explicit_table), 0);
+  EXPECT_EQ(object(explicit_table)->change_counter, 42u);
+  ASSERT_EQ(sr_apply_1(explicit_table, 0), 0);
+  ASSERT_EQ(sr_abort_1(explicit_table), 0);
+  EXPECT_EQ(object(explicit_table)->change_counter, 42u);  // abort keeps the committed one
+  apply_commit(explicit_table);  // with nothing pending the counter still moves
+  EXPECT_EQ(object(explicit_table)->change_counter, 43u);
+
+  sr_opaque_handle_t implicit_table = create_numbered("/tx/counter/implicit", Implicit);
+  ASSERT_EQ(add_numbered(implicit_table, 1, 1), 0);
+  EXPECT_EQ(object(implicit_table)->change_counter, 2u);
+  ASSERT_EQ(sr_apply_1(implicit_table, 99), 0);
+  ASSERT_EQ(sr_commit_1(implicit_table), 0);
+  EXPECT_EQ(object(implicit_table)->change_counter, 3u);
+}
+
+TEST_F(Transactions, ImplicitTablesCommitEveryChange) {
+  sr_opaque_handle_t table = create_named_counts("/tx/implicit", Implicit);
+  ASSERT_EQ(add_named(table, "a", 1), 0);
+  EXPECT_EQ(count_of(table, "a", 0), 1);
+  qv_value_t two = int32_value(2);
+  ASSERT_EQ(sr_set_field_by_key_1(table, string_value("a"), "count", &two), 0);
+  EXPECT_EQ(count_of(table, "a", 0), 2);
+  EXPECT_EQ(state_of(table, 0), SR_ROW_STATE_COMMITTED);
+  EXPECT_EQ(object(table)->p_rows_change_list, nullptr);
+  ASSERT_EQ(sr_delete_row_by_index_1(table, 0), 0);
+  EXPECT_EQ(count_of(table, "a", 0), -1);
+  EXPECT_EQ(object(table)->total_committed_rows, 0u);
 }
 
 }  // namespace

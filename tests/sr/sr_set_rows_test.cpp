@@ -1,12 +1,11 @@
 // Setting values of existing rows through the exported calls: the order of
 // the checks and the row left as it was after each refusal; the row's state;
 // columns reset to their defaults when not named; long values; key changes
-// and the key hash table; the record pool keeping its size over many sets.
+// and the key hash table. (That a set gives back the record it replaces is
+// checked by the row model test, after every abort.)
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
-#include <cstdio>
 #include <cstdlib>
 #include <memory>
 #include <string>
@@ -204,39 +203,6 @@ TEST_F(SetRows, EachSetRebuildsTheRecordFromTheRowAndTheNamedValues) {
   EXPECT_EQ(text_of(row, "name", 0), long_name.substr(1));
   EXPECT_EQ(set(row, {{"name", text("short")}}), 0);
   expect_row("short", 12, "fresh", 5);
-}
-
-/* Equal-size sets may leave the pool's free space split one way or another
- * (one record header more or less), but a record not given back would grow
- * it by a whole record each time. */
-TEST_F(SetRows, RepeatedSetsGiveTheirRecordsBack) {
-  const uint32_t row = add(1, "name-00", 10);
-  commit();
-  char name[16];
-  // The most the pool holds over 59 sets of the name.
-  auto most_over_sets = [&](const char *p_prefix, bool commit_each) {
-    uint32_t most = 0;
-    for (int at = 1; at < 60; ++at) {
-      std::snprintf(name, sizeof name, "%s-%02d", p_prefix, at);
-      EXPECT_EQ(set(row, {{"name", text(name)}}), 0);
-      if (commit_each) {
-        commit();
-      }
-      most = std::max(most, used_bytes());
-    }
-    return most;
-  };
-  const uint32_t committed = used_bytes();
-  EXPECT_LE(most_over_sets("name", true), committed + Sr_Record_Header_Length);
-  EXPECT_EQ(text_of(row, "name", 0), name);
-  // Sets on a row changed already replace its pending record.
-  const uint32_t before_sets = used_bytes();
-  ASSERT_EQ(set(row, {{"name", text("pending-00")}}), 0);
-  const uint32_t pending = used_bytes();
-  EXPECT_LE(most_over_sets("pending", false), pending + Sr_Record_Header_Length);
-  EXPECT_EQ(text_of(row), name);
-  EXPECT_EQ(sr_abort_1(table_), 0);
-  EXPECT_LE(used_bytes(), before_sets + Sr_Record_Header_Length);
 }
 
 TEST_F(SetRows, EveryWayOfNamingTheRowReachesIt) {

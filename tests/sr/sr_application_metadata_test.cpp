@@ -1,23 +1,37 @@
 // Application metadata: the container keeps its elements sorted and each
 // element's applied and committed values apart until commit or abort, and
 // frees every block exactly once (AddressSanitizer's leak checker holds the
-// tests to that); the exported get and set read and change element 0 of a
-// table under the table's view and access rules.
+// tests to that); the commit record carries the container and the change
+// counter, byte for byte, and refuses records that do not hold together; the
+// exported get and set read and change element 0 of a table under the
+// table's view and access rules.
 
 #include <gtest/gtest.h>
 
 #include <cstdarg>
 #include <cstdlib>
+#include <cstring>
+#include <memory>
 #include <string>
 #include <vector>
 
 #include "schema/sr_i_application_metadata.h"
+#include "storage/sr_i_commit_record.h"
 #include "tables/sr_i_table.h"
 
 namespace {
 
 constexpr uint32_t Committed_View = 0;
 constexpr uint32_t Applied_View = 1;
+
+// A container that frees itself.
+using container =
+    std::unique_ptr<sr_i_application_metadata_t, decltype(&sr_i_free_application_metadata)>;
+container new_container(uint32_t elements = 1) {
+  sr_i_application_metadata_t *p_container = nullptr;
+  EXPECT_EQ(sr_i_allocate_application_metadata_buffer(elements, &p_container), 0);
+  return {p_container, &sr_i_free_application_metadata};
+}
 
 // The bytes of the element in the view, or "#<code>" when the get fails.
 std::string read(const sr_i_application_metadata_t *p_container, uint32_t type, uint32_t view) {
@@ -65,36 +79,32 @@ std::string views_of(const sr_i_application_metadata_t *p_container) {
 }
 
 // One element in each state: 1 committed, 2 changed, 3 added, 4 deleted.
-sr_i_application_metadata_t *container_in_every_state() {
-  sr_i_application_metadata_t *p_container = nullptr;
-  EXPECT_EQ(sr_i_allocate_application_metadata_buffer(1, &p_container), 0);
+container container_in_every_state() {
+  container metadata = new_container();
   for (const uint32_t type : {4u, 2u, 1u}) {
-    EXPECT_EQ(add(p_container, type, "c" + std::to_string(type)), 0);
+    EXPECT_EQ(add(metadata.get(), type, "c" + std::to_string(type)), 0);
   }
-  sr_i_commit_application_metadata_buffer_updates(p_container);
-  EXPECT_EQ(sr_i_set_application_metadata_element(p_container, 2, 2, "a2"), 0);
-  EXPECT_EQ(add(p_container, 3, "a3"), 0);
-  EXPECT_EQ(sr_i_delete_application_metadata_element(p_container, 4), 0);
-  EXPECT_EQ(views_of(p_container), "c1/c1 c2/a2 #202/a3 c4/#204 #202/#202");
-  return p_container;
+  sr_i_commit_application_metadata_buffer_updates(metadata.get());
+  EXPECT_EQ(sr_i_set_application_metadata_element(metadata.get(), 2, 2, "a2"), 0);
+  EXPECT_EQ(add(metadata.get(), 3, "a3"), 0);
+  EXPECT_EQ(sr_i_delete_application_metadata_element(metadata.get(), 4), 0);
+  EXPECT_EQ(views_of(metadata.get()), "c1/c1 c2/a2 #202/a3 c4/#204 #202/#202");
+  return metadata;
 }
 
 TEST(MetadataContainer, CommitAndAbortSettleEveryState) {
-  sr_i_application_metadata_t *p_committed = container_in_every_state();
-  sr_i_application_metadata_t *p_aborted = container_in_every_state();
-  EXPECT_EQ(sr_i_commit_application_metadata_buffer_updates(p_committed), 0);
-  EXPECT_EQ(sr_i_abort_application_metadata_buffer_updates(p_aborted), 0);
-  EXPECT_EQ(views_of(p_committed), "c1/c1 a2/a2 a3/a3 #202/#202 #202/#202");
-  EXPECT_EQ(views_of(p_aborted), "c1/c1 c2/c2 #202/#202 c4/c4 #202/#202");
-  EXPECT_EQ(p_committed->total_elements, 3u);
-  EXPECT_EQ(p_aborted->total_elements, 3u);
-  sr_i_free_application_metadata(p_committed);
-  sr_i_free_application_metadata(p_aborted);
+  container committed = container_in_every_state(), aborted = container_in_every_state();
+  EXPECT_EQ(sr_i_commit_application_metadata_buffer_updates(committed.get()), 0);
+  EXPECT_EQ(sr_i_abort_application_metadata_buffer_updates(aborted.get()), 0);
+  EXPECT_EQ(views_of(committed.get()), "c1/c1 a2/a2 a3/a3 #202/#202 #202/#202");
+  EXPECT_EQ(views_of(aborted.get()), "c1/c1 c2/c2 #202/#202 c4/c4 #202/#202");
+  EXPECT_EQ(committed->total_elements, 3u);
+  EXPECT_EQ(aborted->total_elements, 3u);
 }
 
 TEST(MetadataContainer, AddKeepsTypesSortedAndUniqueAndDoublesTheArray) {
-  sr_i_application_metadata_t *p_container = nullptr;
-  ASSERT_EQ(sr_i_allocate_application_metadata_buffer(1, &p_container), 0);
+  container metadata = new_container();
+  sr_i_application_metadata_t *p_container = metadata.get();
   for (const uint32_t type : {5u, 1u, 9u, 3u, 7u}) {
     ASSERT_EQ(add(p_container, type, std::to_string(type)), 0);
   }
@@ -105,12 +115,11 @@ TEST(MetadataContainer, AddKeepsTypesSortedAndUniqueAndDoublesTheArray) {
   EXPECT_EQ(add(p_container, 7, "again"), SR_E_DUPLICATE_KEY);
   EXPECT_EQ(sr_i_set_application_metadata_element(p_container, 4, 1, "x"), SR_E_NO_ROW_FOR_KEY);
   EXPECT_EQ(p_container->total_elements, 5u);
-  sr_i_free_application_metadata(p_container);
 }
 
 TEST(MetadataContainer, SetsBeforeCommitReplaceOnlyTheAppliedValue) {
-  sr_i_application_metadata_t *p_container = nullptr;
-  ASSERT_EQ(sr_i_allocate_application_metadata_buffer(1, &p_container), 0);
+  container metadata = new_container();
+  sr_i_application_metadata_t *p_container = metadata.get();
   ASSERT_EQ(add(p_container, 0, "old"), 0);
   sr_i_commit_application_metadata_buffer_updates(p_container);
   const qv_binary_t *p_committed = p_container->p_index[0].p_committed;
@@ -132,18 +141,93 @@ TEST(MetadataContainer, SetsBeforeCommitReplaceOnlyTheAppliedValue) {
   ASSERT_EQ(sr_i_get_application_metadata(p_container, Applied_View, 2, &length, &p_data), 0);
   EXPECT_EQ(std::string(static_cast<char *>(p_data), length), "two");
   std::free(p_data);
-  sr_i_free_application_metadata(p_container);
 }
 
 TEST(MetadataContainer, DuplicateCopiesTheCommittedViewAndSkipsUncommittedAdditions) {
-  sr_i_application_metadata_t *p_source = container_in_every_state();
+  container source = container_in_every_state();
   sr_i_application_metadata_t *p_copy = nullptr;
-  ASSERT_EQ(sr_i_duplicate_application_metadata_buffer(p_source, &p_copy), 0);
-  EXPECT_EQ(p_copy->max_elements, p_source->max_elements);
-  sr_i_free_application_metadata(p_source);  // the copy must own its blocks
+  ASSERT_EQ(sr_i_duplicate_application_metadata_buffer(source.get(), &p_copy), 0);
+  const container copy(p_copy, &sr_i_free_application_metadata);
+  EXPECT_EQ(copy->max_elements, source->max_elements);
+  source.reset();  // the copy must own its blocks
+  EXPECT_EQ(views_of(copy.get()), "c1/c1 c2/c2 #202/#202 c4/c4 #202/#202");
+}
 
-  EXPECT_EQ(views_of(p_copy), "c1/c1 c2/c2 #202/#202 c4/c4 #202/#202");
-  sr_i_free_application_metadata(p_copy);
+// ---- The commit record ----
+
+uint32_t word_at(const std::vector<unsigned char> &record, size_t offset) {
+  uint32_t word;
+  std::memcpy(&word, record.data() + offset, 4);
+  return word;
+}
+
+// Without metadata the record is its 24-byte header and the counter; with
+// it, each element travels with its newest value, applied or committed.
+TEST(CommitRecord, ItsBytesCarryTheCounterAndTheNewestValues) {
+  std::vector<unsigned char> record;
+  ASSERT_EQ(sr_i_create_commit_record(new_container(2).get(), 0x1122334455667788ull, record), 0);
+  ASSERT_EQ(record.size(), 24u);
+  EXPECT_EQ(word_at(record, 0), 24u);
+  EXPECT_EQ(word_at(record, 4), 0u);
+  EXPECT_EQ(word_at(record, 8), 0xFFFFFFFFu);
+  EXPECT_EQ(word_at(record, 12), 8u);
+  EXPECT_EQ(word_at(record, 16) + (uint64_t{word_at(record, 20)} << 32), 0x1122334455667788ull);
+
+  container source = new_container(2);
+  ASSERT_EQ(sr_i_set_application_metadata(source.get(), 7, 3, "old"), 0);
+  ASSERT_EQ(sr_i_commit_application_metadata_buffer_updates(source.get()), 0);
+  ASSERT_EQ(sr_i_set_application_metadata(source.get(), 7, 5, "newer"), 0);
+  ASSERT_EQ(sr_i_set_application_metadata(source.get(), 2, 0, nullptr), 0);
+  ASSERT_EQ(sr_i_create_commit_record(source.get(), 9, record), 0);
+  EXPECT_EQ(word_at(record, 12), 33u);  // 8 + 4 + (8 + 0) + (8 + 5)
+  EXPECT_EQ(record.size(), 16u + 33u);
+  container loaded = new_container(2);
+  uint64_t counter = 0;
+  ASSERT_EQ(sr_i_open_commit_record(record, loaded.get(), &counter), 0);
+  EXPECT_EQ(counter, 9u);
+  EXPECT_EQ(read(loaded.get(), 7, Committed_View), "newer");
+  EXPECT_EQ(read(loaded.get(), 2, Committed_View), "");
+}
+
+TEST(CommitRecord, RecordsThatDoNotHoldTogetherAreUnreadable) {
+  std::vector<unsigned char> good;
+  container source = new_container(2);
+  ASSERT_EQ(sr_i_set_application_metadata(source.get(), 1, 4, "data"), 0);
+  ASSERT_EQ(sr_i_create_commit_record(source.get(), 3, good), 0);
+
+  auto with_word = [&](size_t offset, uint32_t word) {
+    std::vector<unsigned char> bad = good;
+    std::memcpy(bad.data() + offset, &word, 4);
+    return bad;
+  };
+  const std::vector<std::vector<unsigned char>> hostile = {
+      std::vector<unsigned char>(good.begin(), good.begin() + 20),  // shorter than a header
+      std::vector<unsigned char>(good.begin(), good.end() - 1),     // lengths disagree
+      with_word(12, 0xFFFFFFF0u),                                   // body length wraps
+      with_word(24, 2),                                             // more elements than bytes
+      with_word(32, 0xFFFFFFFFu),                                   // element past the end
+      with_word(32, 1),                                             // bytes left over
+  };
+  for (size_t at = 0; at < hostile.size(); ++at) {
+    container loaded = new_container(2);
+    uint64_t counter = 77;
+    EXPECT_EQ(sr_i_open_commit_record(hostile[at], loaded.get(), &counter), SR_E_TABLE_UNREADABLE)
+        << at;
+    EXPECT_EQ(counter, 77u) << at;
+    EXPECT_EQ(loaded->total_elements, 0u) << at;
+  }
+}
+
+TEST(CommitRecord, ItsTypeWordNeverStraddlesADiskSector) {
+  for (uint32_t offset = 0; offset < 3 * 512; ++offset) {
+    const uint32_t start = offset + sr_i_commit_record_padding(offset);
+    const uint32_t type_word = start + 8;
+    EXPECT_EQ(type_word / 512, (type_word + 3) / 512) << offset;
+  }
+  EXPECT_EQ(sr_i_commit_record_padding(500), 0u);
+  EXPECT_EQ(sr_i_commit_record_padding(501), 12u);
+  EXPECT_EQ(sr_i_commit_record_padding(503), 12u);
+  EXPECT_EQ(sr_i_commit_record_padding(504), 0u);
 }
 
 // ---- The exported calls, on a table object built by hand ----
@@ -188,22 +272,15 @@ class ApplicationMetadataCalls : public ::testing::Test {
   sr_i_table_t *p_table_ = nullptr;
 };
 
-TEST_F(ApplicationMetadataCalls, SetIsCommittedByCommitOrAtOnceOnAnImplicitTable) {
-  sr_i_application_metadata_t *p_container = p_table_->p_application_metadata;
+// The set is applied, not committed, on an explicitly controlled table
+// (what commit and abort then do is the container's part, above), and
+// committed at once on an implicitly controlled one.
+TEST_F(ApplicationMetadataCalls, SetChangesTheAppliedViewOfElementZero) {
   EXPECT_EQ(get(Committed_View), "#202");
   ASSERT_EQ(set("v1"), 0);
   EXPECT_EQ(get(Committed_View), "#202");
   EXPECT_EQ(get(Applied_View), "v1");
-  sr_i_abort_application_metadata_buffer_updates(p_container);
-  EXPECT_EQ(get(Applied_View), "#202");
-
-  ASSERT_EQ(set("v2"), 0);
-  sr_i_commit_application_metadata_buffer_updates(p_container);
-  EXPECT_EQ(get(Committed_View), "v2");
-  ASSERT_EQ(set("v3"), 0);
-  sr_i_abort_application_metadata_buffer_updates(p_container);
-  EXPECT_EQ(get(Applied_View), "v2");
-
+  EXPECT_EQ(read(p_table_->p_application_metadata, 0, Applied_View), "v1");
   p_table_->implicitly_controlled = 1;
   ASSERT_EQ(set("now"), 0);
   EXPECT_EQ(get(Committed_View), "now");

@@ -14,8 +14,8 @@
 #include <vector>
 
 #include "qv_cu.h"
-#include "tables/sr_i_hash_table.h"
 #include "sr_row_test_support.h"
+#include "tables/sr_i_hash_table.h"
 
 namespace {
 
@@ -56,43 +56,28 @@ struct ClientHashTable : ::testing::Test {
     ASSERT_EQ(sr_i_hash_table_open(Buckets, key_modulo_buckets, compare_keys, &p_table), 0);
   }
   void TearDown() override { EXPECT_EQ(sr_i_hash_table_close(p_table), 0); }
-  int32_t add(const uint32_t &key, uint32_t row, sr_qualifier_t qualifier) {
-    return sr_i_hash_table_add(p_table, &key, row, &bucket, &p_element, qualifier);
+  int32_t add(const uint32_t &key, uint32_t row, uint32_t qualifier = SR_PRIMARY_KEY) {
+    return sr_i_hash_table_add(p_table, &key, row, &bucket, &p_element,
+                               static_cast<sr_qualifier_t>(qualifier));
   }
   sr_hash_table_t *p_table = nullptr;
   uint32_t bucket = 0;
   sr_hash_table_element_t *p_element = nullptr;
 };
 
-TEST_F(ClientHashTable, PrimaryKeyRefusesAnEqualKeyAndReturnsTheExistingElement) {
-  const uint32_t three = 3, eleven = 11, three_again = 3;
-  ASSERT_EQ(add(three, 0, SR_PRIMARY_KEY), 0);
-  sr_hash_table_element_t *const p_first = p_element;
-  ASSERT_EQ(add(eleven, 1, SR_PRIMARY_KEY), 0);  // same bucket, different key
-  EXPECT_EQ(bucket, 3u);
-  cu_set_no_error_1();
-  // Modifier bits above the base qualifier do not turn the check off.
-  EXPECT_EQ(add(three_again, 2, static_cast<sr_qualifier_t>(SR_PRIMARY_KEY | SR_PROTECTED)),
-            SR_E_DUPLICATE_KEY);
-  EXPECT_EQ(last_error().first, 0);
-  EXPECT_EQ(p_element, p_first);
-  EXPECT_EQ(row_for(p_table, 3), 0);
-  EXPECT_EQ(row_for(p_table, 11), 1);
-  EXPECT_EQ(row_for(p_table, 19), -1);
-  // An element looked for in another bucket is not there: 202, no key named.
-  EXPECT_EQ(sr_i_hash_table_remove_element(p_table, 2, p_first), SR_E_NO_ROW_FOR_KEY);
+// An element looked for in another bucket is not there: 202, no key named.
+// The statistics list the buckets in use, then the totals.
+TEST_F(ClientHashTable, ElementsAreFoundInTheirBucketAndCounted) {
+  const uint32_t keys[] = {1, 9, 6};
+  for (uint32_t at = 0; at < 3; ++at) {
+    ASSERT_EQ(add(keys[at], at), 0);
+  }
+  EXPECT_EQ(sr_i_hash_table_remove_element(p_table, 2, p_element), SR_E_NO_ROW_FOR_KEY);
   EXPECT_EQ(last_error(),
             std::make_pair(SR_E_NO_ROW_FOR_KEY,
                            std::string("2605-202 There is no row corresponding to the specified "
                                        "key value.\n")));
-  EXPECT_EQ(row_for(p_table, 3), 0);
-}
-
-TEST_F(ClientHashTable, StatisticsListNonEmptyBucketsThenTheTotals) {
-  const uint32_t keys[] = {1, 9, 6};
-  for (uint32_t at = 0; at < 3; ++at) {
-    ASSERT_EQ(add(keys[at], at, SR_PRIMARY_KEY), 0);
-  }
+  EXPECT_EQ(row_for(p_table, 6), 2);
   ::testing::internal::CaptureStdout();
   sr_i_hash_table_output_stats(p_table);
   EXPECT_EQ(::testing::internal::GetCapturedStdout(),
@@ -145,7 +130,8 @@ TEST(HashTable, BuiltInHashSharesABucketForHandlesDifferingAboveId4sLow14Bits) {
 }
 
 // Random adds under both qualifiers, removals by element and by key, and
-// lookups, against a multimap whose equal keys keep their insertion order.
+// lookups, against a multimap whose equal keys keep their insertion order:
+// a checked add of a present key returns the newest equal element.
 TEST_F(ClientHashTable, RandomOperationsAgreeWithAMultimap) {
   struct entry {
     uint32_t row, bucket;
@@ -161,10 +147,14 @@ TEST_F(ClientHashTable, RandomOperationsAgreeWithAMultimap) {
     switch (random() % 4) {
       case 0:
       case 1: {
+        // Modifier bits above the base qualifier do not turn the check off.
         const bool check = random() % 2 == 0;
-        const int32_t rc = add(keys[row], row, check ? SR_PRIMARY_KEY : SR_PRIMARY_KEY_NOCHECK);
+        cu_set_no_error_1();
+        const int32_t rc =
+            add(keys[row], row, check ? SR_PRIMARY_KEY | SR_PROTECTED : SR_PRIMARY_KEY_NOCHECK);
         if (check && begin != end) {
           ASSERT_EQ(rc, SR_E_DUPLICATE_KEY);
+          ASSERT_EQ(last_error().first, 0) << "a duplicate is returned, not raised";
           ASSERT_EQ(p_element, std::prev(end)->second.p_element);
         } else {
           ASSERT_EQ(rc, 0);
@@ -207,7 +197,7 @@ TEST_F(ClientHashTable, ManyElementsSurviveRemovalAndReuseAcrossBlocks) {
   std::vector<std::pair<uint32_t, sr_hash_table_element_t *>> placed(2 * Keys);
   for (uint32_t key = 0; key < Keys; ++key) {
     keys[key] = key;
-    ASSERT_EQ(add(keys[key], key, SR_PRIMARY_KEY), 0);
+    ASSERT_EQ(add(keys[key], key), 0);
     placed[key] = {bucket, p_element};
   }
   for (uint32_t key = 0; key < Keys; key += 2) {
@@ -219,7 +209,7 @@ TEST_F(ClientHashTable, ManyElementsSurviveRemovalAndReuseAcrossBlocks) {
   }
   for (uint32_t key = Keys; key < Keys + Keys / 2; ++key) {
     keys[key] = key;
-    ASSERT_EQ(add(keys[key], key, SR_PRIMARY_KEY), 0);
+    ASSERT_EQ(add(keys[key], key), 0);
     ASSERT_TRUE(live.insert(p_element).second) << "element of key " << key << " is in use";
   }
   for (uint32_t key = 0; key < Keys + Keys / 2; ++key) {

@@ -21,9 +21,9 @@
 #include <vector>
 
 #include "qv_sr.h"
+#include "sr_row_test_support.h"
 #include "storage/sr_i_prefault.h"
 #include "tables/sr_i_record_buffer_pool.h"
-#include "sr_row_test_support.h"
 
 namespace {
 
@@ -308,7 +308,11 @@ TEST(RecordBufferPool, RaisesAndLeavesThePoolAsItWas) {
   sr_i_rb_uninitialize_record_buffer_pool(&pool);
 }
 
-TEST(RecordBufferPool, RandomAllocationsAndFreesKeepThePoolConsistent) {
+// Random reservations and frees from pools of 0 and 2 pages; then rows of
+// up to 3000 bytes with now and then one of 150 KB or more, whose blocks
+// come from mmap at falling addresses: the short free tails of older blocks
+// then lie above the newest one, where the search hint cannot cover them.
+TEST(RecordBufferPool, RandomAllocationsAndFreesKeepThePoolConsistentAndFirstFitExact) {
   for (const uint32_t pages : {0u, 2u}) {
     sr_i_record_buffer_pool_t pool{};
     ASSERT_EQ(sr_i_rb_initialize_record_buffer_pool(pages, &pool), 0);
@@ -318,17 +322,9 @@ TEST(RecordBufferPool, RandomAllocationsAndFreesKeepThePoolConsistent) {
     for (const auto &[p_data, record] : live) {
       ASSERT_EQ(sr_i_rb_free_record(&pool, p_data), 0);
     }
-    live.clear();
-    check_pool(pool, live);  // every block is one free record again
+    check_pool(pool, {});  // every block is one free record again
     sr_i_rb_uninitialize_record_buffer_pool(&pool);
   }
-}
-
-// Blocks above the heap's mapping threshold come from mmap, which hands out
-// falling addresses: the short free tails of older blocks then lie above the
-// newest one, where the search hint cannot cover them. Rows of up to 3000
-// bytes (blocks of up to 300 KB) with now and then one of 150 KB or more.
-TEST(RecordBufferPool, FirstFitStaysExactWhenBlocksComeAtFallingAddresses) {
   sr_i_record_buffer_pool_t pool{};
   model_t live;
   std::mt19937 random(5);
@@ -343,23 +339,30 @@ TEST(RecordBufferPool, FirstFitStaysExactWhenBlocksComeAtFallingAddresses) {
   sr_i_rb_uninitialize_record_buffer_pool(&pool);
 }
 
+// A pool without blocks copies to an empty pool. A pool of many blocks, one
+// of them 64 MB (so that the copy gets a mapping of its own, usually far
+// from the heap blocks it copies), is copied into one block: every record
+// at its mapped address with its bytes, the free chain relinked; the copy
+// then works as a pool of its own and the source is untouched.
 TEST(RecordBufferPool, DuplicateCopiesEveryRecordIntoOneBlock) {
-  sr_i_record_buffer_pool_t source{};
+  sr_i_record_buffer_pool_t source{}, copy{};
+  sr_i_record_buffer_pool_duplication_map_t *p_map = nullptr;
+  ASSERT_EQ(sr_i_rb_duplicate_record_buffer_pool(&source, &copy, &p_map), 0);
+  EXPECT_EQ(p_map->total, 0u);
+  EXPECT_EQ(std::memcmp(&copy, &source, sizeof copy), 0);
+  sr_i_rb_free_duplication_map(p_map);
+
   std::mt19937 random(11);
   model_t live;
   ASSERT_NO_FATAL_FAILURE(random_steps(source, live, random, 800));
-  uint32_t blocks = 0;
-  for (auto *p = source.p_first_record_buffer; p != nullptr; p = p->p_next) {
-    ++blocks;
-  }
-  ASSERT_GE(blocks, 3u);
-
-  sr_i_record_buffer_pool_t copy{};
-  sr_i_record_buffer_pool_duplication_map_t *p_map = nullptr;
+  void *p_large = nullptr;
+  ASSERT_EQ(sr_i_reserve_record(&source, 64u << 20, SR_I_RECORD_ROW, &p_large), 0);
+  ASSERT_EQ(sr_i_rb_free_record(&source, p_large), 0);
+  ASSERT_GE(source.total_blocks, 3u);
   ASSERT_EQ(sr_i_rb_duplicate_record_buffer_pool(&source, &copy, &p_map), 0);
-  ASSERT_EQ(p_map->total, blocks);
-  EXPECT_EQ(copy.total_bytes, source.total_bytes - 12 * blocks + 12);
-  EXPECT_EQ(copy.used_bytes, source.used_bytes - 12 * blocks + 12);
+  ASSERT_EQ(p_map->total, source.total_blocks);
+  EXPECT_EQ(copy.total_bytes, source.total_bytes - 12 * source.total_blocks + 12);
+  EXPECT_EQ(copy.used_bytes, source.used_bytes - 12 * source.total_blocks + 12);
   ASSERT_EQ(copy.p_first_record_buffer, copy.p_last_record_buffer);
   EXPECT_EQ(copy.p_first_record_buffer->p_next, nullptr);
 
@@ -374,49 +377,16 @@ TEST(RecordBufferPool, DuplicateCopiesEveryRecordIntoOneBlock) {
   for (uint32_t at = 1; at < p_map->total; ++at) {
     seams.insert(address(sr_i_rb_map_duplicated_address(p_map, p_map->p_begin[at])));
   }
-  // Every record, its bytes and the relinked free chain, in one walk.
   ASSERT_NO_FATAL_FAILURE(check_pool(copy, copied, seams));
   const int outside = 0;
   EXPECT_EQ(sr_i_rb_map_duplicated_address(p_map, &outside), nullptr);
   EXPECT_EQ(sr_i_rb_map_duplicated_address(p_map, p_map->p_end[0]), nullptr);
 
-  // The copy works as a pool of its own, and the source is untouched.
   ASSERT_NO_FATAL_FAILURE(random_steps(copy, copied, random, 300, seams));
   ASSERT_NO_FATAL_FAILURE(check_pool(source, live));
   sr_i_rb_free_duplication_map(p_map);
   sr_i_rb_uninitialize_record_buffer_pool(&copy);
   sr_i_rb_uninitialize_record_buffer_pool(&source);
-}
-
-TEST(RecordBufferPool, MapsIntoACopyFarFromItsSource) {
-  // A copy this large is given its own memory mapping, usually gigabytes
-  // away from the small heap block it copies.
-  sr_i_record_buffer_pool_t source{}, copy{};
-  ASSERT_EQ(sr_i_rb_initialize_record_buffer_pool(1, &source), 0);
-  void *p_small = nullptr, *p_large = nullptr;
-  ASSERT_EQ(sr_i_reserve_record(&source, 100, SR_I_RECORD_ROW, &p_small), 0);
-  fill(p_small, {100, 9});
-  ASSERT_EQ(sr_i_reserve_record(&source, 64u << 20, SR_I_RECORD_ROW, &p_large), 0);
-  ASSERT_EQ(sr_i_rb_free_record(&source, p_large), 0);
-  sr_i_record_buffer_pool_duplication_map_t *p_map = nullptr;
-  ASSERT_EQ(sr_i_rb_duplicate_record_buffer_pool(&source, &copy, &p_map), 0);
-  void *p_copy = sr_i_rb_map_duplicated_address(p_map, p_small);
-  const uintptr_t copy_begin = address(copy.p_first_record_buffer->data);
-  ASSERT_GE(address(p_copy), copy_begin);
-  ASSERT_LT(address(p_copy), copy_begin + copy.total_bytes - 12);
-  EXPECT_TRUE(holds_its_bytes(p_copy, {100, 9}));
-  sr_i_rb_free_duplication_map(p_map);
-  sr_i_rb_uninitialize_record_buffer_pool(&copy);
-  sr_i_rb_uninitialize_record_buffer_pool(&source);
-}
-
-TEST(RecordBufferPool, DuplicatingAPoolWithoutBlocksGivesAnEmptyPool) {
-  sr_i_record_buffer_pool_t source{}, copy{};
-  sr_i_record_buffer_pool_duplication_map_t *p_map = nullptr;
-  ASSERT_EQ(sr_i_rb_duplicate_record_buffer_pool(&source, &copy, &p_map), 0);
-  EXPECT_EQ(p_map->total, 0u);
-  EXPECT_EQ(std::memcmp(&copy, &source, sizeof copy), 0);
-  sr_i_rb_free_duplication_map(p_map);
 }
 
 }  // namespace

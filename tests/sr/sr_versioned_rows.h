@@ -42,13 +42,13 @@ inline int32_t compare_ids(const void *p_stored_key, const void *p_key) {
 
 using sr_test::int32_value;
 using sr_test::mounted_tree;
+using sr_test::string_value;
 
 inline int32_t create_table(sr_opaque_handle_t tree, const char *p_path, int32_t mode,
                             sr_opaque_handle_t *p_table) {
-  sr_column_t columns[3] = {
-      {const_cast<char *>("Id"), QV_INT32, SR_PRIMARY_KEY, 0, nullptr, {}},
-      {const_cast<char *>("Version"), QV_INT32, SR_STANDARD, 0, nullptr, {}},
-      {const_cast<char *>("Payload"), QV_CHAR_PTR, SR_STANDARD, 0, nullptr, {}}};
+  sr_column_t columns[3] = {sr_test::column("Id", QV_INT32, SR_PRIMARY_KEY),
+                            sr_test::column("Version", QV_INT32),
+                            sr_test::column("Payload", QV_CHAR_PTR)};
   return sr_create_hashed_key_table_1(tree, p_path, columns, 3, mode, Hash_Buckets, hash_id,
                                       compare_ids, p_table);
 }
@@ -72,24 +72,18 @@ inline std::string payload(int32_t id, int32_t version, uint32_t spread) {
 }
 
 inline int32_t add_row(sr_opaque_handle_t table, int32_t id, int32_t version, uint32_t spread) {
-  qv_value_t key = int32_value(id);
-  qv_value_t number = int32_value(version);
   const std::string text = payload(id, version, spread);
-  qv_value_t body{};
-  body.ptr_char = const_cast<char *>(text.c_str());
-  const char *names[] = {"Id", "Version", "Payload"};
-  qv_value_t *values[] = {&key, &number, &body};
-  return sr_add_row_1(table, names, values, 3);
+  return sr_test::add_fields(table, {{"Id", int32_value(id)},
+                                     {"Version", int32_value(version)},
+                                     {"Payload", string_value(text.c_str())}});
 }
 
 inline int32_t set_row(sr_opaque_handle_t table, int32_t id, int32_t version, uint32_t spread) {
-  qv_value_t number = int32_value(version);
   const std::string text = payload(id, version, spread);
-  qv_value_t body{};
-  body.ptr_char = const_cast<char *>(text.c_str());
-  const char *names[] = {"Version", "Payload"};
-  qv_value_t *values[] = {&number, &body};
-  return sr_set_fields_by_key_1(table, int32_value(id), names, values, 2);
+  const sr_test::field_list fields{{"Version", int32_value(version)},
+                                   {"Payload", string_value(text.c_str())}};
+  return sr_set_fields_by_key_1(table, int32_value(id), fields.names.data(), fields.pointers.data(),
+                                2);
 }
 
 // A committed state: whether the table exists, its change counter and each
@@ -130,13 +124,10 @@ inline std::string read_rows(sr_opaque_handle_t table, table_state &state, uint3
   const uint32_t total_rows = p_metadata->number_of_rows;
   sr_free_table_metadata_1(p_metadata);
   for (uint32_t at = 0; at < total_rows; ++at) {
-    qv_value_t id{};
-    qv_value_t version{};
-    qv_value_t text{};
-    const char *names[] = {"Id", "Version", "Payload"};
-    qv_value_t *values[] = {&id, &version, &text};
-    if (const int32_t rc =
-            sr_get_fields_by_index_1(table, static_cast<int32_t>(at), names, values, 3);
+    sr_test::field_list row{{"Id", {}}, {"Version", {}}, {"Payload", {}}};
+    const qv_value_t &id = row.values[0], &version = row.values[1], &text = row.values[2];
+    if (const int32_t rc = sr_get_fields_by_index_1(table, static_cast<int32_t>(at),
+                                                    row.names.data(), row.pointers.data(), 3);
         rc != 0) {
       return "row " + std::to_string(at) + " gave " + std::to_string(rc);
     }

@@ -9,11 +9,11 @@
 #include <filesystem>
 #include <string>
 
-#include "qv_sr.h"
 #include "frame/sr_i_errors.h"
-#include "storage/sr_i_system_calls.h"
 #include "frame/sr_i_paths.h"
+#include "qv_sr.h"
 #include "sr_row_test_support.h"
+#include "storage/sr_i_system_calls.h"
 
 namespace {
 
@@ -75,16 +75,13 @@ TEST_F(MountPoints, PathsBelowAMountPointResolveToFlatFiles) {
 
 TEST_F(MountPoints, MountCreatesTheDirectoryWithItsParents) {
   const std::string deep = dir("one/two/three");
+  const mode_t umask_now = umask(0);
+  umask(umask_now);
   ASSERT_EQ(sr_mount_local_tree_1(tree_, "/cfg", deep.c_str(), 1), 0);
   struct stat status {};
   ASSERT_EQ(stat(deep.c_str(), &status), 0);
   EXPECT_TRUE(S_ISDIR(status.st_mode));
-  EXPECT_EQ(
-      status.st_mode & 0777, 0755u & ~[] {
-        mode_t mask = umask(0);
-        umask(mask);
-        return mask;
-      }());
+  EXPECT_EQ(status.st_mode & 0777, 0755u & ~umask_now);
   // A directory that exists already is fine, with or without a trailing "/".
   EXPECT_EQ(sr_mount_local_tree_1(tree_, "/other", (deep + "/").c_str(), 0), 0);
 }
@@ -124,20 +121,16 @@ TEST_F(MountPoints, UnmountFindsOnlyTheMountPointItself) {
   EXPECT_TRUE(std::filesystem::is_directory(dir("d")));
 }
 
-int full_disk_mkdir(const char *, mode_t) {
-  errno = ENOSPC;
-  return -1;
-}
-
-int forbidden_mkdir(const char *, mode_t) {
-  errno = EACCES;
-  return -1;
-}
-
 TEST_F(MountPoints, DirectoryFailuresAreReportedAndMountNothing) {
-  Sr_File_System.mkdir = full_disk_mkdir;
+  Sr_File_System.mkdir = [](const char *, mode_t) {
+    errno = ENOSPC;
+    return -1;
+  };
   EXPECT_EQ(sr_mount_local_tree_1(tree_, "/a", dir("full").c_str(), 0), SR_E_FILESYSTEM_FULL);
-  Sr_File_System.mkdir = forbidden_mkdir;
+  Sr_File_System.mkdir = [](const char *, mode_t) {
+    errno = EACCES;
+    return -1;
+  };
   EXPECT_EQ(sr_mount_local_tree_1(tree_, "/a", dir("denied").c_str(), 0), SR_E_SYSTEM_CALL);
   EXPECT_EQ(
       last_error().second.rfind("2605-010 The mkdir system call unexpectedly returned an errno "

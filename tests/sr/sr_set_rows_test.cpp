@@ -34,10 +34,6 @@ class SetRows : public RowTables {
     RowTables::SetUp();
     p_definition_->number_of_fields = 1;
     p_definition_->field_def[0] = {QV_INT32, const_cast<char *>("n")};
-    table_ = create("/set/rows", Explicit);
-  }
-
-  sr_opaque_handle_t create(const char *p_path, int32_t mode) {
     std::vector<sr_column_t> columns = {
         column("k", QV_INT32, SR_PRIMARY_KEY),
         column("name", QV_CHAR_PTR),
@@ -51,7 +47,7 @@ class SetRows : public RowTables {
     columns[4].sd_defn = p_definition_.get();
     columns[6].default_value.ptr_char = const_cast<char *>("fresh");
     columns[7].default_value.val_int32 = 5;
-    return make_table(p_path, columns, mode);
+    table_ = make_table("/set/rows", columns, Explicit);
   }
   // Adds a row whose first value is its int32 key; returns its fixed index.
   // The second form adds one with locked 7, reset "custom" and level 9.
@@ -91,7 +87,6 @@ class SetRows : public RowTables {
   int32_t number_of(uint32_t fixed, const char *p_column = "count", uint32_t view = 1) {
     return int32_at_fixed(table_, fixed, p_column, view);
   }
-  uint32_t used_bytes() { return object(table_)->record_buffer_pool.used_bytes; }
 
   std::unique_ptr<sr_sd_def_t, decltype(&std::free)> p_definition_ =
       zeroed_block<sr_sd_def_t>(sizeof(sr_sd_field_def_t));
@@ -103,7 +98,7 @@ TEST_F(SetRows, RefusalsComeInOrderAndLeaveTheRowAsItWas) {
   const uint32_t doomed = add(2, "two", 20);
   commit();
   ASSERT_EQ(sr_delete_row_by_index_1(table_, 1), 0);
-  const uint32_t used = used_bytes();
+  const uint32_t used = object(table_)->record_buffer_pool.used_bytes;
   const uint32_t past_end = object(table_)->maximum_rows;
   // A structured-data value with an element of no known type, which the
   // codec refuses.
@@ -130,7 +125,7 @@ TEST_F(SetRows, RefusalsComeInOrderAndLeaveTheRowAsItWas) {
   EXPECT_EQ(set(row, {{"peer", peer}, {"locked", number(7)}}), SR_E_INVALID_COLUMN);
   EXPECT_EQ(set(row, {{"sealed", number(0)}, {"peer", peer}}), SR_E_LIBRARY_CALL);
   EXPECT_EQ(set(row, {{"nosuch", number(0)}, {"peer", peer}}), SR_E_LIBRARY_CALL);
-  EXPECT_EQ(used_bytes(), used);
+  EXPECT_EQ(object(table_)->record_buffer_pool.used_bytes, used);
   EXPECT_EQ(object(table_)->p_rows_change_list, nullptr);
   EXPECT_EQ(state_of(table_, row), SR_ROW_STATE_COMMITTED);
   EXPECT_EQ(number_of(row), 10);

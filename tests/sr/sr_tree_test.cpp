@@ -12,8 +12,8 @@
 #include <thread>
 #include <vector>
 
-#include "qv_sr.h"
 #include "frame/sr_i_tree.h"
+#include "qv_sr.h"
 #include "sr_row_test_support.h"
 
 namespace {
@@ -28,23 +28,18 @@ bool is_open_tree(sr_opaque_handle_t tree) {
   return open;
 }
 
-TEST(Trees, OpenRegistersTheTreeAndCloseEndsIt) {
+// Open registers the tree and close ends it; a closed tree is refused (a
+// null one too: the C interface test), and a later success clears the
+// message of the refused call.
+TEST(Trees, OpenRegistersTheTreeCloseEndsItAndAClosedTreeIsRefused) {
   sr_opaque_handle_t tree = nullptr;
   ASSERT_EQ(sr_open_tree_1(&tree, 3, 1000), 0);
   ASSERT_NE(tree, nullptr);
   EXPECT_TRUE(is_open_tree(tree));
   EXPECT_EQ(sr_close_tree_1(tree), 0);
   EXPECT_FALSE(is_open_tree(tree));
-}
-
-TEST(Trees, NullOrClosedTreesAreRefusedNotACrash) {
-  EXPECT_EQ(sr_open_tree_1(nullptr, 0, 0), SR_E_INVALID_HANDLE);
-  EXPECT_EQ(last_error().first, 100);
-  sr_opaque_handle_t tree = nullptr;
-  ASSERT_EQ(sr_open_tree_1(&tree, 0, 0), 0);
-  ASSERT_EQ(sr_close_tree_1(tree), 0);
   EXPECT_EQ(sr_close_tree_1(tree), SR_E_INVALID_HANDLE);
-  // A later success clears the message of the refused call.
+  EXPECT_EQ(last_error().first, 100);
   ASSERT_EQ(sr_open_tree_1(&tree, 0, 0), 0);
   EXPECT_EQ(last_error().first, 0);
   EXPECT_EQ(sr_close_tree_1(tree), 0);
@@ -88,7 +83,11 @@ std::string convert(cu_iconv_t *p_handle, const std::string &text) {
   return out;
 }
 
-TEST(TreeConversion, CLocaleStoresBytesAsTheyAre) {
+// In the C locale the tree stores bytes as they are. In a Latin-1 locale
+// (compiled by the build, with localedef, into SR_TEST_LOCALE_DIR) strings
+// are converted to UTF-8 and back, with the handles opened when the tree
+// was, whatever the locale later.
+TEST(TreeConversion, TheLocaleAtOpenDecidesTheConversion) {
   ASSERT_NE(std::setlocale(LC_CTYPE, "C"), nullptr);
   sr_opaque_handle_t handle = nullptr;
   ASSERT_EQ(sr_open_tree_1(&handle, 0, 0), 0);
@@ -98,48 +97,37 @@ TEST(TreeConversion, CLocaleStoresBytesAsTheyAre) {
   const std::string utf8 = "gr\xc3\xbc\xc3\x9f dich \xe2\x82\xac";
   EXPECT_EQ(convert(p_tree->p_to_table_string_conversion_handle, utf8), utf8);
   EXPECT_EQ(sr_close_tree_1(handle), 0);
-}
 
-TEST(TreeConversion, Latin1LocaleIsConvertedAndKeptForTheLifeOfTheTree) {
-  // A Latin-1 locale compiled by the build (localedef) into SR_TEST_LOCALE_DIR.
   const std::string locale_directory = SR_TEST_LOCALE_DIR;
   if (!std::filesystem::exists(locale_directory + "/fr_FR.ISO-8859-1")) {
     GTEST_SKIP() << "no Latin-1 locale could be built on this machine";
   }
   setenv("LOCPATH", locale_directory.c_str(), 1);
   ASSERT_NE(std::setlocale(LC_CTYPE, "fr_FR.ISO-8859-1"), nullptr);
-  sr_opaque_handle_t handle = nullptr;
   const int32_t rc = sr_open_tree_1(&handle, 0, 0);
-  std::setlocale(LC_CTYPE, "C");  // the tree keeps the handles it opened
+  std::setlocale(LC_CTYPE, "C");
   unsetenv("LOCPATH");
   ASSERT_EQ(rc, 0);
-  auto *p_tree = static_cast<sr_i_tree_t *>(handle);
+  p_tree = static_cast<sr_i_tree_t *>(handle);
   EXPECT_EQ(convert(p_tree->p_to_table_string_conversion_handle, "caf\xe9"), "caf\xc3\xa9");
   EXPECT_EQ(convert(p_tree->p_from_table_string_conversion_handle, "caf\xc3\xa9"), "caf\xe9");
 
   // A row's key is hashed as it is stored, converted, not as the caller
-  // passed it: the hash table finds keys by their stored bytes.
-  sr_column_t columns[1] = {};
-  columns[0].name = const_cast<char *>("key");
-  columns[0].type = QV_CHAR_PTR;
-  columns[0].qualifier = SR_PRIMARY_KEY;
+  // passed it: the hash table finds keys by their stored bytes. Reading it
+  // back converts the stored bytes to the caller's code set again.
+  sr_column_t key_column = sr_test::column("key", QV_CHAR_PTR, SR_PRIMARY_KEY);
   sr_opaque_handle_t table = nullptr;
-  ASSERT_EQ(sr_create_hashed_key_table_1(handle, "/latin1", columns, 1, 2, 4, remember_key,
+  ASSERT_EQ(sr_create_hashed_key_table_1(handle, "/latin1", &key_column, 1, 2, 4, remember_key,
                                          compare_strings, &table),
             0);
-  qv_value_t key{};
-  key.ptr_char = const_cast<char *>("caf\xe9");
-  qv_value_t *const values[1] = {&key};
-  const char *names[1] = {"key"};
-  ASSERT_EQ(sr_add_row_1(table, names, values, 1), 0);
+  ASSERT_EQ(sr_test::add_fields(table, {{"key", sr_test::string_value("caf\xe9")}}), 0);
   EXPECT_EQ(Hashed_Keys, std::vector<std::string>{"caf\xc3\xa9"});
-
-  // Reading it back converts the stored bytes to the caller's code set again.
-  qv_value_t read{};
-  qv_value_t *const results[1] = {&read};
-  ASSERT_EQ(sr_get_fields_by_index_and_visibility_1(table, 0, names, results, 1, 1, nullptr), 0);
-  EXPECT_STREQ(read.ptr_char, "caf\xe9");
-  std::free(read.ptr_char);
+  sr_test::field_list read{{"key", {}}};
+  ASSERT_EQ(sr_get_fields_by_index_and_visibility_1(table, 0, read.names.data(),
+                                                    read.pointers.data(), 1, 1, nullptr),
+            0);
+  EXPECT_STREQ(read.values[0].ptr_char, "caf\xe9");
+  std::free(read.values[0].ptr_char);
   EXPECT_EQ(sr_close_tree_1(handle), 0);
 }
 

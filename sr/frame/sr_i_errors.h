@@ -13,8 +13,8 @@
 #include <cstdint>
 #include <string>
 
-#include "qv_sr.h"
 #include "frame/sr_i_source_location.h"
+#include "qv_sr.h"
 
 /* The catalog of the registry's messages and its message set. */
 inline constexpr const char *Sr_Message_Catalog = "qv_sr.cat";
@@ -82,13 +82,13 @@ int32_t sr_i_raise_invalid_criteria(const char *p_criteria,
 
 /*
  * 16: a write found the filesystem full. Names the filesystem holding
- * `p_path` from the mount table (Sr_Mount_Table_Path). When the mount table
- * cannot be read, returns 16 without raising anything.
+ * `p_path` from the mount table (Sr_Mount_Table_Path), or "UNKNOWN" when
+ * the mount table cannot be read.
  */
-int32_t trace_filesystem_full_for_path(const char *p_path);
+int32_t sr_i_raise_filesystem_full(const char *p_path);
 
-/* The mount table read by trace_filesystem_full_for_path: "/etc/mtab";
- * tests point it at a file of their own. */
+/* The mount table read by sr_i_raise_filesystem_full: "/etc/mtab"; tests
+ * point it at a file of their own. */
 extern const char *Sr_Mount_Table_Path;
 
 /* The filesystem holding a path: its device and the directory it is

@@ -2,8 +2,8 @@
 // whatever is pending or applied and not committed), the key hash table and
 // application metadata container it gets with its columns, the fixed row index
 // with its free chain and growth, the change lists and the blocks their
-// entries come from, block containment and the data/rewrite file name
-// switch.
+// entries come from, and block containment. Freeing a persistent table
+// closes its file through the storage code (storage/sr_i_table_file.h).
 //
 // Index entries are handed out lowest position first: the free chain is
 // kept in ascending address order, linked through p_pending_change, which a
@@ -19,9 +19,9 @@
 #include <new>
 #include <utility>
 
-#include "schema/sr_i_application_metadata.h"
 #include "frame/sr_i_errors.h"
-#include "storage/sr_i_system_calls.h"
+#include "schema/sr_i_application_metadata.h"
+#include "storage/sr_i_table_file.h"
 #include "tables/sr_i_hash_table.h"
 
 namespace {
@@ -54,8 +54,6 @@ sr_i_table_t *sr_i_create_null_table() {
   p_table->references = 1;
   p_table->implicitly_controlled = 1;
   p_table->change_counter = 1;
-  p_table->file_fd = -1;
-  p_table->rewrite_file_fd = -1;
   // Read each time a table object is made, so a program may switch it
   // between tables; set to anything, even "", it is on.
   p_table->uncommitted_updates_visible = std::getenv("SR_UNCOMMITTED_UPDATES_VISIBLE") ? 1 : 0;
@@ -75,14 +73,7 @@ void sr_i_close_table(sr_i_table_t *p_table) {
   std::free(p_table->p_rows_packed_index);
   sr_i_free_change_lists(p_table);
   std::free(p_table->p_name);
-  std::free(p_table->p_file_path);
-  // Closing the descriptors also ends their file locks.
-  if (p_table->file_fd >= 0) {
-    Sr_File_System.close(p_table->file_fd);
-  }
-  if (p_table->rewrite_file_fd >= 0) {
-    Sr_File_System.close(p_table->rewrite_file_fd);
-  }
+  sr_i_close_table_file(p_table->p_file);
   std::free(p_table->p_persistent_table_registry_path);
   sr_i_free_application_metadata(p_table->p_application_metadata);
   std::free(p_table);
@@ -237,14 +228,6 @@ bool sr_i_record_contained_in_block(const sr_i_table_t *p_table, uint32_t offset
   }
   block = static_cast<uint32_t>(offset / block_size);
   return offset / block_size == (uint64_t{offset} + length) / block_size;
-}
-
-void sr_i_set_data_path(sr_i_table_t *p_table) {
-  p_table->p_file_path[p_table->file_path_length] = '\0';
-}
-
-void sr_i_set_rewrite_path(sr_i_table_t *p_table) {
-  p_table->p_file_path[p_table->file_path_length] = '.';
 }
 
 void sr_i_swap_table_contents(sr_i_table_t *p_open, sr_i_table_t *p_other) {

@@ -8,11 +8,11 @@
 #include <utility>
 
 #include "frame/sr_i_frame.h"
-#include "tables/sr_i_hash_table.h"
 #include "frame/sr_i_paths.h"
-#include "tables/sr_i_table.h"
-#include "storage/sr_i_storage.h"
 #include "frame/sr_i_tree.h"
+#include "storage/sr_i_storage.h"
+#include "tables/sr_i_hash_table.h"
+#include "tables/sr_i_table.h"
 
 namespace {
 
@@ -124,7 +124,7 @@ int32_t do_open_table(sr_opaque_handle_t tree_handle, const char *p_registry_pat
   } else if (writing) {
     // A read-only table turns writable; one with a file must be read again
     // under the writer's lock, since another process may have changed it.
-    if (p_table->p_file_path != nullptr) {
+    if (p_table->p_file != nullptr) {
       if (const int32_t rc =
               reload_writable(p_table, p_registry_path, mode, block_size, p_rows_hash_table);
           rc != 0) {

@@ -182,7 +182,7 @@ TEST_F(FilesystemFull, TheLongestWholeComponentPrefixNamesTheFilesystem) {
     if (!one.mount_table.empty()) {
       std::ofstream(mount_table_) << one.mount_table;
     }
-    EXPECT_EQ(trace_filesystem_full_for_path(one.path.c_str()), SR_E_FILESYSTEM_FULL);
+    EXPECT_EQ(sr_i_raise_filesystem_full(one.path.c_str()), SR_E_FILESYSTEM_FULL);
     EXPECT_EQ(read_last_error().text,
               "2605-016 The filesystem containing the local tree is full: mounted(" + one.device +
                   ") mounted_over(" + one.directory + ").\n")
@@ -190,12 +190,15 @@ TEST_F(FilesystemFull, TheLongestWholeComponentPrefixNamesTheFilesystem) {
   }
 }
 
-TEST_F(FilesystemFull, UnreadableMountTableRaisesNothing) {
+TEST_F(FilesystemFull, UnreadableMountTableStillRaisesTheFullFilesystem) {
   cu_set_error_1(205, 0, "", 1, 22, "earlier error\n");
-  EXPECT_EQ(trace_filesystem_full_for_path("/data/t"), SR_E_FILESYSTEM_FULL);
+  std::remove(mount_table_.c_str());
+  EXPECT_EQ(sr_i_raise_filesystem_full("/data/t"), SR_E_FILESYSTEM_FULL);
   const last_error error = read_last_error();
-  EXPECT_EQ(error.code, 205);
-  EXPECT_EQ(error.text, "earlier error\n");
+  EXPECT_EQ(error.code, SR_E_FILESYSTEM_FULL);
+  EXPECT_EQ(error.text,
+            "2605-016 The filesystem containing the local tree is full: mounted(UNKNOWN) "
+            "mounted_over(UNKNOWN).\n");
 }
 
 }  // namespace

@@ -9,11 +9,11 @@
 #include <filesystem>
 #include <string>
 
-#include "qv_sr.h"
 #include "frame/sr_i_errors.h"
-#include "storage/sr_i_system_calls.h"
 #include "frame/sr_i_paths.h"
+#include "qv_sr.h"
 #include "sr_row_test_support.h"
+#include "storage/sr_i_system_calls.h"
 
 namespace {
 
@@ -134,14 +134,21 @@ int forbidden_mkdir(const char *, mode_t) {
   return -1;
 }
 
+int failing_mkdir(const char *, mode_t) {
+  errno = EIO;
+  return -1;
+}
+
 TEST_F(MountPoints, DirectoryFailuresAreReportedAndMountNothing) {
   Sr_File_System.mkdir = full_disk_mkdir;
   EXPECT_EQ(sr_mount_local_tree_1(tree_, "/a", dir("full").c_str(), 0), SR_E_FILESYSTEM_FULL);
   Sr_File_System.mkdir = forbidden_mkdir;
-  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/a", dir("denied").c_str(), 0), SR_E_SYSTEM_CALL);
+  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/a", dir("denied").c_str(), 0), SR_E_ACCESS);
+  Sr_File_System.mkdir = failing_mkdir;
+  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/a", dir("broken").c_str(), 0), SR_E_SYSTEM_CALL);
   EXPECT_EQ(
       last_error().second.rfind("2605-010 The mkdir system call unexpectedly returned an errno "
-                                "of 13 to the sr_i_create_all_directories_in_path function",
+                                "of 5 to the sr_i_make_directory function",
                                 0),
       0u);
   EXPECT_TRUE(tree()->mount_points.empty());

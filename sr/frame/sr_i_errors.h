@@ -107,6 +107,7 @@ bool get_filesystem_containing_file(const char *p_path, const char *p_mount_tabl
  * 202 with the richer message 2605-213: no row of table `p_table_name`
  * (null: "(UNKNOWN_TABLE_NAME)") has the key `p_key` of type `type`.
  */
-int32_t trace_key_not_found(const char *p_table_name, const qv_value_t *p_key, qv_data_type_t type);
+int32_t sr_i_raise_key_not_found(const char *p_table_name, const qv_value_t *p_key,
+                                 qv_data_type_t type);
 
 #endif /* SR_I_ERRORS_H */

@@ -122,7 +122,7 @@ TEST(KeyNotFound, TheKeyIsRenderedByItsType) {
       {QV_BINARY_PTR, nullptr, "***UNKNOWN KEY TYPE****", "(UNKNOWN_TABLE_NAME)"},
   };
   for (size_t at = 0; at < std::size(cases); ++at) {
-    EXPECT_EQ(trace_key_not_found(cases[at].p_table, &keys[at], cases[at].type),
+    EXPECT_EQ(sr_i_raise_key_not_found(cases[at].p_table, &keys[at], cases[at].type),
               SR_E_NO_ROW_FOR_KEY);
     const last_error error = read_last_error();
     EXPECT_EQ(error.code, 202);

@@ -19,9 +19,10 @@
 #include <new>
 #include <utility>
 
-#include "schema/sr_i_application_metadata.h"
 #include "frame/sr_i_errors.h"
+#include "schema/sr_i_application_metadata.h"
 #include "storage/sr_i_system_calls.h"
+#include "tables/sr_i_allocation.h"
 #include "tables/sr_i_hash_table.h"
 
 namespace {
@@ -115,7 +116,7 @@ int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows) {
     return sr_i_raise_no_memory();
   }
   auto *p_packed = static_cast<uint32_t *>(
-      std::realloc(p_table->p_rows_packed_index, new_rows * sizeof(uint32_t)));
+      Sr_Allocation.reallocate(p_table->p_rows_packed_index, new_rows * sizeof(uint32_t)));
   if (p_packed == nullptr) {
     std::free(p_table->p_rows_packed_index);
     p_table->p_rows_packed_index = nullptr;
@@ -125,7 +126,7 @@ int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows) {
   // Where the change entries point, as positions, for after a move.
   const auto old_base = reinterpret_cast<uintptr_t>(p_table->p_rows_fixed_index);
   auto *p_fixed = static_cast<sr_i_index_entry_t *>(
-      std::realloc(p_table->p_rows_fixed_index, new_rows * sizeof(sr_i_index_entry_t)));
+      Sr_Allocation.reallocate(p_table->p_rows_fixed_index, new_rows * sizeof(sr_i_index_entry_t)));
   if (p_fixed == nullptr) {
     std::free(p_table->p_rows_fixed_index);
     p_table->p_rows_fixed_index = nullptr;
@@ -206,8 +207,8 @@ sr_i_change_entry_t *sr_i_new_change_entry(sr_i_table_t *p_table) {
     p_table->p_free_change_entries = p_change->p_next;
   } else {
     if (p_table->unused_change_entries == 0) {
-      auto *p_block =
-          static_cast<sr_i_change_entry_block_t *>(std::malloc(sizeof(sr_i_change_entry_block_t)));
+      auto *p_block = static_cast<sr_i_change_entry_block_t *>(
+          Sr_Allocation.allocate(sizeof(sr_i_change_entry_block_t)));
       if (p_block == nullptr) {
         sr_i_raise_no_memory();
         return nullptr;

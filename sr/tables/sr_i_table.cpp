@@ -8,11 +8,14 @@
 // Index entries are handed out lowest position first: the free chain is
 // kept in ascending address order, linked through p_pending_change, which a
 // free entry does not otherwise use. Entries that were never handed out
-// follow one another without links (see p_rows_never_used).
+// follow one another without links (see p_rows_never_used). The index
+// growth and the change entry blocks allocate through Sr_Allocation, so
+// that tests can make them fail.
 
 #include "tables/sr_i_table.h"
 
 #include <algorithm>
+#include <cassert>
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
@@ -109,32 +112,35 @@ int32_t sr_i_establish_rows_index(sr_i_table_t *p_table, uint32_t maximum_rows) 
   return 0;
 }
 
+// Both arrays are had before either is given up, so that a failure leaves
+// the table as it was. The packed index, a twelfth the size of the fixed
+// one, is copied into a new array; the fixed index is reallocated, which
+// keeps it in place when the heap can and moves it otherwise.
 int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows) {
+  assert(p_table->p_rows_free_chain == nullptr);
   const uint32_t old_rows = p_table->maximum_rows;
   const uint64_t new_rows = uint64_t{old_rows} + total_new_rows;
   if (new_rows > UINT32_MAX) {
     return sr_i_raise_no_memory();
   }
-  auto *p_packed = static_cast<uint32_t *>(
-      Sr_Allocation.reallocate(p_table->p_rows_packed_index, new_rows * sizeof(uint32_t)));
+  auto *p_packed = static_cast<uint32_t *>(Sr_Allocation.allocate(new_rows * sizeof(uint32_t)));
   if (p_packed == nullptr) {
-    std::free(p_table->p_rows_packed_index);
-    p_table->p_rows_packed_index = nullptr;
     return sr_i_raise_no_memory();
   }
-  p_table->p_rows_packed_index = p_packed;
   // Where the change entries point, as positions, for after a move.
   const auto old_base = reinterpret_cast<uintptr_t>(p_table->p_rows_fixed_index);
   auto *p_fixed = static_cast<sr_i_index_entry_t *>(
       Sr_Allocation.reallocate(p_table->p_rows_fixed_index, new_rows * sizeof(sr_i_index_entry_t)));
   if (p_fixed == nullptr) {
-    std::free(p_table->p_rows_fixed_index);
-    p_table->p_rows_fixed_index = nullptr;
+    std::free(p_packed);
     return sr_i_raise_no_memory();
   }
+  std::memcpy(p_packed, p_table->p_rows_packed_index, old_rows * sizeof(uint32_t));
+  std::memset(p_packed + old_rows, 0, total_new_rows * sizeof(uint32_t));
+  std::free(p_table->p_rows_packed_index);
+  p_table->p_rows_packed_index = p_packed;
   std::memset(static_cast<void *>(p_fixed + old_rows), 0,
               total_new_rows * sizeof(sr_i_index_entry_t));
-  std::memset(p_packed + old_rows, 0, total_new_rows * sizeof(uint32_t));
   p_table->p_rows_free_chain = p_fixed + old_rows;
   p_table->p_rows_never_used = p_fixed + old_rows;
   p_table->maximum_rows = static_cast<uint32_t>(new_rows);

@@ -309,4 +309,39 @@ TEST_F(AddRowWithoutMemory, AGrowthThatFailsLeavesTheIndexAndTheTransactionAsThe
   }
 }
 
+// The first change of a transaction takes a new block of change entries;
+// when it cannot be had, the row built and entered in the key hash table so
+// far is given back.
+TEST_F(AddRowWithoutMemory, AChangeThatCannotBeQueuedGivesTheRowBack) {
+  sr_opaque_handle_t table =
+      make_table("/add/no_change_entry",
+                 {column("id", QV_INT32, SR_PRIMARY_KEY), column("count", QV_INT32, SR_STANDARD)},
+                 Explicit, four_buckets);
+  const std::map<int32_t, int32_t> committed = {{0, 0}, {1, 10}, {2, 20}};
+  for (const auto &[id, count] : committed) {
+    ASSERT_EQ(add_numbered(table, id, count), 0);
+  }
+  apply_commit(table);
+  ASSERT_EQ(object(table)->p_change_entry_blocks, nullptr);
+  const footprint before(object(table));
+  const sr_i_index_entry_t *p_free = object(table)->p_rows_free_chain;
+
+  Allocations_Until_Failure = 1;
+  EXPECT_EQ(add_numbered(table, 3, 30), SR_E_NO_MEMORY);
+  ASSERT_EQ(Allocations_Until_Failure, 0) << "the add made no allocation";
+  EXPECT_TRUE(footprint(object(table)) == before);
+  EXPECT_EQ(object(table)->p_rows_free_chain, p_free);
+  uint32_t fixed = 0;
+  EXPECT_EQ(sr_get_fixed_row_index_for_key_1(table, int32_value(3), &fixed), SR_E_NO_ROW_FOR_KEY);
+  EXPECT_EQ(rows_in(table, 1), committed);
+
+  ASSERT_EQ(add_numbered(table, 3, 30), 0);
+  ASSERT_EQ(sr_get_fixed_row_index_for_key_1(table, int32_value(3), &fixed), 0);
+  EXPECT_EQ(object(table)->p_rows_fixed_index + fixed, p_free);
+  apply_commit(table);
+  std::map<int32_t, int32_t> with_new_row = committed;
+  with_new_row[3] = 30;
+  EXPECT_EQ(rows_in(table, 0), with_new_row);
+}
+
 }  // namespace

@@ -8,11 +8,14 @@
 // Index entries are handed out lowest position first: the free chain is
 // kept in ascending address order, linked through p_pending_change, which a
 // free entry does not otherwise use. Entries that were never handed out
-// follow one another without links (see p_rows_never_used).
+// follow one another without links (see p_rows_never_used). The index
+// growth and the change entry blocks allocate through Sr_Allocation, so
+// that tests can make them fail.
 
 #include "tables/sr_i_table.h"
 
 #include <algorithm>
+#include <cassert>
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
@@ -22,6 +25,7 @@
 #include "frame/sr_i_errors.h"
 #include "schema/sr_i_application_metadata.h"
 #include "storage/sr_i_table_file.h"
+#include "tables/sr_i_allocation.h"
 #include "tables/sr_i_hash_table.h"
 
 namespace {
@@ -99,32 +103,35 @@ int32_t sr_i_establish_rows_index(sr_i_table_t *p_table, uint32_t maximum_rows) 
   return 0;
 }
 
+// Both arrays are had before either is given up, so that a failure leaves
+// the table as it was. The packed index, a twelfth the size of the fixed
+// one, is copied into a new array; the fixed index is reallocated, which
+// keeps it in place when the heap can and moves it otherwise.
 int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows) {
+  assert(p_table->p_rows_free_chain == nullptr);
   const uint32_t old_rows = p_table->maximum_rows;
   const uint64_t new_rows = uint64_t{old_rows} + total_new_rows;
   if (new_rows > UINT32_MAX) {
     return sr_i_raise_no_memory();
   }
-  auto *p_packed = static_cast<uint32_t *>(
-      std::realloc(p_table->p_rows_packed_index, new_rows * sizeof(uint32_t)));
+  auto *p_packed = static_cast<uint32_t *>(Sr_Allocation.allocate(new_rows * sizeof(uint32_t)));
   if (p_packed == nullptr) {
-    std::free(p_table->p_rows_packed_index);
-    p_table->p_rows_packed_index = nullptr;
     return sr_i_raise_no_memory();
   }
-  p_table->p_rows_packed_index = p_packed;
   // Where the change entries point, as positions, for after a move.
   const auto old_base = reinterpret_cast<uintptr_t>(p_table->p_rows_fixed_index);
   auto *p_fixed = static_cast<sr_i_index_entry_t *>(
-      std::realloc(p_table->p_rows_fixed_index, new_rows * sizeof(sr_i_index_entry_t)));
+      Sr_Allocation.reallocate(p_table->p_rows_fixed_index, new_rows * sizeof(sr_i_index_entry_t)));
   if (p_fixed == nullptr) {
-    std::free(p_table->p_rows_fixed_index);
-    p_table->p_rows_fixed_index = nullptr;
+    std::free(p_packed);
     return sr_i_raise_no_memory();
   }
+  std::memcpy(p_packed, p_table->p_rows_packed_index, old_rows * sizeof(uint32_t));
+  std::memset(p_packed + old_rows, 0, total_new_rows * sizeof(uint32_t));
+  std::free(p_table->p_rows_packed_index);
+  p_table->p_rows_packed_index = p_packed;
   std::memset(static_cast<void *>(p_fixed + old_rows), 0,
               total_new_rows * sizeof(sr_i_index_entry_t));
-  std::memset(p_packed + old_rows, 0, total_new_rows * sizeof(uint32_t));
   p_table->p_rows_free_chain = p_fixed + old_rows;
   p_table->p_rows_never_used = p_fixed + old_rows;
   p_table->maximum_rows = static_cast<uint32_t>(new_rows);
@@ -197,8 +204,8 @@ sr_i_change_entry_t *sr_i_new_change_entry(sr_i_table_t *p_table) {
     p_table->p_free_change_entries = p_change->p_next;
   } else {
     if (p_table->unused_change_entries == 0) {
-      auto *p_block =
-          static_cast<sr_i_change_entry_block_t *>(std::malloc(sizeof(sr_i_change_entry_block_t)));
+      auto *p_block = static_cast<sr_i_change_entry_block_t *>(
+          Sr_Allocation.allocate(sizeof(sr_i_change_entry_block_t)));
       if (p_block == nullptr) {
         sr_i_raise_no_memory();
         return nullptr;

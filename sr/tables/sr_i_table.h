@@ -139,9 +139,10 @@ void sr_i_close_table(sr_i_table_t *p_table);
  * Returns 0 or 12 (raised). */
 int32_t sr_i_establish_rows_index(sr_i_table_t *p_table, uint32_t maximum_rows);
 
-/* Adds `total_new_rows` free positions, keeping the pending changes
- * pointed at their rows when the index moves. Returns 0 or 12 (raised);
- * after a failure the table must only be freed. */
+/* Adds `total_new_rows` free positions to an index with none free, keeping
+ * the pending changes pointed at their rows when the index moves. Returns 0
+ * or 12 (raised); a failure leaves the index, its free chain and the
+ * pending changes as they were. */
 int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows);
 
 /* What a table gets once its columns are known, whether created or loaded:

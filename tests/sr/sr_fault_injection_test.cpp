@@ -6,7 +6,8 @@
 // run checks the code and its message, that the table in memory goes on (a
 // retried step or an abort, then a further transaction), and that the file,
 // opened by another tree, holds a committed state: the old one, or the new
-// one when the failed call came after the commit point.
+// one when the failed call came after the commit point. Last, a read-only
+// table whose reading again for writing fails.
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -23,6 +24,7 @@
 #include <vector>
 
 #include "frame/sr_i_errors.h"
+#include "frame/sr_i_tree.h"
 #include "qv_sr.h"
 #include "rows/sr_i_transaction.h"
 #include "sr_row_test_support.h"
@@ -532,6 +534,41 @@ TEST_F(FaultInjection, ApplyFailuresKeepTheCommittedFileAndThePendingChanges) {
 
 TEST_F(FaultInjection, CommitAndAbortFailuresLeaveACommittedState) {
   fail_every_call_of({Committing, Aborting}, "commit and abort");
+}
+
+// A read-only table turning writable is read again from its file; when that
+// read fails, the table stays read-only with the references it had, so that
+// closing its last handle still drops it from memory.
+TEST_F(FaultInjection, AFailedReloadForWritingKeepsTheReadOnlyTableAndItsReferences) {
+  std::filesystem::create_directory(mount_directory_);
+  ASSERT_NE(tree_ = mounted_tree(mount_directory_), nullptr);
+  sr_opaque_handle_t table = nullptr;
+  ASSERT_EQ(create_table(&table), 0);
+  for (const auto &[name, count] : Committed_Rows) {
+    ASSERT_EQ(add_named(table, name.c_str(), count), 0);
+  }
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  ASSERT_EQ(sr_close_table_1(table), 0);
+
+  sr_opaque_handle_t reader = nullptr;
+  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 1, &reader), 0);
+  Injector = injector_t{.target = Read, .index = 1, .error = EIO};
+  sr_opaque_handle_t writer = nullptr;
+  EXPECT_EQ(sr_open_table_1(tree_, "/disk/t", 6, &writer), SR_E_SYSTEM_CALL);
+  EXPECT_EQ(Injector.failures, 1);
+  Injector.target = Total_Kinds;
+  EXPECT_EQ(object(reader)->references, 1u);
+  EXPECT_EQ(rows_in(reader, 0), Committed_Rows);
+  EXPECT_EQ(add_named(reader, "late", 99), SR_E_ACCESS);
+
+  ASSERT_EQ(sr_close_table_1(reader), 0);
+  EXPECT_TRUE(static_cast<sr_i_tree_t *>(tree_)->tables.empty())
+      << "the table outlived its last handle";
+  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 6, &writer), 0);
+  EXPECT_EQ(object(writer)->references, 1u);
+  EXPECT_EQ(rows_in(writer, 0), Committed_Rows);
+  EXPECT_EQ(sr_close_tree_1(tree_), 0);
 }
 
 }  // namespace

@@ -3,16 +3,16 @@
 //
 // The stack is a fixed array sized by Cu_I_Max_Stack, strings are compared
 // in place (a stored string ends with its NUL, which regexec relies on), and
-// nothing is copied or allocated. The layout comes from the value codec's
-// own description of it (pmsg_i_format.h): top-level anchors count from the
+// nothing is copied or allocated. The layout is this library's reading of
+// the encoded form (cu_i_encoded_values.h): top-level anchors count from the
 // indirect area and are trusted, as the codec wrote them; anchors nested in
 // a body count from that body and are checked against its length, so a
 // damaged body gives CU_RESULT_VALUE_MISSING rather than a stray read.
 
 #include <cstring>
 
+#include "cu_i_encoded_values.h"
 #include "cu_i_expression.h"
-#include "pmsg_i_format.h"
 
 namespace {
 
@@ -29,19 +29,19 @@ cu_i_value fixed_value(uint8_t type, const unsigned char *p_bytes) {
   cu_i_value value{};
   switch (type) {
     case QV_INT32:
-      value.integer = static_cast<int32_t>(pmsg_i_load_u32(p_bytes));
+      value.integer = static_cast<int32_t>(cu_i_load_u32(p_bytes));
       value.number = cu_i_number::signed_integer;
       break;
     case QV_UINT32:
-      value.unsigned_integer = pmsg_i_load_u32(p_bytes);
+      value.unsigned_integer = cu_i_load_u32(p_bytes);
       value.number = cu_i_number::unsigned_integer;
       break;
     case QV_INT64:
-      value.integer = static_cast<int64_t>(pmsg_i_load_u64(p_bytes));
+      value.integer = static_cast<int64_t>(cu_i_load_u64(p_bytes));
       value.number = cu_i_number::signed_integer;
       break;
     case QV_UINT64:
-      value.unsigned_integer = pmsg_i_load_u64(p_bytes);
+      value.unsigned_integer = cu_i_load_u64(p_bytes);
       value.number = cu_i_number::unsigned_integer;
       break;
     case QV_FLOAT32: {
@@ -65,8 +65,8 @@ cu_i_value fixed_value(uint8_t type, const unsigned char *p_bytes) {
 // A counted body (structured data, an array) whose count of `width`-byte
 // entries fits in it.
 bool count_fits(const unsigned char *p_body, uint32_t length, uint32_t width) {
-  return length >= Pmsg_Count_Bytes &&
-         uint64_t{pmsg_i_load_u32(p_body)} * width <= length - Pmsg_Count_Bytes;
+  return length >= Cu_I_Count_Bytes &&
+         uint64_t{cu_i_load_u32(p_body)} * width <= length - Cu_I_Count_Bytes;
 }
 
 // Makes a value of a variable-length type from its body, after checking that
@@ -75,29 +75,28 @@ int32_t body_value(uint8_t type, const unsigned char *p_body, uint32_t length, c
   value.p_bytes = p_body;
   value.length = length;
   bool shape_ok = false;
-  switch (pmsg_i_kind_of(type)) {
-    case pmsg_i_kind::string:
+  switch (cu_i_layout_of(type)) {
+    case cu_i_layout::string:
       shape_ok = length >= 1 && p_body[length - 1] == '\0';
       value.length = length - 1;  // the NUL stays behind the value
       break;
-    case pmsg_i_kind::binary:
-    case pmsg_i_kind::byte_string:
+    case cu_i_layout::bytes:
       shape_ok = true;
       break;
-    case pmsg_i_kind::handle:
-      shape_ok = length == Pmsg_Handle_Bytes;
+    case cu_i_layout::handle:
+      shape_ok = length == Cu_I_Handle_Bytes;
       break;
-    case pmsg_i_kind::structured:
-      shape_ok = count_fits(p_body, length, Pmsg_Element_Record_Bytes);
+    case cu_i_layout::structured:
+      shape_ok = count_fits(p_body, length, Cu_I_Element_Record_Bytes);
       break;
-    case pmsg_i_kind::array32:
+    case cu_i_layout::array32:
       shape_ok = count_fits(p_body, length, 4);
       break;
-    case pmsg_i_kind::array64:
+    case cu_i_layout::array64:
       shape_ok = count_fits(p_body, length, 8);
       break;
-    case pmsg_i_kind::pointer_array:
-      shape_ok = count_fits(p_body, length, Pmsg_Anchor_Bytes);
+    case cu_i_layout::pointer_array:
+      shape_ok = count_fits(p_body, length, Cu_I_Anchor_Bytes);
       break;
     default:
       break;
@@ -109,12 +108,12 @@ int32_t body_value(uint8_t type, const unsigned char *p_body, uint32_t length, c
 // data or of a pointer array): its anchor counts from that body.
 int32_t nested_value(uint8_t type, const unsigned char *p_slot, const cu_i_value &enclosing,
                      cu_i_value &value) {
-  if (pmsg_i_is_fixed(pmsg_i_kind_of(type))) {
+  if (cu_i_layout_of(type) == cu_i_layout::number) {
     value = fixed_value(type, p_slot);
     return CU_RESULT_OK;
   }
-  const uint32_t offset = pmsg_i_load_u32(p_slot);
-  const uint32_t length = pmsg_i_load_u32(p_slot + 4);
+  const uint32_t offset = cu_i_load_u32(p_slot);
+  const uint32_t length = cu_i_load_u32(p_slot + 4);
   if (offset > enclosing.length || length > enclosing.length - offset) {
     return CU_RESULT_VALUE_MISSING;
   }
@@ -122,30 +121,30 @@ int32_t nested_value(uint8_t type, const unsigned char *p_slot, const cu_i_value
 }
 
 uint32_t count_of(const cu_i_value &counted) {
-  return pmsg_i_load_u32(counted.p_bytes);
+  return cu_i_load_u32(counted.p_bytes);
 }
 
 // Element `index` (below the count) of an array body.
 int32_t element_value(uint8_t array_type, const cu_i_value &array, uint32_t index,
                       cu_i_value &value) {
   const uint8_t element_type = static_cast<uint8_t>(array_type - (QV_INT32_ARRAY - QV_INT32));
-  const unsigned char *p_elements = array.p_bytes + Pmsg_Count_Bytes;
-  switch (pmsg_i_kind_of(array_type)) {
-    case pmsg_i_kind::array32:
+  const unsigned char *p_elements = array.p_bytes + Cu_I_Count_Bytes;
+  switch (cu_i_layout_of(array_type)) {
+    case cu_i_layout::array32:
       value = fixed_value(element_type, p_elements + uint64_t{index} * 4);
       return CU_RESULT_OK;
-    case pmsg_i_kind::array64:
+    case cu_i_layout::array64:
       value = fixed_value(element_type, p_elements + uint64_t{index} * 8);
       return CU_RESULT_OK;
     default:
-      return nested_value(element_type, p_elements + uint64_t{index} * Pmsg_Anchor_Bytes, array,
+      return nested_value(element_type, p_elements + uint64_t{index} * Cu_I_Anchor_Bytes, array,
                           value);
   }
 }
 
 // The element record (type, then slot) at `position`, below the count.
 const unsigned char *record_of(const cu_i_value &structured, uint32_t position) {
-  return structured.p_bytes + Pmsg_Count_Bytes + uint64_t{position} * Pmsg_Element_Record_Bytes;
+  return structured.p_bytes + Cu_I_Count_Bytes + uint64_t{position} * Cu_I_Element_Record_Bytes;
 }
 
 // The element at `position` of a structured value, which must be of the type
@@ -156,7 +155,7 @@ int32_t field_value(uint32_t position, uint8_t type, const cu_i_value &structure
     return CU_RESULT_VALUE_MISSING;
   }
   const unsigned char *p_record = record_of(structured, position);
-  if (pmsg_i_load_u32(p_record) != type) {
+  if (cu_i_load_u32(p_record) != type) {
     return CU_RESULT_VALUE_MISSING;
   }
   return nested_value(type, p_record + 4, structured, value);
@@ -274,7 +273,7 @@ bool is_in_projection(const cu_i_value &value, uint32_t position, uint8_t field_
       return false;
     }
     if (position >= count_of(structured) ||
-        pmsg_i_load_u32(record_of(structured, position)) != field_type) {
+        cu_i_load_u32(record_of(structured, position)) != field_type) {
       continue;
     }
     cu_i_value field;
@@ -309,16 +308,16 @@ int32_t cu_i_evaluate_encoded(const cu_expression_t &expression, const unsigned 
         if (instruction.operand >= total_slots) {
           return CU_RESULT_VALUE_MISSING;
         }
-        stack[top++] =
-            fixed_value(instruction.data_type, p_slots + uint64_t{instruction.operand} * 8);
+        stack[top++] = fixed_value(instruction.data_type,
+                                   p_slots + uint64_t{instruction.operand} * Cu_I_Slot_Bytes);
         break;
       case cu_i_operation::load_variable: {
         if (instruction.operand >= total_slots) {
           return CU_RESULT_VALUE_MISSING;
         }
-        const unsigned char *p_slot = p_slots + uint64_t{instruction.operand} * 8;
-        result = body_value(instruction.data_type, p_indirect + pmsg_i_load_u32(p_slot),
-                            pmsg_i_load_u32(p_slot + 4), stack[top++]);
+        const unsigned char *p_slot = p_slots + uint64_t{instruction.operand} * Cu_I_Slot_Bytes;
+        result = body_value(instruction.data_type, p_indirect + cu_i_load_u32(p_slot),
+                            cu_i_load_u32(p_slot + 4), stack[top++]);
         if (result != CU_RESULT_OK) {
           return result;
         }

@@ -13,8 +13,8 @@
 #include <cstdint>
 #include <string>
 
-#include "qv_sr.h"
 #include "frame/sr_i_source_location.h"
+#include "qv_sr.h"
 
 /* The catalog of the registry's messages and its message set. */
 inline constexpr const char *Sr_Message_Catalog = "qv_sr.cat";
@@ -82,13 +82,13 @@ int32_t sr_i_raise_invalid_criteria(const char *p_criteria,
 
 /*
  * 16: a write found the filesystem full. Names the filesystem holding
- * `p_path` from the mount table (Sr_Mount_Table_Path). When the mount table
- * cannot be read, returns 16 without raising anything.
+ * `p_path` from the mount table (Sr_Mount_Table_Path), or "UNKNOWN" when
+ * the mount table cannot be read.
  */
-int32_t trace_filesystem_full_for_path(const char *p_path);
+int32_t sr_i_raise_filesystem_full(const char *p_path);
 
-/* The mount table read by trace_filesystem_full_for_path: "/etc/mtab";
- * tests point it at a file of their own. */
+/* The mount table read by sr_i_raise_filesystem_full: "/etc/mtab"; tests
+ * point it at a file of their own. */
 extern const char *Sr_Mount_Table_Path;
 
 /* The filesystem holding a path: its device and the directory it is
@@ -107,6 +107,7 @@ bool get_filesystem_containing_file(const char *p_path, const char *p_mount_tabl
  * 202 with the richer message 2605-213: no row of table `p_table_name`
  * (null: "(UNKNOWN_TABLE_NAME)") has the key `p_key` of type `type`.
  */
-int32_t trace_key_not_found(const char *p_table_name, const qv_value_t *p_key, qv_data_type_t type);
+int32_t sr_i_raise_key_not_found(const char *p_table_name, const qv_value_t *p_key,
+                                 qv_data_type_t type);
 
 #endif /* SR_I_ERRORS_H */

@@ -102,11 +102,11 @@ bool get_filesystem_containing_file(const char *p_path, const char *p_mount_tabl
   return true;
 }
 
-int32_t trace_filesystem_full_for_path(const char *p_path) {
+int32_t sr_i_raise_filesystem_full(const char *p_path) {
+  // An unreadable mount table still gets the error raised, with the
+  // filesystem "UNKNOWN": the caller must learn that the disk is full.
   sr_i_filesystem_t filesystem;
-  if (!get_filesystem_containing_file(p_path, Sr_Mount_Table_Path, filesystem)) {
-    return SR_E_FILESYSTEM_FULL;
-  }
+  get_filesystem_containing_file(p_path, Sr_Mount_Table_Path, filesystem);
   cu_set_error_1(SR_E_FILESYSTEM_FULL, 0, Sr_Message_Catalog, Sr_Message_Set,
                  SR_I_MESSAGE_FILESYSTEM_FULL, cu_mesgtbl_qv_sr_set[SR_I_MESSAGE_FILESYSTEM_FULL],
                  filesystem.device.c_str(), filesystem.directory.c_str());

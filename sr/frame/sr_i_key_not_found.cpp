@@ -58,8 +58,8 @@ void render_key(const qv_value_t *p_key, qv_data_type_t type, char *p_text, size
 
 }  // namespace
 
-int32_t trace_key_not_found(const char *p_table_name, const qv_value_t *p_key,
-                            qv_data_type_t type) {
+int32_t sr_i_raise_key_not_found(const char *p_table_name, const qv_value_t *p_key,
+                                 qv_data_type_t type) {
   char key_text[512];
   render_key(p_key, type, key_text, sizeof key_text);
   const char *p_table = p_table_name ? p_table_name : "(UNKNOWN_TABLE_NAME)";

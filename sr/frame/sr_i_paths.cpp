@@ -9,12 +9,11 @@
 #include "frame/sr_i_paths.h"
 
 #include <cctype>
-#include <cerrno>
 #include <cstring>
 #include <string_view>
 
 #include "frame/sr_i_errors.h"
-#include "storage/sr_i_system_calls.h"
+#include "storage/sr_i_files.h"
 
 namespace {
 
@@ -108,20 +107,10 @@ int32_t sr_i_resolve_path(const sr_i_tree_t *p_tree, const char *p_registry_path
 }
 
 int32_t sr_i_create_all_directories_in_path(const std::string &path) {
-  // One mkdir: 0 when made or already there, else the raised 16 or 10.
-  const auto make_directory = [](const std::string &directory) -> int32_t {
-    if (Sr_File_System.mkdir(directory.c_str(), Sr_Directory_Mode) == 0 || errno == EEXIST) {
-      return 0;
-    }
-    if (errno == ENOSPC) {
-      return trace_filesystem_full_for_path(directory.c_str());
-    }
-    return sr_i_raise_system_call("mkdir", errno);
-  };
   for (size_t slash = path.find('/', 1); slash != path.npos; slash = path.find('/', slash + 1)) {
-    if (const int32_t rc = make_directory(path.substr(0, slash)); rc != 0) {
+    if (const int32_t rc = sr_i_make_directory(path.substr(0, slash).c_str()); rc != 0) {
       return rc;
     }
   }
-  return make_directory(path);
+  return sr_i_make_directory(path.c_str());
 }

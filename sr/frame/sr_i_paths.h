@@ -43,9 +43,9 @@ int32_t sr_i_resolve_path(const sr_i_tree_t *p_tree, const char *p_registry_path
 const sr_i_mount_point_t *sr_i_find_mount_point(const sr_i_tree_t *p_tree, const std::string &path);
 
 /*
- * Creates every directory of `path` (mode 0755), keeping those that exist.
- * Returns 0; 16 (raised by the filesystem-full report) when the file system
- * is full; 10 (raised, naming "mkdir") for any other failure.
+ * Creates every directory of `path` (mode 0755), keeping those that exist;
+ * each one made is flushed into its parent. Returns 0, or the raised 206,
+ * 16 or 10 of the first that cannot be made.
  */
 int32_t sr_i_create_all_directories_in_path(const std::string &path);
 

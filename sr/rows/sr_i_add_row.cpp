@@ -6,12 +6,12 @@
 
 #include <cstring>
 
-#include "qv_cu.h"
 #include "frame/sr_i_errors.h"
-#include "tables/sr_i_hash_table.h"
+#include "frame/sr_i_tree.h"
+#include "qv_cu.h"
 #include "rows/sr_i_row_operations.h"
 #include "rows/sr_i_rows.h"
-#include "frame/sr_i_tree.h"
+#include "tables/sr_i_hash_table.h"
 
 namespace {
 
@@ -225,28 +225,27 @@ int32_t sr_i_add_row(sr_i_table_t *p_table, const char *const *p_column_names,
     return rc;
   }
   const bool revived = p_revived_element != nullptr;
-  if (const int32_t rc =
-          sr_i_rb_allocate_record(&p_table->record_buffer_pool, p_record, p_previous_free,
-                                  builder.length(), SR_I_RECORD_ROW);
-      rc != 0) {
-    if (revived) {
-      p_entry->p_applied = nullptr;
-    } else {
-      remove_hash_element(p_table, p_entry);
-      sr_i_rows_free_chain_insert(p_table, p_entry);
-    }
-    return rc;
+  // Taking the record and queueing the change are the last steps that can
+  // fail; either failure gives the row back here: a revived row loses its
+  // record again, a new one leaves the hash table and frees its entry.
+  int32_t rc = sr_i_rb_allocate_record(&p_table->record_buffer_pool, p_record, p_previous_free,
+                                       builder.length(), SR_I_RECORD_ROW);
+  const bool record_taken = rc == 0;
+  if (record_taken) {
+    // A revived row keeps its pending deletion's entry, so only a new row
+    // can fail here.
+    rc = sr_i_add_change_entry(p_table, p_entry);
   }
-  // A revived row keeps its pending deletion's entry, so only a new row can
-  // fail here.
-  if (const int32_t rc = sr_i_add_change_entry(p_table, p_entry); rc != 0) {
+  if (rc != 0) {
     if (revived) {
       p_entry->p_applied = nullptr;
     } else {
       remove_hash_element(p_table, p_entry);
       sr_i_rows_free_chain_insert(p_table, p_entry);
     }
-    sr_i_rb_free_record(&p_table->record_buffer_pool, p_record);
+    if (record_taken) {
+      sr_i_rb_free_record(&p_table->record_buffer_pool, p_record);
+    }
     return rc;
   }
   sr_i_set_row_header_word(p_record, p_entry->p_committed != nullptr ? p_entry->file_offset : 0);

@@ -8,13 +8,13 @@
 
 #include <cstring>
 
-#include "qv_pmsg.h"
-#include "tables/sr_i_columns.h"
 #include "frame/sr_i_errors.h"
-#include "tables/sr_i_hash_table.h"
+#include "frame/sr_i_tree.h"
+#include "qv_pmsg.h"
 #include "rows/sr_i_row_operations.h"
 #include "rows/sr_i_rows.h"
-#include "frame/sr_i_tree.h"
+#include "tables/sr_i_columns.h"
+#include "tables/sr_i_hash_table.h"
 
 namespace {
 
@@ -216,7 +216,7 @@ int32_t sr_i_get_fixed_row_index_for_key(sr_i_table_t *p_table, qv_value_t row_k
     rc = scan_for_key(p_table, key, p_fixed_row_index);
   }
   if (rc == SR_E_NO_ROW_FOR_KEY) {
-    return trace_key_not_found(p_table->p_name, &key, key_type);
+    return sr_i_raise_key_not_found(p_table->p_name, &key, key_type);
   }
   return rc;
 }

@@ -19,41 +19,46 @@
 #include <cassert>
 #include <cstdint>
 
-#include "schema/sr_i_application_metadata.h"
-#include "tables/sr_i_hash_table.h"
-#include "rows/sr_i_rows.h"
 #include "frame/sr_i_source_location.h"
-#include "storage/sr_i_storage.h"
 #include "frame/sr_i_trace.h"
+#include "rows/sr_i_rows.h"
+#include "schema/sr_i_application_metadata.h"
+#include "storage/sr_i_storage.h"
+#include "storage/sr_i_table_file.h"
+#include "tables/sr_i_hash_table.h"
 
 namespace {
-
-constexpr uint32_t Large_File_Bytes = 16384;
-constexpr uint32_t Least_Live_Percentage = 50;
 
 // The address as the records show it: its low 32 bits in hexadecimal.
 unsigned int trace_address(const sr_i_table_t *p_table) {
   return static_cast<unsigned int>(reinterpret_cast<uintptr_t>(p_table));
 }
 
+// What the records show of a table's file; a transient table has none.
+const sr_i_table_file_t &file_of(const sr_i_table_t *p_table) {
+  static const sr_i_table_file_t No_File;
+  return p_table->p_file != nullptr ? *p_table->p_file : No_File;
+}
+
 void trace_apply(const sr_i_table_t *p_table, uint32_t rewrite,
                  sr_i_source_location where = sr_i_source_location::current()) {
-  tr_record_fmt_string_1(
-      Sr_Trace_Component, TR_DEVELOPMENT_RECORD_ID, "DV|APP|%.3d|%x|%u|%u|%u|%u|%u|%d|%d|%u",
-      static_cast<int>(where.line()), trace_address(p_table), p_table->ready_for_commit,
-      p_table->disk_commit_record_offset, p_table->disk_applied_commit_record_offset,
-      p_table->file_length, p_table->rewrite_file_length, p_table->file_fd,
-      p_table->rewrite_file_fd, rewrite);
+  const sr_i_table_file_t &file = file_of(p_table);
+  tr_record_fmt_string_1(Sr_Trace_Component, TR_DEVELOPMENT_RECORD_ID,
+                         "DV|APP|%.3d|%x|%u|%u|%u|%u|%u|%d|%d|%u", static_cast<int>(where.line()),
+                         trace_address(p_table), p_table->ready_for_commit,
+                         file.commit_record.offset, file.applied_commit_record.offset, file.length,
+                         file.rewrite_length, file.fd, file.rewrite_fd, rewrite);
 }
 
 // Commit and abort records share their fields.
 void trace_step(const char *p_step, const sr_i_table_t *p_table,
                 sr_i_source_location where = sr_i_source_location::current()) {
+  const sr_i_table_file_t &file = file_of(p_table);
   tr_record_fmt_string_1(
       Sr_Trace_Component, TR_DEVELOPMENT_RECORD_ID, "DV|%s|%.3d|%x|%u|%u|%u|%u|%u|%d|%d", p_step,
       static_cast<int>(where.line()), trace_address(p_table), p_table->ready_for_commit,
-      p_table->commit_record_offset, p_table->applied_commit_record_offset, p_table->file_length,
-      p_table->rewrite_file_length, p_table->file_fd, p_table->rewrite_file_fd);
+      file.commit_record.offset, file.applied_commit_record.offset, file.length,
+      file.rewrite_length, file.fd, file.rewrite_fd);
 }
 
 // Takes a row whose change is undone or whose deletion is committed out of
@@ -119,15 +124,6 @@ void take_rewritten_offsets(sr_i_table_t *p_table) {
 
 }  // namespace
 
-uint32_t sr_i_rewrite_wanted(const sr_i_table_t *p_table) {
-  const uint32_t length = p_table->disk_file_length;
-  if (length <= Large_File_Bytes) {
-    return 0;
-  }
-  const uint32_t percentage = p_table->record_buffer_pool.used_bytes * 100u / length;
-  return percentage < Least_Live_Percentage ? 1 : 0;
-}
-
 int32_t sr_i_apply(sr_i_table_t *p_table, uint32_t rewrite, uint64_t change_counter) {
   if (p_table->ready_for_commit != Sr_Nothing_Applied) {
     trace_apply(p_table, rewrite);
@@ -136,11 +132,16 @@ int32_t sr_i_apply(sr_i_table_t *p_table, uint32_t rewrite, uint64_t change_coun
   p_table->applied_change_counter = (change_counter == 0 || p_table->implicitly_controlled != 0)
                                         ? p_table->change_counter + 1
                                         : change_counter;
+  uint32_t applied = Sr_Applied_In_Place;
   int32_t rc = 0;
-  if (p_table->p_file_path == nullptr) {
-    p_table->ready_for_commit = Sr_Applied_In_Place;
-  } else {
-    rc = sr_i_apply_to_file(p_table, rewrite);
+  if (p_table->p_file != nullptr) {
+    // A failed append leaves bytes behind the live commit record, where no
+    // reader looks and the next apply writes over them; a failed rewrite
+    // removes its file itself.
+    rc = sr_i_apply_to_file(p_table, rewrite, &applied);
+  }
+  if (rc == 0) {
+    p_table->ready_for_commit = applied;
   }
   trace_apply(p_table, rewrite);
   return rc;
@@ -198,17 +199,20 @@ int32_t sr_i_commit(sr_i_table_t *p_table) {
   }
   cancellation_held_off no_cancellation;
   const bool rewritten = p_table->ready_for_commit == Sr_Applied_By_Rewrite;
-  if (p_table->p_file_path != nullptr) {
-    if (const int32_t rc = sr_i_commit_file(p_table); rc != 0) {
+  int32_t rc = 0;
+  if (p_table->p_file != nullptr) {
+    bool file_committed = false;
+    rc = sr_i_commit_file(p_table, p_table->ready_for_commit, &file_committed);
+    if (!file_committed) {
       trace_step("COM", p_table);
       return rc;
     }
   }
+  // From here the new state is the file's (a failure is one of making it
+  // durable), so memory follows it whatever the code.
   sr_i_commit_in_memory(p_table, p_table->p_rows_change_list);
   sr_i_commit_in_memory(p_table, p_table->p_delete_rows_change_list);
   p_table->change_counter = p_table->applied_change_counter;
-  p_table->disk_commit_record_offset = p_table->disk_applied_commit_record_offset;
-  p_table->disk_commit_record_length = p_table->disk_applied_commit_record_length;
   p_table->total_committed_rows = p_table->total_applied_rows;
   if (rewritten) {
     take_rewritten_offsets(p_table);
@@ -216,16 +220,14 @@ int32_t sr_i_commit(sr_i_table_t *p_table) {
   sr_i_commit_application_metadata_buffer_updates(p_table->p_application_metadata);
   settle(p_table);
   trace_step("COM", p_table);
-  return 0;
+  return rc;
 }
 
 int32_t sr_i_abort(sr_i_table_t *p_table) {
   trace_step("ABT", p_table);
-  if (p_table->p_file_path != nullptr) {
-    sr_i_abort_file(p_table);
+  if (p_table->p_file != nullptr) {
+    sr_i_abort_file(p_table, p_table->ready_for_commit);
   }
-  p_table->applied_commit_record_offset = 0;
-  p_table->applied_commit_record_length = 0;
   sr_i_abort_in_memory(p_table, p_table->p_rows_change_list);
   sr_i_abort_in_memory(p_table, p_table->p_delete_rows_change_list);
   sr_i_abort_application_metadata_buffer_updates(p_table->p_application_metadata);

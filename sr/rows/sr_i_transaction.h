@@ -12,24 +12,10 @@
 
 #include <cstdint>
 
-#include "qv_sr.h"
 #include "frame/sr_i_errors.h"
 #include "frame/sr_i_read_write_lock.h"
+#include "qv_sr.h"
 #include "tables/sr_i_table.h"
-
-/* The values of ready_for_commit. */
-inline constexpr uint32_t Sr_Nothing_Applied = 0;
-inline constexpr uint32_t Sr_Applied_In_Place = 1;
-inline constexpr uint32_t Sr_Applied_By_Rewrite = 2;
-
-/*
- * Whether an apply should write the live rows into a new file instead of
- * appending: the file is past 16384 bytes and the pool's used bytes are
- * under half of it. The percentage is computed in unsigned 32-bit
- * arithmetic, wrapping for pools past 42,949,672 bytes, as the file format's
- * other writers do.
- */
-uint32_t sr_i_rewrite_wanted(const sr_i_table_t *p_table);
 
 /* Moves the pending changes to applied. `change_counter` 0, or any value on
  * an implicitly controlled table, means the committed counter plus 1.

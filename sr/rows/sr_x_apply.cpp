@@ -2,6 +2,7 @@
 
 #include "frame/sr_i_frame.h"
 #include "rows/sr_i_transaction.h"
+#include "storage/sr_i_storage.h"
 
 namespace {
 constexpr sr_i_entry_point_t Apply{7, true};

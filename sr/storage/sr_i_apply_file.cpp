@@ -11,25 +11,26 @@
 // file at the old committed state or at the new one. Abort cuts the
 // appended tail off again, or removes the rewrite file.
 
-#include <cerrno>
+#include <fcntl.h>
+
 #include <cstdlib>
 #include <cstring>
 #include <new>
-#include <string>
+#include <utility>
 #include <vector>
 
-#include "storage/sr_i_commit_record.h"
 #include "frame/sr_i_errors.h"
-#include "storage/sr_i_system_calls.h"
-#include "storage/sr_i_files.h"
 #include "rows/sr_i_rows.h"
-#include "frame/sr_i_source_location.h"
+#include "storage/sr_i_commit_record.h"
+#include "storage/sr_i_files.h"
 #include "storage/sr_i_storage.h"
-#include "rows/sr_i_transaction.h"
+#include "storage/sr_i_table_file.h"
 
 namespace {
 
 constexpr int Gathered_Records = 16;
+constexpr uint32_t Large_File_Bytes = 16384;
+constexpr uint32_t Least_Live_Percentage = 50;
 
 // The length of a record in the pool, the pool's header included; on disk
 // the same record is 8 bytes shorter.
@@ -40,7 +41,7 @@ uint32_t memory_record_length(void *p_record) {
 // Collects records and writes them sixteen to a gathered write.
 class record_writer {
  public:
-  explicit record_writer(int fd) : fd_(fd) {}
+  record_writer(int fd, const std::string &path) : fd_(fd), p_path_(path.c_str()) {}
 
   int32_t add(const void *p_bytes, uint32_t length) {
     batch_[count_] = {const_cast<void *>(p_bytes), length};
@@ -54,13 +55,14 @@ class record_writer {
 
  private:
   int32_t flush_batch() {
-    const int32_t rc = sr_i_writev(fd_, batch_, count_, batch_bytes_, &written_);
+    const int32_t rc = sr_i_writev(fd_, p_path_, batch_, count_, batch_bytes_, &written_);
     count_ = 0;
     batch_bytes_ = 0;
     return rc;
   }
 
   int fd_;
+  const char *p_path_;
   iovec batch_[Gathered_Records] = {};
   int count_ = 0;
   uint32_t batch_bytes_ = 0;
@@ -72,7 +74,8 @@ class record_writer {
 // sector when it needs one (the offset moves to the commit record's start),
 // writes what the writer still holds and flushes the file.
 int32_t finish_with_commit_record(record_writer &writer, uint32_t &offset,
-                                  const std::vector<unsigned char> &commit_record, int fd) {
+                                  const std::vector<unsigned char> &commit_record, int fd,
+                                  const std::string &path) {
   if (const uint32_t padding = sr_i_commit_record_padding(offset); padding != 0) {
     if (const int32_t rc = writer.add(Sr_Commit_Record_Padding, padding); rc != 0) {
       return rc;
@@ -87,7 +90,7 @@ int32_t finish_with_commit_record(record_writer &writer, uint32_t &offset,
   if (const int32_t rc = writer.finish(); rc != 0) {
     return rc;
   }
-  return sr_i_fdatasync(fd);
+  return sr_i_flush_file(fd, path.c_str());
 }
 
 // The disk form of a row record: header, then the memory record's data.
@@ -102,16 +105,13 @@ void put_row_record(unsigned char *p_disk, void *p_record, const uint32_t *p_rep
   }
 }
 
-int32_t report_write_failure(sr_i_table_t *p_table, int32_t rc) {
-  return rc == SR_E_FILESYSTEM_FULL ? trace_filesystem_full_for_path(p_table->p_file_path) : rc;
-}
-
 // Appends the changed rows, a deletion record and the commit record behind
 // the live commit record, and flushes.
 int32_t append(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_record) {
-  const uint32_t start = p_table->disk_commit_record_offset + p_table->disk_commit_record_length;
-  if (Sr_File_System.lseek(p_table->file_fd, start, SEEK_SET) < 0) {
-    return sr_i_raise_system_call("lseek64", errno);
+  sr_i_table_file_t &file = *p_table->p_file;
+  const uint32_t start = file.commit_record.end();
+  if (const int32_t rc = sr_i_seek(file.fd, start); rc != 0) {
+    return rc;
   }
   size_t row_bytes = 0;
   for (auto *p_change = p_table->p_rows_change_list; p_change; p_change = p_change->p_next) {
@@ -127,7 +127,7 @@ int32_t append(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_r
   } catch (const std::bad_alloc &) {
     return sr_i_raise_no_memory();
   }
-  record_writer writer(p_table->file_fd);
+  record_writer writer(file.fd, file.path);
   uint32_t offset = start;
   size_t at = 0;
   for (auto *p_change = p_table->p_rows_change_list; p_change; p_change = p_change->p_next) {
@@ -140,7 +140,7 @@ int32_t append(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_r
     p_entry->applied_file_offset = offset;
     sr_i_rb_record_header(p_entry->p_applied)->disk_table_offset = offset;
     if (const int32_t rc = writer.add(&rows[at], disk_length); rc != 0) {
-      return report_write_failure(p_table, rc);
+      return rc;
     }
     at += disk_length;
     offset += disk_length;
@@ -158,39 +158,35 @@ int32_t append(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_r
     deletion[2] = Sr_Deletion_Record;
     deletion[3] = deleted;
     if (const int32_t rc = writer.add(deletion.data(), length); rc != 0) {
-      return report_write_failure(p_table, rc);
+      return rc;
     }
     offset += length;
   }
-  if (const int32_t rc = finish_with_commit_record(writer, offset, commit_record, p_table->file_fd);
+  if (const int32_t rc =
+          finish_with_commit_record(writer, offset, commit_record, file.fd, file.path);
       rc != 0) {
-    return report_write_failure(p_table, rc);
+    return rc;
   }
-  p_table->disk_applied_commit_record_offset =
-      start + writer.written() - static_cast<uint32_t>(commit_record.size());
-  const uint32_t end = start + writer.written();
-  if (end > p_table->disk_file_length) {
-    p_table->disk_file_length = end;
+  file.applied_commit_record = {
+      start + writer.written() - static_cast<uint32_t>(commit_record.size()),
+      static_cast<uint32_t>(commit_record.size())};
+  if (const uint32_t end = start + writer.written(); end > file.length) {
+    file.length = end;
   }
-  p_table->file_length = p_table->disk_file_length;
-  p_table->ready_for_commit = Sr_Applied_In_Place;
   return 0;
 }
 
 // Removes a rewrite file that will not be committed.
-void discard_rewrite_file(sr_i_table_t *p_table) {
-  if (p_table->rewrite_file_fd >= 0) {
-    Sr_File_System.close(p_table->rewrite_file_fd);
-    p_table->rewrite_file_fd = -1;
-  }
-  sr_i_set_rewrite_path(p_table);
-  Sr_File_System.unlink(p_table->p_file_path);
-  sr_i_set_data_path(p_table);
-  p_table->rewrite_file_length = 0;
+void discard_rewrite_file(sr_i_table_file_t &file) {
+  sr_i_close_file(file.rewrite_fd);
+  file.rewrite_fd = -1;
+  sr_i_discard_file(file.rewrite_path.c_str());
+  file.rewrite_length = 0;
 }
 
 // Writes the live rows into the rewrite file.
 int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_record) {
+  sr_i_table_file_t &file = *p_table->p_file;
   std::vector<unsigned char> metadata;
   if (const int32_t rc = sr_i_convert_metadata_memory_record_to_disk_record(p_table, metadata);
       rc != 0) {
@@ -211,10 +207,10 @@ int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned cha
   } catch (const std::bad_alloc &) {
     return sr_i_raise_no_memory();
   }
-  record_writer writer(p_table->rewrite_file_fd);
+  record_writer writer(file.rewrite_fd, file.rewrite_path);
   if (const int32_t rc = writer.add(metadata.data(), static_cast<uint32_t>(metadata.size()));
       rc != 0) {
-    return report_write_failure(p_table, rc);
+    return rc;
   }
   auto offset = static_cast<uint32_t>(metadata.size());
   size_t at = 0;
@@ -231,146 +227,135 @@ int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned cha
     entry.applied_file_offset = offset;
     sr_i_rb_record_header(entry.p_applied)->disk_table_offset = offset;
     if (const int32_t rc = writer.add(&rows[at], disk_length); rc != 0) {
-      return report_write_failure(p_table, rc);
+      return rc;
     }
     at += disk_length;
     offset += disk_length;
   }
-  if (const int32_t rc =
-          finish_with_commit_record(writer, offset, commit_record, p_table->rewrite_file_fd);
+  if (const int32_t rc = finish_with_commit_record(writer, offset, commit_record, file.rewrite_fd,
+                                                   file.rewrite_path);
       rc != 0) {
-    return report_write_failure(p_table, rc);
+    return rc;
   }
-  p_table->disk_applied_commit_record_offset = offset;
-  p_table->rewrite_file_length = writer.written();
-  p_table->ready_for_commit = Sr_Applied_By_Rewrite;
+  file.applied_commit_record = {offset, static_cast<uint32_t>(commit_record.size())};
+  file.rewrite_length = writer.written();
   return 0;
 }
 
 // Writes a complete new file beside the table file.
 int32_t rewrite(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_record) {
-  sr_i_set_rewrite_path(p_table);
-  p_table->rewrite_file_fd = sr_i_open_file(p_table->p_file_path, O_RDWR | O_CREAT, Sr_File_Mode);
-  if (p_table->rewrite_file_fd < 0) {
-    const int error_number = errno;
-    int32_t rc;
-    if (error_number == EACCES) {
-      rc = sr_i_raise(SR_E_ACCESS);
-    } else if (error_number == ENOSPC) {
-      rc = trace_filesystem_full_for_path(p_table->p_file_path);
-    } else {
-      rc = sr_i_raise_system_call("open", error_number);
-    }
-    sr_i_set_data_path(p_table);
+  sr_i_table_file_t &file = *p_table->p_file;
+  if (const int32_t rc =
+          sr_i_open_file(file.rewrite_path.c_str(), O_RDWR | O_CREAT, &file.rewrite_fd);
+      rc != 0) {
     return rc;
   }
-  sr_i_set_data_path(p_table);
-  if (sr_i_lock_file(p_table->rewrite_file_fd, true) != 0) {
-    const int32_t rc = sr_i_raise_system_call("lockf", errno);
-    discard_rewrite_file(p_table);
-    return rc;
+  int32_t rc = sr_i_lock_file(file.rewrite_fd);
+  if (rc == 0) {
+    rc = write_rewrite_file(p_table, commit_record);
   }
-  const int32_t rc = write_rewrite_file(p_table, commit_record);
   if (rc != 0) {
-    discard_rewrite_file(p_table);
+    discard_rewrite_file(file);
   }
   return rc;
 }
 
 // Writes the type word of the committed commit record.
-int32_t write_commit_record_type(sr_i_table_t *p_table, uint32_t type) {
-  if (Sr_File_System.lseek(p_table->file_fd, p_table->disk_commit_record_offset + 8, SEEK_SET) <
-      0) {
-    return sr_i_raise_system_call("lseek64", errno);
+int32_t write_commit_record_type(const sr_i_table_file_t &file, uint32_t type) {
+  if (const int32_t rc = sr_i_seek(file.fd, file.commit_record.offset + 8); rc != 0) {
+    return rc;
   }
-  return report_write_failure(p_table, sr_i_write(p_table->file_fd, &type, sizeof type));
+  return sr_i_write(file.fd, file.path.c_str(), &type, sizeof type);
 }
 
 // Kills the old commit record, so that readers go on to the one apply
 // appended. When the flush fails it is unknown whether the 0 reached the
 // disk, so the record is made live again before the failure is returned.
-int32_t commit_appended(sr_i_table_t *p_table) {
-  if (const int32_t rc = write_commit_record_type(p_table, Sr_Dead_Record); rc != 0) {
+int32_t commit_appended(sr_i_table_file_t &file) {
+  if (const int32_t rc = write_commit_record_type(file, Sr_Dead_Record); rc != 0) {
     return rc;
   }
-  const int32_t flush_rc = sr_i_fdatasync(p_table->file_fd);
+  const int32_t flush_rc = sr_i_flush_file(file.fd, file.path.c_str());
   if (flush_rc == 0) {
     return 0;
   }
-  if (const int32_t rc = write_commit_record_type(p_table, Sr_Live_Commit_Record); rc != 0) {
+  if (const int32_t rc = write_commit_record_type(file, Sr_Live_Commit_Record); rc != 0) {
     return rc;
   }
-  if (sr_i_fdatasync(p_table->file_fd) == SR_E_FILESYSTEM_FULL) {
-    trace_filesystem_full_for_path(p_table->p_file_path);
-  }
-  return report_write_failure(p_table, flush_rc);
+  sr_i_flush_file(file.fd, file.path.c_str());
+  return flush_rc;
 }
 
-int32_t commit_rewritten(sr_i_table_t *p_table) {
-  sr_i_set_rewrite_path(p_table);
-  std::string rewrite_path;
-  try {
-    rewrite_path = p_table->p_file_path;
-  } catch (const std::bad_alloc &) {
-    sr_i_set_data_path(p_table);
-    return sr_i_raise_no_memory();
+// Renames the rewrite file onto the table file. A failed rename leaves the
+// rewrite file in place, complete and flushed: the commit can be tried
+// again, or the abort removes it. Once renamed, the new file is the table's
+// whatever else fails: `*p_committed` says so.
+int32_t commit_rewritten(sr_i_table_file_t &file, bool *p_committed) {
+  const int32_t rc = sr_i_rename_durably(file.rewrite_path.c_str(), file.path.c_str(), p_committed);
+  if (!*p_committed) {
+    return rc;
   }
-  sr_i_set_data_path(p_table);
-  // A failed rename leaves the rewrite file in place, complete and flushed:
-  // the commit can be tried again, or the abort removes it.
-  if (Sr_File_System.rename(rewrite_path.c_str(), p_table->p_file_path) != 0) {
-    const int error_number = errno;
-    if (error_number == EACCES) {
-      return sr_i_raise(SR_E_ACCESS);
-    }
-    if (error_number == ENOSPC) {
-      return trace_filesystem_full_for_path(p_table->p_file_path);
-    }
-    return sr_i_raise_system_call("rename", error_number);
-  }
-  Sr_File_System.close(p_table->file_fd);
-  p_table->file_fd = p_table->rewrite_file_fd;
-  p_table->rewrite_file_fd = -1;
-  p_table->file_length = p_table->rewrite_file_length;
-  p_table->disk_file_length = p_table->rewrite_file_length;
-  p_table->rewrite_file_length = 0;
-  return 0;
+  sr_i_close_file(file.fd);
+  file.fd = std::exchange(file.rewrite_fd, -1);
+  file.length = std::exchange(file.rewrite_length, 0);
+  return rc;
 }
 
 }  // namespace
 
-int32_t sr_i_apply_to_file(sr_i_table_t *p_table, uint32_t rewrite_file) {
+uint32_t sr_i_rewrite_wanted(const sr_i_table_t *p_table) {
+  if (p_table->p_file == nullptr) {
+    return 0;
+  }
+  const uint32_t length = p_table->p_file->length;
+  if (length <= Large_File_Bytes) {
+    return 0;
+  }
+  const uint32_t percentage = p_table->record_buffer_pool.used_bytes * 100u / length;
+  return percentage < Least_Live_Percentage ? 1 : 0;
+}
+
+int32_t sr_i_apply_to_file(sr_i_table_t *p_table, uint32_t rewrite_file, uint32_t *p_applied) {
   std::vector<unsigned char> commit_record;
   if (const int32_t rc = sr_i_create_commit_record(p_table->p_application_metadata,
                                                    p_table->applied_change_counter, commit_record);
       rc != 0) {
     return rc;
   }
-  p_table->disk_applied_commit_record_length = static_cast<uint32_t>(commit_record.size());
-  return rewrite_file != 0 ? rewrite(p_table, commit_record) : append(p_table, commit_record);
+  if (rewrite_file != 0) {
+    *p_applied = Sr_Applied_By_Rewrite;
+    return rewrite(p_table, commit_record);
+  }
+  *p_applied = Sr_Applied_In_Place;
+  return append(p_table, commit_record);
 }
 
-int32_t sr_i_commit_file(sr_i_table_t *p_table) {
-  if (p_table->ready_for_commit == Sr_Applied_By_Rewrite) {
-    return commit_rewritten(p_table);
+int32_t sr_i_commit_file(sr_i_table_t *p_table, uint32_t applied, bool *p_committed) {
+  sr_i_table_file_t &file = *p_table->p_file;
+  *p_committed = false;
+  int32_t rc;
+  if (applied == Sr_Applied_By_Rewrite) {
+    rc = commit_rewritten(file, p_committed);
+  } else {
+    rc = commit_appended(file);
+    *p_committed = rc == 0;
   }
-  return commit_appended(p_table);
+  if (*p_committed) {
+    file.commit_record = file.applied_commit_record;
+  }
+  return rc;
 }
 
-void sr_i_abort_file(sr_i_table_t *p_table) {
-  if (p_table->ready_for_commit == Sr_Applied_By_Rewrite) {
-    discard_rewrite_file(p_table);
-  } else if (p_table->ready_for_commit == Sr_Applied_In_Place) {
-    const uint32_t committed_end =
-        p_table->disk_commit_record_offset + p_table->disk_commit_record_length;
-    if (Sr_File_System.ftruncate(p_table->file_fd, committed_end) == 0) {
-      p_table->disk_file_length = committed_end;
-      p_table->file_length = committed_end;
+void sr_i_abort_file(sr_i_table_t *p_table, uint32_t applied) {
+  sr_i_table_file_t &file = *p_table->p_file;
+  if (applied == Sr_Applied_By_Rewrite) {
+    discard_rewrite_file(file);
+  } else if (applied == Sr_Applied_In_Place) {
+    const uint32_t committed_end = file.commit_record.end();
+    if (sr_i_truncate(file.fd, file.path.c_str(), committed_end) == 0) {
+      file.length = committed_end;
     }
-    if (sr_i_fdatasync(p_table->file_fd) == SR_E_FILESYSTEM_FULL) {
-      trace_filesystem_full_for_path(p_table->p_file_path);
-    }
+    sr_i_flush_file(file.fd, file.path.c_str());
   }
-  p_table->applied_commit_record_offset = 0;
-  p_table->applied_commit_record_length = 0;
+  file.applied_commit_record = file.commit_record;
 }

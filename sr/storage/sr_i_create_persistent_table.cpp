@@ -6,36 +6,33 @@
 // file before anything is written, moves with the rename onto the table
 // file and keeps other writers out while the table is open.
 
-#include <cerrno>
-#include <cstdlib>
-#include <cstring>
+#include <fcntl.h>
+
+#include <utility>
 #include <vector>
 
-#include "storage/sr_i_commit_record.h"
-#include "tables/sr_i_create_table.h"
 #include "frame/sr_i_errors.h"
-#include "storage/sr_i_system_calls.h"
+#include "frame/sr_i_tree.h"
+#include "storage/sr_i_commit_record.h"
 #include "storage/sr_i_files.h"
 #include "storage/sr_i_storage.h"
-#include "frame/sr_i_tree.h"
+#include "storage/sr_i_table_file.h"
+#include "tables/sr_i_create_table.h"
 
 namespace {
 
-constexpr const char Rewrite_Suffix[] = "rewrite";
-
 // A failed creation: the rewrite file goes, then the table.
 int32_t give_up(sr_i_table_t *p_table, int32_t rc) {
-  sr_i_set_rewrite_path(p_table);
-  Sr_File_System.unlink(p_table->p_file_path);
+  sr_i_discard_file(p_table->p_file->rewrite_path.c_str());
   sr_i_close_table(p_table);
   return rc;
 }
 
 // Writes the first file into the open rewrite file: metadata record and
-// commit record in one gathered write, then a flush. Returns the bytes
-// written through `*p_written`.
-int32_t write_first_file(sr_i_table_t *p_table, uint32_t *p_written,
-                         uint32_t *p_commit_record_length) {
+// commit record in one gathered write, then a flush. The commit record goes
+// to `*p_commit_record`, where it lies in the file.
+int32_t write_first_file(sr_i_table_t *p_table, sr_i_record_place_t *p_commit_record) {
+  sr_i_table_file_t &file = *p_table->p_file;
   std::vector<unsigned char> metadata;
   std::vector<unsigned char> commit;
   if (const int32_t rc = sr_i_create_commit_record(p_table->p_application_metadata,
@@ -53,37 +50,21 @@ int32_t write_first_file(sr_i_table_t *p_table, uint32_t *p_written,
                       {const_cast<uint32_t *>(Sr_Commit_Record_Padding), padding},
                       {commit.data(), commit.size()}};
   const auto total = static_cast<uint32_t>(metadata.size() + padding + commit.size());
-  int32_t rc = sr_i_writev(p_table->rewrite_file_fd, records, 3, total, p_written);
-  if (rc == 0) {
-    rc = sr_i_fdatasync(p_table->rewrite_file_fd);
+  uint32_t written = 0;
+  if (const int32_t rc =
+          sr_i_writev(file.rewrite_fd, file.rewrite_path.c_str(), records, 3, total, &written);
+      rc != 0) {
+    return rc;
   }
-  if (rc == SR_E_FILESYSTEM_FULL) {
-    return trace_filesystem_full_for_path(p_table->p_file_path);
+  if (const int32_t rc = sr_i_flush_file(file.rewrite_fd, file.rewrite_path.c_str()); rc != 0) {
+    return rc;
   }
-  *p_commit_record_length = static_cast<uint32_t>(commit.size());
-  return rc;
+  *p_commit_record = {written - static_cast<uint32_t>(commit.size()),
+                      static_cast<uint32_t>(commit.size())};
+  return 0;
 }
 
 }  // namespace
-
-int32_t sr_i_set_file_paths(sr_i_table_t *p_table, const char *p_file_path,
-                            const char *p_registry_path) {
-  const size_t length = std::strlen(p_file_path);
-  auto *p_paths = static_cast<char *>(std::malloc(length + sizeof Rewrite_Suffix + 1));
-  char *p_registry_copy = p_registry_path != nullptr ? strdup(p_registry_path) : nullptr;
-  if (p_paths == nullptr || (p_registry_path != nullptr && p_registry_copy == nullptr)) {
-    std::free(p_paths);
-    std::free(p_registry_copy);
-    return sr_i_raise_no_memory();
-  }
-  std::memcpy(p_paths, p_file_path, length);
-  p_paths[length] = '\0';
-  std::memcpy(p_paths + length + 1, Rewrite_Suffix, sizeof Rewrite_Suffix);
-  p_table->p_file_path = p_paths;
-  p_table->file_path_length = static_cast<uint32_t>(length);
-  p_table->p_persistent_table_registry_path = p_registry_copy;
-  return 0;
-}
 
 int32_t sr_i_create_persistent_table(sr_i_tree_t *p_tree, const char *p_registry_path,
                                      const char *p_file_path, sr_column_t *p_columns,
@@ -96,70 +77,55 @@ int32_t sr_i_create_persistent_table(sr_i_tree_t *p_tree, const char *p_registry
     return rc;
   }
   p_table->block_size = block_size;
-  if (const int32_t rc = sr_i_set_file_paths(p_table, p_file_path, p_registry_path); rc != 0) {
+  if (const int32_t rc = sr_i_attach_table_file(p_table, p_file_path, p_registry_path); rc != 0) {
     sr_i_close_table(p_table);
     return rc;
   }
-
-  sr_i_set_rewrite_path(p_table);
-  p_table->rewrite_file_fd = sr_i_open_file(p_table->p_file_path, O_RDWR | O_CREAT, Sr_File_Mode);
-  if (p_table->rewrite_file_fd < 0) {
-    const int error_number = errno;
-    if (error_number == EACCES) {
-      sr_i_close_table(p_table);
-      return sr_i_raise(SR_E_ACCESS);
-    }
-    if (error_number == ENOSPC) {
-      return give_up(p_table, trace_filesystem_full_for_path(p_table->p_file_path));
+  sr_i_table_file_t &file = *p_table->p_file;
+  if (const int32_t rc =
+          sr_i_open_file(file.rewrite_path.c_str(), O_RDWR | O_CREAT, &file.rewrite_fd);
+      rc != 0) {
+    // An open that found the filesystem full may still have made the file.
+    if (rc == SR_E_FILESYSTEM_FULL) {
+      return give_up(p_table, rc);
     }
     sr_i_close_table(p_table);
-    return sr_i_raise_system_call("open", error_number);
+    return rc;
   }
   // Another process creating the same table holds this lock: it wins, and
   // its rewrite file is left alone. Any other failure leaves no file.
-  if (sr_i_lock_file(p_table->rewrite_file_fd, false) != 0) {
-    const int error_number = errno;
-    if (error_number == EAGAIN || error_number == EACCES || error_number == EEXIST) {
-      sr_i_close_table(p_table);
-      return sr_i_raise(SR_E_TABLE_EXISTS);
-    }
-    return give_up(p_table, sr_i_raise_system_call("lockf", error_number));
+  bool locked = false;
+  if (const int32_t rc = sr_i_try_lock_file(file.rewrite_fd, &locked); rc != 0) {
+    return give_up(p_table, rc);
   }
-  struct stat status;
-  sr_i_set_data_path(p_table);
-  if (Sr_File_System.stat(p_table->p_file_path, &status) == 0 || errno != ENOENT) {
+  if (!locked) {
+    sr_i_close_table(p_table);
+    return sr_i_raise(SR_E_TABLE_EXISTS);
+  }
+  if (!sr_i_path_is_free(file.path.c_str())) {
     return give_up(p_table, sr_i_raise(SR_E_TABLE_EXISTS));
   }
 
-  uint32_t written = 0;
-  uint32_t commit_record_length = 0;
-  if (const int32_t rc = write_first_file(p_table, &written, &commit_record_length); rc != 0) {
+  sr_i_record_place_t commit_record;
+  if (const int32_t rc = write_first_file(p_table, &commit_record); rc != 0) {
     return give_up(p_table, rc);
   }
-  sr_i_set_rewrite_path(p_table);
-  const std::string rewrite_path = p_table->p_file_path;
-  sr_i_set_data_path(p_table);
-  if (Sr_File_System.rename(rewrite_path.c_str(), p_table->p_file_path) != 0) {
-    const int error_number = errno;
-    int32_t rc;
-    if (error_number == EACCES) {
-      rc = sr_i_raise(SR_E_ACCESS);
-    } else if (error_number == ENOSPC) {
-      Sr_File_System.unlink(p_table->p_file_path);
-      rc = trace_filesystem_full_for_path(p_table->p_file_path);
-    } else {
-      rc = sr_i_raise_system_call("rename", error_number);
+  // The table exists for other processes from the rename on; it is made only
+  // when the directory entry is durable too, so a failure after the rename
+  // removes the new file again.
+  bool renamed = false;
+  if (const int32_t rc =
+          sr_i_rename_durably(file.rewrite_path.c_str(), file.path.c_str(), &renamed);
+      rc != 0) {
+    if (renamed) {
+      sr_i_discard_file(file.path.c_str());
     }
     return give_up(p_table, rc);
   }
-  p_table->file_fd = p_table->rewrite_file_fd;
-  p_table->rewrite_file_fd = -1;
-  p_table->file_length = written;
-  p_table->disk_file_length = written;
-  p_table->disk_commit_record_length = commit_record_length;
-  p_table->disk_commit_record_offset = written - commit_record_length;
-  p_table->disk_applied_commit_record_length = commit_record_length;
-  p_table->disk_applied_commit_record_offset = written - commit_record_length;
+  file.fd = std::exchange(file.rewrite_fd, -1);
+  file.length = commit_record.end();
+  file.commit_record = commit_record;
+  file.applied_commit_record = commit_record;
   *pp_table = p_table;
   return 0;
 }

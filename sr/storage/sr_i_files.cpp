@@ -1,29 +1,35 @@
-// sr_i_files.cpp - the input and output primitives of table files: opening
-// close-on-exec, writing all of a buffer or a gathered vector, flushing,
-// reading, and the whole-file lock of a descriptor. Every system call goes
-// through the file-system door (Sr_File_System), so tests can make any one
-// of them fail or be interrupted.
+// sr_i_files.cpp - the input and output primitives of table files and
+// mount directories: opening close-on-exec, writing all of a buffer or a
+// gathered vector, flushing files and directories, reading, seeking,
+// truncating, the whole-file lock of a descriptor, renaming durably and
+// removing side files. Every system call goes through the file-system door
+// (Sr_File_System), so tests can make any one of them fail or be
+// interrupted, and this is the one file that reads errno.
 //
 // An interrupted call is repeated after a pause, a bounded number of times,
-// and the retries leave a development trace record on the way out. A full
-// filesystem comes back as 16 without a message, because only the caller
-// knows which file to name; every other failure is raised here as 10. A
-// failed flush is also written to a diagnostic file in the working
-// directory, so an administrator sees it even with tracing off.
+// and the retries leave a development trace record on the way out. Each
+// primitive raises its failure where it sees the errno, naming the file's
+// filesystem when it is full and the system call otherwise, so no caller
+// has to interpret errno again. A failed flush is also written to a
+// diagnostic file in the working directory, so an administrator sees it
+// even with tracing off.
 
 #include "storage/sr_i_files.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <string>
 
-#include "qv_sr.h"
 #include "frame/sr_i_errors.h"
-#include "storage/sr_i_system_calls.h"
 #include "frame/sr_i_source_location.h"
 #include "frame/sr_i_trace.h"
+#include "qv_sr.h"
+#include "storage/sr_i_system_calls.h"
 
 namespace {
 
@@ -46,7 +52,7 @@ auto call_retrying_interrupts(Call call, uint32_t &retries) {
 }
 
 // The development record of an interrupted call; errno is kept for the
-// callers that hand it back.
+// raising that may follow.
 void trace_retries(uint32_t retries, sr_i_source_location where = sr_i_source_location::current()) {
   if (retries == 0) {
     return;
@@ -58,13 +64,16 @@ void trace_retries(uint32_t retries, sr_i_source_location where = sr_i_source_lo
   errno = error_number;
 }
 
-// The code of a failed write or flush: 16 for a full filesystem, which the
-// caller reports naming its file; anything else is raised as 10 from the
-// calling primitive.
-int32_t write_failure(const char *p_call, int error_number,
+// Raises the failure of `p_call` on the file `p_path` (null when the call
+// cannot meet a full filesystem) as the code its errno stands for. The
+// raising site is the primitive that called.
+int32_t raise_failure(const char *p_call, int error_number, const char *p_path,
                       sr_i_source_location where = sr_i_source_location::current()) {
-  if (error_number == ENOSPC) {
-    return SR_E_FILESYSTEM_FULL;
+  if (error_number == EACCES) {
+    return sr_i_raise(SR_E_ACCESS, where);
+  }
+  if (error_number == ENOSPC && p_path != nullptr) {
+    return sr_i_raise_filesystem_full(p_path);
   }
   return sr_i_raise_system_call(p_call, error_number, where);
 }
@@ -82,9 +91,18 @@ void skip_written_bytes(struct iovec *&p_io_vector, int &count, size_t written) 
   p_io_vector->iov_len -= written;
 }
 
-}  // namespace
+// The directory that holds `p_path`: everything before its last "/".
+std::string directory_of(const char *p_path) {
+  const std::string path = p_path;
+  const size_t slash = path.find_last_of('/');
+  if (slash == std::string::npos) {
+    return ".";
+  }
+  return slash == 0 ? "/" : path.substr(0, slash);
+}
 
-int sr_i_open_file(const char *p_path, int flags, mode_t mode) {
+// Opens without raising: -1 with errno as the last attempt left it.
+int open_retrying(const char *p_path, int flags, mode_t mode) {
   // O_CLOEXEC rather than a later fcntl: a thread that forks and executes in
   // between would otherwise inherit the descriptor.
   uint32_t retries = 0;
@@ -94,7 +112,40 @@ int sr_i_open_file(const char *p_path, int flags, mode_t mode) {
   return fd;
 }
 
-int32_t sr_i_write(int fd, const void *p_buffer, uint32_t length) {
+int32_t lock_whole_file(int fd, int command) {
+  struct flock whole_file {};
+  whole_file.l_type = F_WRLCK;
+  whole_file.l_whence = SEEK_SET;
+  whole_file.l_start = 0;
+  whole_file.l_len = 0;
+  whole_file.l_pid = 0;
+  uint32_t retries = 0;
+  const int locked = call_retrying_interrupts(
+      [&] { return Sr_File_System.lock(fd, command, &whole_file); }, retries);
+  trace_retries(retries);
+  return locked;
+}
+
+}  // namespace
+
+int32_t sr_i_open_file(const char *p_path, int flags, int *p_fd) {
+  *p_fd = open_retrying(p_path, flags, Sr_File_Mode);
+  if (*p_fd >= 0) {
+    return 0;
+  }
+  if (errno == ENOENT) {
+    return sr_i_raise(SR_E_NO_TABLE);
+  }
+  return raise_failure("open", errno, p_path);
+}
+
+void sr_i_close_file(int fd) {
+  if (fd >= 0) {
+    Sr_File_System.close(fd);
+  }
+}
+
+int32_t sr_i_write(int fd, const char *p_path, const void *p_buffer, uint32_t length) {
   const char *p_next = static_cast<const char *>(p_buffer);
   uint32_t retries = 0;
   int32_t rc = 0;
@@ -103,7 +154,7 @@ int32_t sr_i_write(int fd, const void *p_buffer, uint32_t length) {
         call_retrying_interrupts([&] { return Sr_File_System.write(fd, p_next, length); }, retries);
     // A write that moves nothing would be tried for ever.
     if (written <= 0) {
-      rc = write_failure("write", written == 0 ? EIO : errno);
+      rc = raise_failure("write", written == 0 ? EIO : errno, p_path);
       break;
     }
     p_next += written;
@@ -113,8 +164,8 @@ int32_t sr_i_write(int fd, const void *p_buffer, uint32_t length) {
   return rc;
 }
 
-int32_t sr_i_writev(int fd, struct iovec *p_io_vector, int count, uint32_t total_bytes,
-                    uint32_t *p_bytes_written) {
+int32_t sr_i_writev(int fd, const char *p_path, struct iovec *p_io_vector, int count,
+                    uint32_t total_bytes, uint32_t *p_bytes_written) {
   uint32_t bytes_left = total_bytes;
   uint32_t retries = 0;
   int32_t rc = 0;
@@ -122,7 +173,7 @@ int32_t sr_i_writev(int fd, struct iovec *p_io_vector, int count, uint32_t total
     const ssize_t written = call_retrying_interrupts(
         [&] { return Sr_File_System.writev(fd, p_io_vector, count); }, retries);
     if (written <= 0) {
-      rc = write_failure("writev", written == 0 ? EIO : errno);
+      rc = raise_failure("writev", written == 0 ? EIO : errno, p_path);
       break;
     }
     *p_bytes_written += static_cast<uint32_t>(written);
@@ -136,7 +187,7 @@ int32_t sr_i_writev(int fd, struct iovec *p_io_vector, int count, uint32_t total
   return rc;
 }
 
-int32_t sr_i_fdatasync(int fd) {
+int32_t sr_i_flush_file(int fd, const char *p_path) {
   uint32_t retries = 0;
   const int flushed = call_retrying_interrupts(
       [fd] {
@@ -151,9 +202,8 @@ int32_t sr_i_fdatasync(int fd) {
         return result;
       },
       retries);
-  const int32_t rc = flushed == -1 ? write_failure("fdatasync", errno) : 0;
   trace_retries(retries);
-  return rc;
+  return flushed == -1 ? raise_failure("fdatasync", errno, p_path) : 0;
 }
 
 int32_t sr_i_read(int fd, void *p_buffer, uint32_t length, uint32_t *p_bytes_read) {
@@ -178,30 +228,111 @@ int32_t sr_i_read(int fd, void *p_buffer, uint32_t length, uint32_t *p_bytes_rea
   return rc;
 }
 
-int sr_i_lock_file(int fd, bool wait) {
-  struct flock whole_file {};
-  whole_file.l_type = F_WRLCK;
-  whole_file.l_whence = SEEK_SET;
-  whole_file.l_start = 0;
-  whole_file.l_len = 0;
-  whole_file.l_pid = 0;
-  const int command = wait ? F_OFD_SETLKW : F_OFD_SETLK;
+int32_t sr_i_seek(int fd, uint32_t offset) {
+  if (Sr_File_System.lseek(fd, offset, SEEK_SET) < 0) {
+    return sr_i_raise_system_call("lseek64", errno);
+  }
+  return 0;
+}
+
+int32_t sr_i_seek_to_end(int fd, off_t *p_end) {
+  *p_end = Sr_File_System.lseek(fd, 0, SEEK_END);
+  if (*p_end < 0) {
+    return sr_i_raise_system_call("lseek64", errno);
+  }
+  return 0;
+}
+
+int32_t sr_i_truncate(int fd, const char *p_path, uint32_t length) {
   uint32_t retries = 0;
-  const int locked = call_retrying_interrupts(
-      [&] { return Sr_File_System.lock(fd, command, &whole_file); }, retries);
+  const int cut = call_retrying_interrupts(
+      [&] { return Sr_File_System.ftruncate(fd, static_cast<off_t>(length)); }, retries);
   trace_retries(retries);
-  return locked;
+  return cut == -1 ? raise_failure("ftruncate", errno, p_path) : 0;
+}
+
+int32_t sr_i_lock_file(int fd) {
+  if (lock_whole_file(fd, F_OFD_SETLKW) != 0) {
+    return sr_i_raise_system_call("lockf", errno);
+  }
+  return 0;
+}
+
+int32_t sr_i_try_lock_file(int fd, bool *p_locked) {
+  *p_locked = lock_whole_file(fd, F_OFD_SETLK) == 0;
+  if (*p_locked || errno == EAGAIN || errno == EACCES) {
+    return 0;
+  }
+  return sr_i_raise_system_call("lockf", errno);
+}
+
+bool sr_i_path_is_free(const char *p_path) {
+  struct stat status {};
+  return Sr_File_System.stat(p_path, &status) != 0 && errno == ENOENT;
+}
+
+int32_t sr_i_is_same_file(int fd, const char *p_path, bool *p_same) {
+  struct stat opened {};
+  struct stat current {};
+  *p_same = false;
+  if (Sr_File_System.fstat(fd, &opened) != 0) {
+    return sr_i_raise_system_call("fstat", errno);
+  }
+  if (Sr_File_System.stat(p_path, &current) != 0) {
+    return errno == ENOENT ? 0 : sr_i_raise_system_call("stat", errno);
+  }
+  *p_same = opened.st_dev == current.st_dev && opened.st_ino == current.st_ino;
+  return 0;
+}
+
+int32_t sr_i_rename_durably(const char *p_from, const char *p_to, bool *p_renamed) {
+  const bool renamed = Sr_File_System.rename(p_from, p_to) == 0;
+  if (p_renamed != nullptr) {
+    *p_renamed = renamed;
+  }
+  if (!renamed) {
+    return raise_failure("rename", errno, p_to);
+  }
+  return sr_i_flush_directory(directory_of(p_to).c_str());
+}
+
+int32_t sr_i_flush_directory(const char *p_directory) {
+  const int fd = open_retrying(p_directory, O_RDONLY | O_DIRECTORY, 0);
+  if (fd < 0) {
+    return raise_failure("open", errno, p_directory);
+  }
+  const int32_t rc = sr_i_flush_file(fd, p_directory);
+  sr_i_close_file(fd);
+  return rc;
+}
+
+int32_t sr_i_make_directory(const char *p_path) {
+  if (Sr_File_System.mkdir(p_path, Sr_Directory_Mode) != 0) {
+    return errno == EEXIST ? 0 : raise_failure("mkdir", errno, p_path);
+  }
+  return sr_i_flush_directory(directory_of(p_path).c_str());
+}
+
+void sr_i_discard_file(const char *p_path) {
+  Sr_File_System.unlink(p_path);
 }
 
 void sr_i_capture_errno(const char *p_function, int error_number, int line, const char *p_version) {
   char name[32];
   std::snprintf(name, sizeof name, "reginfo_pid.%u", static_cast<unsigned>(getpid()));
-  // "e": the diagnostic descriptor is close-on-exec like every other one.
-  FILE *p_file = std::fopen(name, "we");
-  if (p_file == nullptr) {
+  const int fd = open_retrying(name, O_WRONLY | O_CREAT | O_TRUNC, Sr_File_Mode);
+  if (fd < 0) {
     return;
   }
-  std::fprintf(p_file, "function(%s) errno(%d) line(%d) sccsid(%s)\n", p_function, error_number,
-               line, p_version);
-  std::fclose(p_file);
+  char line_text[512];
+  const int length =
+      std::snprintf(line_text, sizeof line_text, "function(%s) errno(%d) line(%d) sccsid(%s)\n",
+                    p_function, error_number, line, p_version);
+  if (length > 0) {
+    // A diagnostic that cannot be written is let go: the flush's own
+    // failure is what the caller reports.
+    [[maybe_unused]] const ssize_t written = Sr_File_System.write(
+        fd, line_text, std::min(static_cast<size_t>(length), sizeof line_text - 1));
+  }
+  Sr_File_System.close(fd);
 }

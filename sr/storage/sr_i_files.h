@@ -1,14 +1,17 @@
 /*
- * sr_i_files.h - the input and output primitives of table files, over the
- * file-system door (sr_i_system_calls.h).
+ * sr_i_files.h - the input and output primitives of table files and mount
+ * directories, over the file-system door (sr_i_system_calls.h). Nothing
+ * else in the library calls the door or reads errno.
  *
- * An interrupted call (EINTR) is retried after 10 ms, at most 100 times,
- * and the retries are reported in a development trace record
- * "DV|RET|<line>|<retries>|100". A full filesystem is returned as 16 with
- * no error raised: the caller reports it through
- * trace_filesystem_full_for_path, naming the file. Any other failure is
- * raised as 10 naming the system call. Bytes written before a failure stay
- * written.
+ * Every primitive raises its own failure, once, and returns the code:
+ *   - 206 when the file system refuses access (EACCES, EPERM);
+ *   - 16 for a full filesystem (ENOSPC), naming the filesystem that holds
+ *     the file from the mount table (sr_i_raise_filesystem_full);
+ *   - 10 for any other failure, naming the system call.
+ * Callers pass the code on. An interrupted call (EINTR) is retried after
+ * 10 ms, at most 100 times, and the retries are reported in a development
+ * trace record "DV|RET|<line>|<retries>|100". Bytes written before a
+ * failure stay written.
  */
 #ifndef SR_I_FILES_H
 #define SR_I_FILES_H
@@ -22,46 +25,95 @@
 inline constexpr uint32_t Sr_Interrupted_Call_Retries = 100;
 
 /*
- * Opens a file, close-on-exec, retrying interrupted opens. Returns the
- * descriptor, or -1 with errno as open left it; nothing is raised: the
- * caller decides what the errno means.
+ * Opens `p_path` with `flags` (close-on-exec is added), creating it 0644
+ * when the flags say so, and puts the descriptor in `*p_fd`. 0, 200 when
+ * the file does not exist, 206, 16 or 10.
  */
-int sr_i_open_file(const char *p_path, int flags, mode_t mode);
+int32_t sr_i_open_file(const char *p_path, int flags, int *p_fd);
 
-/* Writes all `length` bytes, going on after short writes. 0, 16 or 10. */
-int32_t sr_i_write(int fd, const void *p_buffer, uint32_t length);
+/* Closes a descriptor; -1 is ignored. Closing ends the descriptor's lock. */
+void sr_i_close_file(int fd);
 
-/*
- * Writes the `count` entries of `p_io_vector` (`total_bytes` in all),
- * going on after partial writes; the array is changed in place as it is
- * consumed. `*p_bytes_written` grows by every byte written, also when the
- * call fails. 0, 16 or 10.
- */
-int32_t sr_i_writev(int fd, struct iovec *p_io_vector, int count, uint32_t total_bytes,
-                    uint32_t *p_bytes_written);
+/* Writes all `length` bytes of the file `p_path` open as `fd`, going on
+ * after short writes. 0, 16 or 10. */
+int32_t sr_i_write(int fd, const char *p_path, const void *p_buffer, uint32_t length);
 
 /*
- * Flushes the file's data and metadata to the device. Every failure is
- * first recorded in the diagnostic file (sr_i_capture_errno). 0, 16 or 10
- * (the message names "fdatasync").
+ * Writes the `count` entries of `p_io_vector` (`total_bytes` in all) to the
+ * file `p_path` open as `fd`, going on after partial writes; the array is
+ * changed in place as it is consumed. `*p_bytes_written` grows by every
+ * byte written, also when the call fails. 0, 16 or 10.
  */
-int32_t sr_i_fdatasync(int fd);
+int32_t sr_i_writev(int fd, const char *p_path, struct iovec *p_io_vector, int count,
+                    uint32_t total_bytes, uint32_t *p_bytes_written);
+
+/*
+ * Flushes the data and metadata of the file `p_path` open as `fd` to the
+ * device (fsync). Every failure is first recorded in the diagnostic file
+ * (sr_i_capture_errno). 0, 16 or 10; messages and the diagnostic file call
+ * it "fdatasync", the name operators know the failure by.
+ */
+int32_t sr_i_flush_file(int fd, const char *p_path);
 
 /*
  * Reads up to `length` bytes from the current offset; fewer only at the end
- * of the file. `*p_bytes_read` receives the count. 0 or 10 ("read").
+ * of the file. `*p_bytes_read` receives the count. 0 or 10.
  */
 int32_t sr_i_read(int fd, void *p_buffer, uint32_t length, uint32_t *p_bytes_read);
 
+/* Moves the file offset to `offset`. 0 or 10. */
+int32_t sr_i_seek(int fd, uint32_t offset);
+
+/* Moves the file offset to the end and puts that length in `*p_end`. 0 or
+ * 10. */
+int32_t sr_i_seek_to_end(int fd, off_t *p_end);
+
+/* Cuts the file `p_path` open as `fd` to `length` bytes. 0 or 10. */
+int32_t sr_i_truncate(int fd, const char *p_path, uint32_t length);
+
 /*
- * Takes a lock over the whole file that belongs to this descriptor (an
- * open-file-description lock: it lives exactly as long as the descriptor,
- * whatever else the process opens or closes). `wait`: block until it is
- * granted; otherwise fail at once when another descriptor holds it.
- * Write locks need a descriptor open for writing. Returns 0, or -1 with
- * errno (EAGAIN or EACCES when held elsewhere); nothing is raised.
+ * Takes a write lock over the whole file that belongs to this descriptor
+ * (an open-file-description lock: it lives exactly as long as the
+ * descriptor, whatever else the process opens or closes), waiting while
+ * another descriptor holds it. Needs a descriptor open for writing. 0 or
+ * 10.
  */
-int sr_i_lock_file(int fd, bool wait);
+int32_t sr_i_lock_file(int fd);
+
+/* The same lock, without waiting: `*p_locked` is false when another
+ * descriptor holds it. 0 or 10. */
+int32_t sr_i_try_lock_file(int fd, bool *p_locked);
+
+/* Whether nothing is at `p_path`: only a lookup that finds no such name
+ * says so. A name that cannot be examined is not taken for free, and
+ * nothing is raised: the caller reports the name as taken. */
+bool sr_i_path_is_free(const char *p_path);
+
+/* Whether `fd` is the file at `p_path` now (false when nothing is there
+ * any more). 0 or 10. */
+int32_t sr_i_is_same_file(int fd, const char *p_path, bool *p_same);
+
+/*
+ * Renames `p_from` onto `p_to` and flushes the directory of `p_to`, so that
+ * the new name survives a power loss: until the directory is flushed the
+ * file system may still hold the old entry. 0, 206, 16 or 10; when the
+ * rename succeeded and only the flush failed, `*p_renamed` (if given) is
+ * true, since the file is in place for every reader now.
+ */
+int32_t sr_i_rename_durably(const char *p_from, const char *p_to, bool *p_renamed = nullptr);
+
+/* Flushes the directory `p_directory`: the names created, renamed or
+ * removed in it become durable. 0, 206, 16 or 10. */
+int32_t sr_i_flush_directory(const char *p_directory);
+
+/* Makes the directory `p_path` 0755, or finds it made, and makes its entry
+ * durable in its parent. 0, 206, 16 or 10. */
+int32_t sr_i_make_directory(const char *p_path);
+
+/* Removes the file `p_path` if it is there, raising nothing: for side files
+ * that are given up while another failure is being reported, or that may
+ * well not exist. */
+void sr_i_discard_file(const char *p_path);
 
 /*
  * Records a failed flush for the administrator in "reginfo_pid.<pid>" in
@@ -69,7 +121,6 @@ int sr_i_lock_file(int fd, bool wait);
  * "function(<name>) errno(<n>) line(<line>) sccsid(<version>)". A file that
  * cannot be written is ignored.
  */
-void sr_i_capture_errno(const char *p_function, int error_number, int line,
-                        const char *p_version);
+void sr_i_capture_errno(const char *p_function, int error_number, int line, const char *p_version);
 
 #endif /* SR_I_FILES_H */

@@ -13,24 +13,26 @@
 // used, so a damaged or hostile file fails with 14, 213, 214 or 215 and is
 // never read out of bounds.
 
+#include <fcntl.h>
+
 #include <algorithm>
-#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <memory>
 #include <new>
 #include <span>
+#include <utility>
 #include <vector>
 
+#include "frame/sr_i_errors.h"
+#include "frame/sr_i_tree.h"
+#include "rows/sr_i_rows.h"
 #include "schema/sr_i_application_metadata.h"
 #include "storage/sr_i_commit_record.h"
-#include "frame/sr_i_errors.h"
-#include "storage/sr_i_system_calls.h"
 #include "storage/sr_i_files.h"
 #include "storage/sr_i_prefault.h"
-#include "rows/sr_i_rows.h"
 #include "storage/sr_i_storage.h"
-#include "frame/sr_i_tree.h"
+#include "storage/sr_i_table_file.h"
 
 namespace {
 
@@ -57,58 +59,28 @@ struct table_closer {
   ~table_closer() { sr_i_close_table(p_table); }
 };
 
-// Whether the descriptor still refers to the file at the table's path. A
-// writer that waited for the lock may find that the holder replaced the
-// file (a rewrite renames a new file over it) while it waited.
-// Returns 0 with `*p_same` set, or 10 (raised).
-int32_t check_still_the_table_file(const sr_i_table_t *p_table, int fd, bool *p_same) {
-  struct stat opened {};
-  struct stat current {};
-  if (Sr_File_System.fstat(fd, &opened) != 0) {
-    return sr_i_raise_system_call("fstat", errno);
-  }
-  if (Sr_File_System.stat(p_table->p_file_path, &current) != 0) {
-    if (errno != ENOENT) {
-      return sr_i_raise_system_call("stat", errno);
-    }
-    *p_same = false;  // gone: opening again reports it
-    return 0;
-  }
-  *p_same = opened.st_dev == current.st_dev && opened.st_ino == current.st_ino;
-  return 0;
-}
-
-// Opens (and for writing locks) the table file.
-int32_t open_table_file(sr_i_table_t *p_table, bool writable) {
+// Opens (and for writing locks) the table file. A writer that waited for
+// the lock may find that the holder replaced the file (a rewrite renames a
+// new file over it) while it waited: it opens the new one.
+int32_t open_table_file(sr_i_table_file_t &file, bool writable) {
   for (;;) {
-    const int fd = sr_i_open_file(p_table->p_file_path, writable ? O_RDWR : O_RDONLY, Sr_File_Mode);
-    if (fd < 0) {
-      const int error_number = errno;
-      switch (error_number) {
-        case ENOENT:
-          return sr_i_raise(SR_E_NO_TABLE);
-        case EACCES:
-          return sr_i_raise(SR_E_ACCESS);
-        case ENOSPC:
-          return trace_filesystem_full_for_path(p_table->p_file_path);
-        default:
-          return sr_i_raise_system_call("open", error_number);
-      }
+    if (const int32_t rc =
+            sr_i_open_file(file.path.c_str(), writable ? O_RDWR : O_RDONLY, &file.fd);
+        rc != 0) {
+      return rc;
     }
-    p_table->file_fd = fd;
     if (!writable) {
       return 0;
     }
     // A writer waits here for another process's writer to close the table.
-    if (sr_i_lock_file(fd, true) != 0) {
-      return sr_i_raise_system_call("lockf", errno);
-    }
-    bool same = false;
-    if (const int32_t rc = check_still_the_table_file(p_table, fd, &same); rc != 0 || same) {
+    if (const int32_t rc = sr_i_lock_file(file.fd); rc != 0) {
       return rc;
     }
-    Sr_File_System.close(fd);
-    p_table->file_fd = -1;
+    bool same = false;
+    if (const int32_t rc = sr_i_is_same_file(file.fd, file.path.c_str(), &same); rc != 0 || same) {
+      return rc;
+    }
+    sr_i_close_file(std::exchange(file.fd, -1));
   }
 }
 
@@ -116,15 +88,15 @@ int32_t open_table_file(sr_i_table_t *p_table, bool writable) {
 // meanwhile, and it is measured and read again.
 int32_t read_whole_file(int fd, file_image &image) {
   for (;;) {
-    const off_t end = Sr_File_System.lseek(fd, 0, SEEK_END);
-    if (end < 0) {
-      return sr_i_raise_system_call("lseek64", errno);
+    off_t end = 0;
+    if (const int32_t rc = sr_i_seek_to_end(fd, &end); rc != 0) {
+      return rc;
     }
     if (end < Sr_Shortest_Table_File || end > off_t{UINT32_MAX - Read_Margin}) {
       return sr_i_raise(SR_E_TABLE_UNREADABLE);
     }
-    if (Sr_File_System.lseek(fd, 0, SEEK_SET) < 0) {
-      return sr_i_raise_system_call("lseek64", errno);
+    if (const int32_t rc = sr_i_seek(fd, 0); rc != 0) {
+      return rc;
     }
     const auto capacity = static_cast<uint32_t>(end) + Read_Margin;
     try {
@@ -219,8 +191,7 @@ class replay {
     } catch (const std::bad_alloc &) {
       return sr_i_raise_no_memory();
     }
-    uint32_t ordinal = 1;
-    for (uint32_t offset = first_record;; ++ordinal) {
+    for (uint32_t offset = first_record;;) {
       const uint32_t length = word_at(bytes_, offset);
       int32_t rc = 0;
       switch (word_at(bytes_, offset + 8)) {
@@ -231,7 +202,7 @@ class replay {
           rc = deletion(offset, length);
           break;
         case Sr_Live_Commit_Record:
-          return commit(offset, length, ordinal);
+          return commit(offset, length);
         default:
           break;  // a dead commit record
       }
@@ -309,7 +280,7 @@ class replay {
     return 0;
   }
 
-  int32_t commit(uint32_t offset, uint32_t length, uint32_t ordinal) {
+  int32_t commit(uint32_t offset, uint32_t length) {
     const std::span<const unsigned char> record(bytes_.data() + offset, length);
     if (const int32_t rc = sr_i_open_commit_record(record, p_table_->p_application_metadata,
                                                    &p_table_->change_counter);
@@ -317,17 +288,8 @@ class replay {
       return rc;
     }
     p_table_->applied_change_counter = p_table_->change_counter;
-    p_table_->disk_commit_record_offset = offset;
-    p_table_->disk_commit_record_length = length;
-    p_table_->disk_applied_commit_record_offset = offset;
-    p_table_->disk_applied_commit_record_length = length;
-    // The same record in the memory image the file maps to: every record
-    // before it 8 bytes longer, the metadata record 12 per column more.
-    p_table_->commit_record_offset =
-        offset + Sr_Memory_Record_Extra * ordinal + 12 * p_table_->total_columns;
-    p_table_->commit_record_length = length + Sr_Memory_Record_Extra;
-    p_table_->applied_commit_record_offset = p_table_->commit_record_offset;
-    p_table_->applied_commit_record_length = p_table_->commit_record_length;
+    p_table_->p_file->commit_record = {offset, length};
+    p_table_->p_file->applied_commit_record = {offset, length};
     return 0;
   }
 
@@ -388,16 +350,16 @@ int32_t size_table(sr_i_table_t *p_table, const committed_extent &extent) {
 }
 
 int32_t load(sr_i_table_t *p_table, bool writable) {
-  if (const int32_t rc = open_table_file(p_table, writable); rc != 0) {
+  sr_i_table_file_t &file = *p_table->p_file;
+  if (const int32_t rc = open_table_file(file, writable); rc != 0) {
     return rc;
   }
   file_image image;
-  if (const int32_t rc = read_whole_file(p_table->file_fd, image); rc != 0) {
+  if (const int32_t rc = read_whole_file(file.fd, image); rc != 0) {
     return rc;
   }
   const std::span<const unsigned char> bytes = image.bytes();
-  p_table->file_length = static_cast<uint32_t>(bytes.size());
-  p_table->disk_file_length = p_table->file_length;
+  file.length = static_cast<uint32_t>(bytes.size());
   const uint32_t metadata_length = word_at(bytes, 0);
   if (metadata_length > bytes.size()) {
     return sr_i_raise(SR_E_TABLE_UNREADABLE);
@@ -448,7 +410,7 @@ int32_t sr_i_open_persistent_table(sr_i_tree_t *p_tree, const char *p_registry_p
   if ((p_table->p_name = strdup(p_file_path)) == nullptr) {
     return sr_i_raise_no_memory();
   }
-  if (const int32_t rc = sr_i_set_file_paths(p_table, p_file_path, p_registry_path); rc != 0) {
+  if (const int32_t rc = sr_i_attach_table_file(p_table, p_file_path, p_registry_path); rc != 0) {
     return rc;
   }
   if (const int32_t rc = load(p_table, writable); rc != 0) {

@@ -73,15 +73,35 @@ int32_t sr_i_open_persistent_table(struct sr_i_tree_struct_t *p_tree, const char
                                    sr_hash_table_t *p_rows_hash_table, sr_i_table_t **pp_table);
 
 /*
- * Sets the table's file path buffer: the path, a NUL, then "rewrite", so
- * that a "." over the NUL names the rewrite file. 0 or 12 (raised).
+ * Whether an apply should write the live rows into a new file instead of
+ * appending: the table has a file past 16384 bytes and the pool's used
+ * bytes are under half of it. The percentage is computed in unsigned 32-bit
+ * arithmetic, wrapping for pools past 42,949,672 bytes, as the file
+ * format's other writers do.
  */
-int32_t sr_i_set_file_paths(sr_i_table_t *p_table, const char *p_file_path,
-                            const char *p_registry_path);
+uint32_t sr_i_rewrite_wanted(const sr_i_table_t *p_table);
 
-/* Apply, commit and abort of a table with a file (sr_i_apply_file.cpp). */
-int32_t sr_i_apply_to_file(sr_i_table_t *p_table, uint32_t rewrite);
-int32_t sr_i_commit_file(sr_i_table_t *p_table);
-void sr_i_abort_file(sr_i_table_t *p_table);
+/*
+ * Writes the table's pending changes where no reader looks yet: appended
+ * behind the live commit record, or with `rewrite` as a complete new file
+ * beside the table file; flushed either way. `*p_applied` says which
+ * (Sr_Applied_In_Place or Sr_Applied_By_Rewrite), also on failure, for the
+ * abort. 0 or a raised code (10, 12, 16, 206).
+ */
+int32_t sr_i_apply_to_file(sr_i_table_t *p_table, uint32_t rewrite, uint32_t *p_applied);
+
+/*
+ * Makes what the apply wrote (`applied`, as it reported) the file's
+ * committed state: the old commit record killed, or the rewrite file
+ * renamed onto the table file and the directory flushed. `*p_committed`
+ * says whether the file now holds the new state; it can be true with a
+ * failure, when only the directory flush after the rename failed. 0 or a
+ * raised code (10, 16, 206).
+ */
+int32_t sr_i_commit_file(sr_i_table_t *p_table, uint32_t applied, bool *p_committed);
+
+/* Throws away what the apply wrote: the appended tail cut off, or the
+ * rewrite file removed. */
+void sr_i_abort_file(sr_i_table_t *p_table, uint32_t applied);
 
 #endif /* SR_I_STORAGE_H */

@@ -4,7 +4,8 @@
  * through Sr_File_System, a table of function pointers that starts out as
  * the C library's calls; tests swap single entries to make any one call
  * fail (ENOSPC, EIO, EINTR ...), to count calls, or to simulate a power
- * loss, and restore them afterwards.
+ * loss, and restore them afterwards. Only the I/O primitives
+ * (sr_i_files.h) call through it; the rest of the library calls them.
  */
 #ifndef SR_I_SYSTEM_CALLS_H
 #define SR_I_SYSTEM_CALLS_H

@@ -8,10 +8,10 @@
 
 #include <string>
 
-#include "storage/sr_i_system_calls.h"
 #include "frame/sr_i_frame.h"
 #include "frame/sr_i_paths.h"
 #include "frame/sr_i_tree.h"
+#include "storage/sr_i_files.h"
 
 namespace {
 constexpr sr_i_entry_point_t Repair_Tables{87, false};
@@ -43,7 +43,7 @@ extern "C" int32_t sr_repair_tables_1(sr_opaque_handle_t tree_handle,
       }
       if (block_size != 0) {
         // A missing rewrite file is the normal case.
-        Sr_File_System.unlink((file_path + ".rewrite").c_str());
+        sr_i_discard_file((file_path + ".rewrite").c_str());
       }
     }
     return 0;

@@ -2,26 +2,30 @@
 // whatever is pending or applied and not committed), the key hash table and
 // application metadata container it gets with its columns, the fixed row index
 // with its free chain and growth, the change lists and the blocks their
-// entries come from, block containment and the data/rewrite file name
-// switch.
+// entries come from, and block containment. Freeing a persistent table
+// closes its file through the storage code (storage/sr_i_table_file.h).
 //
 // Index entries are handed out lowest position first: the free chain is
 // kept in ascending address order, linked through p_pending_change, which a
 // free entry does not otherwise use. Entries that were never handed out
-// follow one another without links (see p_rows_never_used).
+// follow one another without links (see p_rows_never_used). The index
+// growth and the change entry blocks allocate through Sr_Allocation, so
+// that tests can make them fail.
 
 #include "tables/sr_i_table.h"
 
 #include <algorithm>
+#include <cassert>
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
 #include <new>
 #include <utility>
 
-#include "schema/sr_i_application_metadata.h"
 #include "frame/sr_i_errors.h"
-#include "storage/sr_i_system_calls.h"
+#include "schema/sr_i_application_metadata.h"
+#include "storage/sr_i_table_file.h"
+#include "tables/sr_i_allocation.h"
 #include "tables/sr_i_hash_table.h"
 
 namespace {
@@ -54,8 +58,6 @@ sr_i_table_t *sr_i_create_null_table() {
   p_table->references = 1;
   p_table->implicitly_controlled = 1;
   p_table->change_counter = 1;
-  p_table->file_fd = -1;
-  p_table->rewrite_file_fd = -1;
   // Read each time a table object is made, so a program may switch it
   // between tables; set to anything, even "", it is on.
   p_table->uncommitted_updates_visible = std::getenv("SR_UNCOMMITTED_UPDATES_VISIBLE") ? 1 : 0;
@@ -75,14 +77,7 @@ void sr_i_close_table(sr_i_table_t *p_table) {
   std::free(p_table->p_rows_packed_index);
   sr_i_free_change_lists(p_table);
   std::free(p_table->p_name);
-  std::free(p_table->p_file_path);
-  // Closing the descriptors also ends their file locks.
-  if (p_table->file_fd >= 0) {
-    Sr_File_System.close(p_table->file_fd);
-  }
-  if (p_table->rewrite_file_fd >= 0) {
-    Sr_File_System.close(p_table->rewrite_file_fd);
-  }
+  sr_i_close_table_file(p_table->p_file);
   std::free(p_table->p_persistent_table_registry_path);
   sr_i_free_application_metadata(p_table->p_application_metadata);
   std::free(p_table);
@@ -108,32 +103,35 @@ int32_t sr_i_establish_rows_index(sr_i_table_t *p_table, uint32_t maximum_rows) 
   return 0;
 }
 
+// Both arrays are had before either is given up, so that a failure leaves
+// the table as it was. The packed index, a twelfth the size of the fixed
+// one, is copied into a new array; the fixed index is reallocated, which
+// keeps it in place when the heap can and moves it otherwise.
 int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows) {
+  assert(p_table->p_rows_free_chain == nullptr);
   const uint32_t old_rows = p_table->maximum_rows;
   const uint64_t new_rows = uint64_t{old_rows} + total_new_rows;
   if (new_rows > UINT32_MAX) {
     return sr_i_raise_no_memory();
   }
-  auto *p_packed = static_cast<uint32_t *>(
-      std::realloc(p_table->p_rows_packed_index, new_rows * sizeof(uint32_t)));
+  auto *p_packed = static_cast<uint32_t *>(Sr_Allocation.allocate(new_rows * sizeof(uint32_t)));
   if (p_packed == nullptr) {
-    std::free(p_table->p_rows_packed_index);
-    p_table->p_rows_packed_index = nullptr;
     return sr_i_raise_no_memory();
   }
-  p_table->p_rows_packed_index = p_packed;
   // Where the change entries point, as positions, for after a move.
   const auto old_base = reinterpret_cast<uintptr_t>(p_table->p_rows_fixed_index);
   auto *p_fixed = static_cast<sr_i_index_entry_t *>(
-      std::realloc(p_table->p_rows_fixed_index, new_rows * sizeof(sr_i_index_entry_t)));
+      Sr_Allocation.reallocate(p_table->p_rows_fixed_index, new_rows * sizeof(sr_i_index_entry_t)));
   if (p_fixed == nullptr) {
-    std::free(p_table->p_rows_fixed_index);
-    p_table->p_rows_fixed_index = nullptr;
+    std::free(p_packed);
     return sr_i_raise_no_memory();
   }
+  std::memcpy(p_packed, p_table->p_rows_packed_index, old_rows * sizeof(uint32_t));
+  std::memset(p_packed + old_rows, 0, total_new_rows * sizeof(uint32_t));
+  std::free(p_table->p_rows_packed_index);
+  p_table->p_rows_packed_index = p_packed;
   std::memset(static_cast<void *>(p_fixed + old_rows), 0,
               total_new_rows * sizeof(sr_i_index_entry_t));
-  std::memset(p_packed + old_rows, 0, total_new_rows * sizeof(uint32_t));
   p_table->p_rows_free_chain = p_fixed + old_rows;
   p_table->p_rows_never_used = p_fixed + old_rows;
   p_table->maximum_rows = static_cast<uint32_t>(new_rows);
@@ -206,8 +204,8 @@ sr_i_change_entry_t *sr_i_new_change_entry(sr_i_table_t *p_table) {
     p_table->p_free_change_entries = p_change->p_next;
   } else {
     if (p_table->unused_change_entries == 0) {
-      auto *p_block =
-          static_cast<sr_i_change_entry_block_t *>(std::malloc(sizeof(sr_i_change_entry_block_t)));
+      auto *p_block = static_cast<sr_i_change_entry_block_t *>(
+          Sr_Allocation.allocate(sizeof(sr_i_change_entry_block_t)));
       if (p_block == nullptr) {
         sr_i_raise_no_memory();
         return nullptr;
@@ -237,14 +235,6 @@ bool sr_i_record_contained_in_block(const sr_i_table_t *p_table, uint32_t offset
   }
   block = static_cast<uint32_t>(offset / block_size);
   return offset / block_size == (uint64_t{offset} + length) / block_size;
-}
-
-void sr_i_set_data_path(sr_i_table_t *p_table) {
-  p_table->p_file_path[p_table->file_path_length] = '\0';
-}
-
-void sr_i_set_rewrite_path(sr_i_table_t *p_table) {
-  p_table->p_file_path[p_table->file_path_length] = '.';
 }
 
 void sr_i_swap_table_contents(sr_i_table_t *p_open, sr_i_table_t *p_other) {

@@ -2,8 +2,9 @@
  * sr_i_table.h - the table object behind every table handle, transient or
  * persistent: column definitions (in the metadata record), row records (in
  * the record buffer pool), the fixed row index with its free chain, the
- * packed index of live rows, the change lists, the key hash table, and the
- * state of the table's files.
+ * packed index of live rows, the change lists, the key hash table, the
+ * transaction state, and for a persistent table its file
+ * (storage/sr_i_table_file.h).
  *
  * A row keeps its fixed index position for life; the packed index lists the
  * rows in order. Pending changes are entries of two doubly linked lists that
@@ -12,12 +13,10 @@
 #ifndef SR_I_TABLE_H
 #define SR_I_TABLE_H
 
-#include <sys/uio.h>
-
 #include <cstdint>
 
-#include "qv_sr.h"
 #include "frame/sr_i_read_write_lock.h"
+#include "qv_sr.h"
 #include "tables/sr_i_record_buffer_pool.h"
 
 struct sr_hash_table_struct_t;
@@ -25,10 +24,17 @@ struct sr_hash_table_element_struct_t;
 struct sr_i_application_metadata_struct_t;
 struct sr_i_tree_struct_t;
 struct sr_i_change_entry_struct_t;
+struct sr_i_table_file_struct_t;
 
 /* Table open modes (the `mode` field). */
 inline constexpr uint32_t Sr_Mode_Read_Only = 1;
 inline constexpr uint32_t Sr_Mode_Writable = 2;
+
+/* The values of ready_for_commit: what the last apply did. Applied
+ * changes wait for commit or abort; further changes are refused. */
+inline constexpr uint32_t Sr_Nothing_Applied = 0;
+inline constexpr uint32_t Sr_Applied_In_Place = 1;   /* in memory, or appended to the file */
+inline constexpr uint32_t Sr_Applied_By_Rewrite = 2; /* written as a new file beside it */
 
 /* Positions a new transient table starts with, and what 0 stands for. */
 inline constexpr uint32_t Sr_Initial_Transient_Rows = 100;
@@ -89,26 +95,11 @@ typedef struct sr_i_table_struct_t {
   struct sr_i_tree_struct_t *p_tree;
   struct sr_i_table_struct_t *p_next;
   uint32_t mode;
-  uint32_t block_size; /* the mount point's; 0 for a transient table */
-  uint32_t ready_for_commit;
+  uint32_t block_size;       /* the mount point's; 0 for a transient table */
+  uint32_t ready_for_commit; /* set by the transaction code alone */
   uint32_t applied_deletions;
-  int32_t file_fd;
-  int32_t rewrite_file_fd;
-  /* The data file's name, a NUL at file_path_length, then the rewrite
-   * file's suffix: writing "." over the NUL names the rewrite file. */
-  char *p_file_path;
-  uint32_t file_path_length;
-  uint32_t commit_record_offset;
-  uint32_t applied_commit_record_offset;
-  uint32_t commit_record_length;
-  uint32_t applied_commit_record_length;
-  uint32_t file_length;
-  uint32_t disk_commit_record_offset;
-  uint32_t disk_applied_commit_record_offset;
-  uint32_t disk_commit_record_length;
-  uint32_t disk_applied_commit_record_length;
-  uint32_t disk_file_length;
-  uint32_t rewrite_file_length;
+  /* The file of a persistent table; null for a transient one. */
+  struct sr_i_table_file_struct_t *p_file;
   char *p_persistent_table_registry_path;
   struct sr_hash_table_struct_t *p_rows_hash_table;
   sr_i_index_entry_t *p_rows_free_chain;
@@ -129,7 +120,6 @@ typedef struct sr_i_table_struct_t {
   sr_i_change_entry_t *p_free_change_entries; /* linked through p_next */
   sr_i_read_write_lock_t lock;
   sr_i_record_buffer_pool_t record_buffer_pool;
-  struct iovec io_vector[16];
 } sr_i_table_t;
 
 /*
@@ -149,9 +139,10 @@ void sr_i_close_table(sr_i_table_t *p_table);
  * Returns 0 or 12 (raised). */
 int32_t sr_i_establish_rows_index(sr_i_table_t *p_table, uint32_t maximum_rows);
 
-/* Adds `total_new_rows` free positions, keeping the pending changes
- * pointed at their rows when the index moves. Returns 0 or 12 (raised);
- * after a failure the table must only be freed. */
+/* Adds `total_new_rows` free positions to an index with none free, keeping
+ * the pending changes pointed at their rows when the index moves. Returns 0
+ * or 12 (raised); a failure leaves the index, its free chain and the
+ * pending changes as they were. */
 int32_t sr_i_grow_index(sr_i_table_t *p_table, uint32_t total_new_rows);
 
 /* What a table gets once its columns are known, whether created or loaded:
@@ -187,9 +178,5 @@ bool sr_i_record_contained_in_block(const sr_i_table_t *p_table, uint32_t offset
  * identity: its lock, reference count, tree and link stay. Neither lock may
  * be held by another thread; the caller may hold `p_open`'s. */
 void sr_i_swap_table_contents(sr_i_table_t *p_open, sr_i_table_t *p_other);
-
-/* Make p_file_path name the data file, or the rewrite file. */
-void sr_i_set_data_path(sr_i_table_t *p_table);
-void sr_i_set_rewrite_path(sr_i_table_t *p_table);
 
 #endif /* SR_I_TABLE_H */

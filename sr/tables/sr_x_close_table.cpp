@@ -4,8 +4,8 @@
 // freed at once.
 
 #include "frame/sr_i_frame.h"
-#include "tables/sr_i_table.h"
 #include "frame/sr_i_tree.h"
+#include "tables/sr_i_table.h"
 
 namespace {
 constexpr sr_i_entry_point_t Close_Table{13, false};
@@ -33,7 +33,7 @@ extern "C" int32_t sr_close_table_1(sr_opaque_handle_t table_handle) {
     if (p_table->references == 0) {
       const auto found = p_tree->tables.find(p_table->p_name);
       const bool still_in_tree = found != p_tree->tables.end() && found->second == p_table;
-      if (p_table->p_file_path != nullptr && still_in_tree) {
+      if (p_table->p_file != nullptr && still_in_tree) {
         p_tree->tables.erase(found);  // persistent: dropped from memory
         sr_i_close_table(p_table);
       } else if (!still_in_tree) {

@@ -8,11 +8,11 @@
 #include <utility>
 
 #include "frame/sr_i_frame.h"
-#include "tables/sr_i_hash_table.h"
 #include "frame/sr_i_paths.h"
-#include "tables/sr_i_table.h"
-#include "storage/sr_i_storage.h"
 #include "frame/sr_i_tree.h"
+#include "storage/sr_i_storage.h"
+#include "tables/sr_i_hash_table.h"
+#include "tables/sr_i_table.h"
 
 namespace {
 
@@ -111,20 +111,20 @@ int32_t do_open_table(sr_opaque_handle_t tree_handle, const char *p_registry_pat
   if (table_lock.result() != 0) {
     return table_lock.result();
   }
-  ++p_table->references;
+  // The reference is counted once nothing can fail any more, so that a
+  // refused opening leaves the count as it was.
   const bool writing = (mode & Open_For_Writing) != 0;
-  if (p_table->references == 1) {
+  if (p_table->references == 0) {
     take_open_mode(p_table, mode);  // present in the tree but not open
   } else if (writing && p_table->mode == Sr_Mode_Writable) {
     const bool explicit_request = (mode & Open_Explicit_Control) != 0;
     if (explicit_request == (p_table->implicitly_controlled != 0)) {
-      --p_table->references;
       return sr_i_raise(SR_E_EXCLUSIVE_MODES);
     }
   } else if (writing) {
     // A read-only table turns writable; one with a file must be read again
     // under the writer's lock, since another process may have changed it.
-    if (p_table->p_file_path != nullptr) {
+    if (p_table->p_file != nullptr) {
       if (const int32_t rc =
               reload_writable(p_table, p_registry_path, mode, block_size, p_rows_hash_table);
           rc != 0) {
@@ -133,6 +133,7 @@ int32_t do_open_table(sr_opaque_handle_t tree_handle, const char *p_registry_pat
     }
     take_open_mode(p_table, mode);
   }
+  ++p_table->references;
   *p_result_table_handle = p_table;
   return 0;
 }

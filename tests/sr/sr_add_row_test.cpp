@@ -1,14 +1,19 @@
 // Adding rows: the order of the checks, a failed add leaving no trace,
 // defaults, null pointers stored as empty values, long keys and values, key
 // checks by scan and by hash, revival of a deleted key at its old position,
-// and the row index growing under pending changes.
+// the row index growing under pending changes, and an add whose memory
+// cannot be had leaving the table as it was.
 
 #include <gtest/gtest.h>
 
+#include <map>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "rows/sr_i_rows.h"
 #include "sr_row_test_support.h"
+#include "tables/sr_i_allocation.h"
 
 namespace {
 
@@ -169,6 +174,174 @@ TEST_F(AddRow, TheIndexDoublesAndPendingChangesFollowTheirRows) {
     ASSERT_EQ(sr_get_field_by_key_1(table, int32_value(id), "count", &read), 0);
     EXPECT_EQ(read.val_int32, id * 10);
   }
+}
+
+// ---- Allocations that fail -----------------------------------------------
+
+// The allocation through the table's door that fails: the n-th from now (1
+// the next), or none (0).
+int Allocations_Until_Failure = 0;
+
+bool allocation_fails() {
+  return Allocations_Until_Failure > 0 && --Allocations_Until_Failure == 0;
+}
+
+constexpr sr_i_allocation_calls_t Failing_Allocation = {
+    .allocate = [](size_t length) -> void * {
+      return allocation_fails() ? nullptr : Sr_Default_Allocation.allocate(length);
+    },
+    .reallocate = [](void *p_block, size_t length) -> void * {
+      return allocation_fails() ? nullptr : Sr_Default_Allocation.reallocate(p_block, length);
+    },
+};
+
+// Row tables whose growing allocations go through a door that fails the one
+// Allocations_Until_Failure names.
+class AddRowWithoutMemory : public RowTables {
+ protected:
+  void SetUp() override {
+    RowTables::SetUp();
+    Allocations_Until_Failure = 0;
+    Sr_Allocation = Failing_Allocation;
+  }
+  void TearDown() override {
+    Sr_Allocation = Sr_Default_Allocation;
+    RowTables::TearDown();
+  }
+
+  // The rows of one view, id to count, read by packed index.
+  static std::map<int32_t, int32_t> rows_in(sr_opaque_handle_t table, uint32_t uncommitted) {
+    std::map<int32_t, int32_t> rows;
+    for (int32_t at = 0;; ++at) {
+      qv_value_t id{}, count{};
+      const char *names[] = {"id", "count"};
+      qv_value_t *values[] = {&id, &count};
+      const int32_t rc = sr_get_fields_by_index_and_visibility_1(table, at, names, values, 2,
+                                                                 uncommitted, nullptr);
+      if (rc == SR_E_NO_ROW_FOR_INDEX) {
+        return rows;
+      }
+      if (rc == SR_E_ROW_DELETED) {
+        continue;
+      }
+      if (rc != 0) {
+        ADD_FAILURE() << "reading packed row " << at << " gave " << rc;
+        return rows;
+      }
+      rows[id.val_int32] = count.val_int32;
+    }
+  }
+};
+
+// Everything of the row index an add touches: the arrays themselves, their
+// bounds and free chain, the packed order, and the pending changes with the
+// entries they point at.
+struct index_state {
+  uint32_t maximum_rows;
+  const void *p_fixed, *p_packed, *p_free_chain, *p_never_used;
+  std::vector<uint32_t> packed;
+  std::vector<std::pair<const void *, uint32_t>> changes;
+  footprint rest;
+  explicit index_state(const sr_i_table_t *p)
+      : maximum_rows(p->maximum_rows),
+        p_fixed(p->p_rows_fixed_index),
+        p_packed(p->p_rows_packed_index),
+        p_free_chain(p->p_rows_free_chain),
+        p_never_used(p->p_rows_never_used),
+        packed(p->p_rows_packed_index, p->p_rows_packed_index + p->total_applied_rows),
+        rest(p) {
+    for (const sr_i_change_entry_t *p_list :
+         {p->p_rows_change_list, p->p_delete_rows_change_list}) {
+      for (const sr_i_change_entry_t *p_change = p_list; p_change != nullptr;
+           p_change = p_change->p_next) {
+        changes.emplace_back(p_change->p_index_entry, p_change->deletion);
+      }
+    }
+  }
+  bool operator==(const index_state &) const = default;
+};
+
+// A full index of 100 committed rows, with a row set and a row deleted
+// pending: the next add must grow the index, and either allocation of the
+// growth fails.
+TEST_F(AddRowWithoutMemory, AGrowthThatFailsLeavesTheIndexAndTheTransactionAsTheyWere) {
+  for (const int failing : {1, 2}) {
+    SCOPED_TRACE("allocation " + std::to_string(failing) + " of the growth fails");
+    const std::string path = "/add/no_memory_" + std::to_string(failing);
+    sr_opaque_handle_t table = create_numbered(path.c_str(), Explicit);
+    std::map<int32_t, int32_t> committed;
+    for (int32_t id = 0; id < 100; ++id) {
+      ASSERT_EQ(add_numbered(table, id, id), 0);
+      committed[id] = id;
+    }
+    apply_commit(table);
+    qv_value_t changed = int32_value(500);
+    ASSERT_EQ(sr_set_field_by_key_1(table, int32_value(5), "count", &changed), 0);
+    ASSERT_EQ(sr_delete_rows_1(table, "id == 7"), 0);
+    std::map<int32_t, int32_t> applied = committed;
+    applied[5] = 500;
+    applied.erase(7);
+    ASSERT_EQ(object(table)->p_rows_free_chain, nullptr);
+    const index_state before(object(table));
+
+    Allocations_Until_Failure = failing;
+    EXPECT_EQ(add_numbered(table, 100, 100), SR_E_NO_MEMORY);
+    EXPECT_EQ(last_error().first, SR_E_NO_MEMORY);
+    ASSERT_EQ(Allocations_Until_Failure, 0) << "the add made fewer allocations";
+    // The arrays first: a table that lost them cannot be looked at further.
+    ASSERT_EQ(object(table)->p_rows_packed_index, before.p_packed);
+    ASSERT_EQ(object(table)->p_rows_fixed_index, before.p_fixed);
+    ASSERT_TRUE(index_state(object(table)) == before);
+    EXPECT_EQ(rows_in(table, 1), applied);
+    EXPECT_EQ(rows_in(table, 0), committed);
+
+    // The pending changes still abort, and the add goes through once memory
+    // can be had, and commits.
+    ASSERT_EQ(sr_abort_1(table), 0);
+    EXPECT_EQ(rows_in(table, 1), committed);
+    ASSERT_EQ(add_numbered(table, 100, 100), 0);
+    EXPECT_EQ(object(table)->maximum_rows, 200u);
+    ASSERT_EQ(sr_set_field_by_key_1(table, int32_value(5), "count", &changed), 0);
+    apply_commit(table);
+    committed[100] = 100;
+    committed[5] = 500;
+    EXPECT_EQ(rows_in(table, 0), committed);
+  }
+}
+
+// The first change of a transaction takes a new block of change entries;
+// when it cannot be had, the row built and entered in the key hash table so
+// far is given back.
+TEST_F(AddRowWithoutMemory, AChangeThatCannotBeQueuedGivesTheRowBack) {
+  sr_opaque_handle_t table =
+      make_table("/add/no_change_entry",
+                 {column("id", QV_INT32, SR_PRIMARY_KEY), column("count", QV_INT32, SR_STANDARD)},
+                 Explicit, four_buckets);
+  const std::map<int32_t, int32_t> committed = {{0, 0}, {1, 10}, {2, 20}};
+  for (const auto &[id, count] : committed) {
+    ASSERT_EQ(add_numbered(table, id, count), 0);
+  }
+  apply_commit(table);
+  ASSERT_EQ(object(table)->p_change_entry_blocks, nullptr);
+  const footprint before(object(table));
+  const sr_i_index_entry_t *p_free = object(table)->p_rows_free_chain;
+
+  Allocations_Until_Failure = 1;
+  EXPECT_EQ(add_numbered(table, 3, 30), SR_E_NO_MEMORY);
+  ASSERT_EQ(Allocations_Until_Failure, 0) << "the add made no allocation";
+  EXPECT_TRUE(footprint(object(table)) == before);
+  EXPECT_EQ(object(table)->p_rows_free_chain, p_free);
+  uint32_t fixed = 0;
+  EXPECT_EQ(sr_get_fixed_row_index_for_key_1(table, int32_value(3), &fixed), SR_E_NO_ROW_FOR_KEY);
+  EXPECT_EQ(rows_in(table, 1), committed);
+
+  ASSERT_EQ(add_numbered(table, 3, 30), 0);
+  ASSERT_EQ(sr_get_fixed_row_index_for_key_1(table, int32_value(3), &fixed), 0);
+  EXPECT_EQ(object(table)->p_rows_fixed_index + fixed, p_free);
+  apply_commit(table);
+  std::map<int32_t, int32_t> with_new_row = committed;
+  with_new_row[3] = 30;
+  EXPECT_EQ(rows_in(table, 0), with_new_row);
 }
 
 }  // namespace

@@ -6,7 +6,8 @@
 // run checks the code and its message, that the table in memory goes on (a
 // retried step or an abort, then a further transaction), and that the file,
 // opened by another tree, holds a committed state: the old one, or the new
-// one when the failed call came after the commit point.
+// one when the failed call came after the commit point. Last, a read-only
+// table whose reading again for writing fails.
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -22,11 +23,12 @@
 #include <string>
 #include <vector>
 
-#include "qv_sr.h"
 #include "frame/sr_i_errors.h"
-#include "storage/sr_i_system_calls.h"
+#include "frame/sr_i_tree.h"
+#include "qv_sr.h"
 #include "rows/sr_i_transaction.h"
 #include "sr_row_test_support.h"
+#include "storage/sr_i_system_calls.h"
 
 namespace {
 
@@ -63,7 +65,8 @@ struct injector_t {
   int error = 0;
   int counts[Total_Kinds] = {};
   // An interrupted call fails again on every retry: a retry is the same kind
-  // of call after a pause, with no other call in between.
+  // of call after a pause. Calls of other kinds may come between (a failed
+  // flush writes its diagnostic file before the retry).
   call_kind interrupted = Total_Kinds;
   bool paused = false;
   int failures = 0;
@@ -72,8 +75,8 @@ injector_t Injector;
 
 bool fails(call_kind kind) {
   const int ordinal = ++Injector.counts[kind];
-  if (Injector.interrupted != Total_Kinds) {
-    if (kind == Injector.interrupted && Injector.paused) {
+  if (kind == Injector.interrupted) {
+    if (Injector.paused) {
       Injector.paused = false;
       ++Injector.failures;
       errno = EINTR;
@@ -396,7 +399,11 @@ class FaultInjection : public ::testing::Test {
         break;
       case Applying:
       case Committing: {
-        const bool committed_now = step.phase == Committing && rc == 0;
+        // Once the rename is done the new file is the table's: a failed
+        // flush of its directory after it still leaves the new state.
+        const bool flushing_the_directory =
+            step.phase == Committing && step.rewrite && (fault.kind == Open || fault.kind == Fsync);
+        const bool committed_now = step.phase == Committing && (rc == 0 || flushing_the_directory);
         EXPECT_EQ(rows_on_disk(), committed_now ? applied_rows() : committed);
         // A failed rewriting apply removes its file; a failed rename keeps
         // it for the retried commit.
@@ -406,6 +413,9 @@ class FaultInjection : public ::testing::Test {
         }
         if (rc != 0 && fault.recovery == recovery_t::abort) {
           ASSERT_EQ(sr_abort_1(table), 0);
+          if (committed_now) {
+            committed = applied_rows();  // nothing left to abort
+          }
         } else {
           if (rc != 0 && step.phase == Applying) {
             ASSERT_EQ(apply(table, step.rewrite), 0) << "the apply cannot be retried";
@@ -524,6 +534,41 @@ TEST_F(FaultInjection, ApplyFailuresKeepTheCommittedFileAndThePendingChanges) {
 
 TEST_F(FaultInjection, CommitAndAbortFailuresLeaveACommittedState) {
   fail_every_call_of({Committing, Aborting}, "commit and abort");
+}
+
+// A read-only table turning writable is read again from its file; when that
+// read fails, the table stays read-only with the references it had, so that
+// closing its last handle still drops it from memory.
+TEST_F(FaultInjection, AFailedReloadForWritingKeepsTheReadOnlyTableAndItsReferences) {
+  std::filesystem::create_directory(mount_directory_);
+  ASSERT_NE(tree_ = mounted_tree(mount_directory_), nullptr);
+  sr_opaque_handle_t table = nullptr;
+  ASSERT_EQ(create_table(&table), 0);
+  for (const auto &[name, count] : Committed_Rows) {
+    ASSERT_EQ(add_named(table, name.c_str(), count), 0);
+  }
+  ASSERT_EQ(sr_apply_1(table, 0), 0);
+  ASSERT_EQ(sr_commit_1(table), 0);
+  ASSERT_EQ(sr_close_table_1(table), 0);
+
+  sr_opaque_handle_t reader = nullptr;
+  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 1, &reader), 0);
+  Injector = injector_t{.target = Read, .index = 1, .error = EIO};
+  sr_opaque_handle_t writer = nullptr;
+  EXPECT_EQ(sr_open_table_1(tree_, "/disk/t", 6, &writer), SR_E_SYSTEM_CALL);
+  EXPECT_EQ(Injector.failures, 1);
+  Injector.target = Total_Kinds;
+  EXPECT_EQ(object(reader)->references, 1u);
+  EXPECT_EQ(rows_in(reader, 0), Committed_Rows);
+  EXPECT_EQ(add_named(reader, "late", 99), SR_E_ACCESS);
+
+  ASSERT_EQ(sr_close_table_1(reader), 0);
+  EXPECT_TRUE(static_cast<sr_i_tree_t *>(tree_)->tables.empty())
+      << "the table outlived its last handle";
+  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 6, &writer), 0);
+  EXPECT_EQ(object(writer)->references, 1u);
+  EXPECT_EQ(rows_in(writer, 0), Committed_Rows);
+  EXPECT_EQ(sr_close_tree_1(tree_), 0);
 }
 
 }  // namespace

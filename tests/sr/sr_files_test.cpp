@@ -1,7 +1,8 @@
 // The input and output primitives of table files: bounded retries of
-// interrupted calls, the codes of a full disk and of other failures, short
-// and partial writes and reads, the diagnostic file of a failed flush, and
-// the per-descriptor file lock.
+// interrupted calls, each failure raised once with its code (206 for a
+// refused access, 16 naming the full filesystem, 10 naming the call), short
+// and partial writes and reads, the diagnostic file of a failed flush, the
+// per-descriptor file lock, and renames made durable by a directory flush.
 
 #include <gtest/gtest.h>
 #include <sys/wait.h>
@@ -20,9 +21,9 @@
 #include <vector>
 
 #include "qv_sr.h"
-#include "storage/sr_i_system_calls.h"
-#include "storage/sr_i_files.h"
 #include "sr_row_test_support.h"
+#include "storage/sr_i_files.h"
+#include "storage/sr_i_system_calls.h"
 
 namespace {
 
@@ -96,8 +97,7 @@ class Files : public ::testing::Test {
     // A failed flush leaves its diagnostic file in the working directory.
     previous_directory_ = std::filesystem::current_path();
     std::filesystem::current_path(directory_);
-    fd_ = sr_i_open_file(path().c_str(), O_RDWR | O_CREAT, Sr_File_Mode);
-    ASSERT_GE(fd_, 0);
+    ASSERT_EQ(sr_i_open_file(path().c_str(), O_RDWR | O_CREAT, &fd_), 0);
     cu_set_no_error_1();
   }
   void TearDown() override {
@@ -119,9 +119,10 @@ class Files : public ::testing::Test {
 
 // One primitive driven through the door entry it depends on.
 struct primitive_t {
-  const char *p_call;  // raised from the function "sr_i_<call>"
+  const char *p_call;  // raised from the function "sr_i_<function>"
+  const char *p_function;
   std::function<void()> script_door;
-  std::function<int32_t(int fd)> run;
+  std::function<int32_t(int fd, const char *p_path)> run;
 };
 
 std::vector<primitive_t> primitives() {
@@ -129,21 +130,21 @@ std::vector<primitive_t> primitives() {
   static iovec vector[1];
   static uint32_t counter;
   return {
-      {"write", [] { Sr_File_System.write = scripted_write; },
-       [](int fd) { return sr_i_write(fd, buffer, 7); }},
-      {"writev", [] { Sr_File_System.writev = scripted_writev; },
-       [](int fd) {
+      {"write", "write", [] { Sr_File_System.write = scripted_write; },
+       [](int fd, const char *p_path) { return sr_i_write(fd, p_path, buffer, 7); }},
+      {"writev", "writev", [] { Sr_File_System.writev = scripted_writev; },
+       [](int fd, const char *p_path) {
          vector[0] = {buffer, 7};
-         return sr_i_writev(fd, vector, 1, 7, &counter);
+         return sr_i_writev(fd, p_path, vector, 1, 7, &counter);
        }},
-      {"fdatasync", [] { Sr_File_System.fsync = scripted_fsync; },
-       [](int fd) { return sr_i_fdatasync(fd); }},
-      {"read", [] { Sr_File_System.read = scripted_read; },
-       [](int fd) { return sr_i_read(fd, buffer, 7, &counter); }},
+      {"fdatasync", "flush_file", [] { Sr_File_System.fsync = scripted_fsync; },
+       [](int fd, const char *p_path) { return sr_i_flush_file(fd, p_path); }},
+      {"read", "read", [] { Sr_File_System.read = scripted_read; },
+       [](int fd, const char *) { return sr_i_read(fd, buffer, 7, &counter); }},
   };
 }
 
-TEST_F(Files, InterruptsAreRetried100TimesAFullDiskIs16AndOtherFailuresRaise10) {
+TEST_F(Files, InterruptsAreRetried100TimesAndEveryFailureIsRaisedWithItsCode) {
   struct case_t {
     int interruptions;
     int failure;
@@ -151,31 +152,42 @@ TEST_F(Files, InterruptsAreRetried100TimesAFullDiskIs16AndOtherFailuresRaise10) 
   };
   for (const primitive_t &primitive : primitives()) {
     for (const auto &[interruptions, failure, attempts] :
-         {case_t{100, 0, 101}, case_t{INT_MAX, 0, 101}, case_t{0, ENOSPC, 1}, case_t{0, EIO, 1}}) {
+         {case_t{100, 0, 101}, case_t{INT_MAX, 0, 101}, case_t{0, ENOSPC, 1}, case_t{0, EACCES, 1},
+          case_t{0, EIO, 1}}) {
       SCOPED_TRACE(std::string(primitive.p_call) + " " + std::to_string(interruptions) + " " +
                    std::to_string(failure));
       Script = script_t{.interruptions = interruptions,
                         .good_attempts = failure == 0 ? INT_MAX : 0,
                         .failure = failure};
+      Sr_File_System = Sr_Default_File_System;
+      Sr_File_System.usleep = counting_usleep;
       primitive.script_door();
       cu_set_no_error_1();
-      const int32_t rc = primitive.run(fd_);
+      const int32_t rc = primitive.run(fd_, path().c_str());
       EXPECT_EQ(Script.attempts, attempts);
       EXPECT_EQ(Script.pauses, attempts - 1);
 
-      // Reading has no full disk: there every failure is raised.
-      const bool quiet_full_disk = failure == ENOSPC && primitive.p_call != std::string("read");
-      const int raised = interruptions == INT_MAX ? EINTR : quiet_full_disk ? 0 : failure;
-      EXPECT_EQ(rc, raised != 0 ? SR_E_SYSTEM_CALL : failure != 0 ? SR_E_FILESYSTEM_FULL : 0);
+      // Reading meets neither a full disk nor a refusal: every failure is 10.
+      const bool reading = primitive.p_call == std::string("read");
       const std::string text = last_error().second;
-      if (raised == 0) {
-        EXPECT_EQ(text, "");
-      } else {
+      if (failure == ENOSPC && !reading) {
+        EXPECT_EQ(rc, SR_E_FILESYSTEM_FULL);
+        EXPECT_TRUE(text.starts_with("2605-016 The filesystem containing the local tree is full"))
+            << text;
+      } else if (failure == EACCES && !reading) {
+        EXPECT_EQ(rc, SR_E_ACCESS);
+        EXPECT_TRUE(text.starts_with("2605-206 ")) << text;
+      } else if (failure != 0 || interruptions == INT_MAX) {
+        const int raised = failure != 0 ? failure : EINTR;
+        EXPECT_EQ(rc, SR_E_SYSTEM_CALL);
         EXPECT_TRUE(text.starts_with(std::string("2605-010 The ") + primitive.p_call +
                                      " system call unexpectedly returned an errno of " +
-                                     std::to_string(raised) + " to the sr_i_" + primitive.p_call +
-                                     " function near line "))
+                                     std::to_string(raised) + " to the sr_i_" +
+                                     primitive.p_function + " function near line "))
             << text;
+      } else {
+        EXPECT_EQ(rc, 0);
+        EXPECT_EQ(text, "");
       }
     }
   }
@@ -185,7 +197,7 @@ TEST_F(Files, ShortWritesAndReadsMoveEveryByte) {
   Sr_File_System.write = scripted_write;
   Sr_File_System.read = scripted_read;
   Script.most_bytes = 3;
-  ASSERT_EQ(sr_i_write(fd_, "0123456789", 10), 0);
+  ASSERT_EQ(sr_i_write(fd_, path().c_str(), "0123456789", 10), 0);
   EXPECT_EQ(contents(path()), "0123456789");
   EXPECT_EQ(Script.attempts, 4);
 
@@ -204,7 +216,7 @@ TEST_F(Files, PartialWritevResumesInsideTheVectorAndCountsEveryByte) {
   char abc[] = "abc", defg[] = "defg", hij[] = "hij";
   iovec vector[] = {{abc, 3}, {defg, 4}, {nullptr, 0}, {hij, 3}};
   uint32_t counter = 5;
-  ASSERT_EQ(sr_i_writev(fd_, vector, 4, 10, &counter), 0);
+  ASSERT_EQ(sr_i_writev(fd_, path().c_str(), vector, 4, 10, &counter), 0);
   EXPECT_EQ(contents(path()), "abcdefghij");
   EXPECT_EQ(counter, 15u);
   // "abc" ends the first entry exactly: the next call still starts with it.
@@ -217,7 +229,7 @@ TEST_F(Files, PartialWritevResumesInsideTheVectorAndCountsEveryByte) {
   Script = script_t{.good_attempts = 1, .failure = ENOSPC, .most_bytes = 4};
   iovec rest[] = {{abc, 3}, {defg, 4}};
   counter = 0;
-  EXPECT_EQ(sr_i_writev(fd_, rest, 2, 7, &counter), SR_E_FILESYSTEM_FULL);
+  EXPECT_EQ(sr_i_writev(fd_, path().c_str(), rest, 2, 7, &counter), SR_E_FILESYSTEM_FULL);
   EXPECT_EQ(counter, 4u);
   EXPECT_EQ(contents(path()), "abcdefghijabcd");
 }
@@ -230,37 +242,40 @@ TEST_F(Files, EveryFailedFlushRewritesTheDiagnosticFile) {
   std::smatch match;
 
   Script.interruptions = 1;  // recorded although the retry succeeds
-  EXPECT_EQ(sr_i_fdatasync(fd_), 0);
+  EXPECT_EQ(sr_i_flush_file(fd_, path().c_str()), 0);
   std::string text = contents(diagnostic);
   ASSERT_TRUE(std::regex_match(text, match, line_format)) << text;
   EXPECT_EQ(match[1], "4");
 
   Script = script_t{.good_attempts = 0, .failure = EIO};
-  EXPECT_EQ(sr_i_fdatasync(fd_), SR_E_SYSTEM_CALL);
+  EXPECT_EQ(sr_i_flush_file(fd_, path().c_str()), SR_E_SYSTEM_CALL);
   text = contents(diagnostic);
   ASSERT_TRUE(std::regex_match(text, match, line_format)) << text;  // one line: truncated
   EXPECT_EQ(match[1], "5");
 }
 
-bool refused(int locked) {
-  return locked == -1 && (errno == EAGAIN || errno == EACCES);
+bool refused(int fd) {
+  bool locked = true;
+  return sr_i_try_lock_file(fd, &locked) == 0 && !locked;
 }
 
 TEST_F(Files, TheLockBelongsToTheDescriptorThatTookIt) {
-  ASSERT_EQ(sr_i_lock_file(fd_, false), 0);
-  const int second = sr_i_open_file(path().c_str(), O_RDWR, 0);
-  ASSERT_GE(second, 0);
-  EXPECT_TRUE(refused(sr_i_lock_file(second, false)));
+  ASSERT_FALSE(refused(fd_));
+  int second = -1;
+  ASSERT_EQ(sr_i_open_file(path().c_str(), O_RDWR, &second), 0);
+  EXPECT_TRUE(refused(second));
 
   // A process-wide lock would vanish here; this one stays with fd_.
-  ::close(sr_i_open_file(path().c_str(), O_RDWR, 0));
-  EXPECT_TRUE(refused(sr_i_lock_file(second, false)));
+  int third = -1;
+  ASSERT_EQ(sr_i_open_file(path().c_str(), O_RDWR, &third), 0);
+  sr_i_close_file(third);
+  EXPECT_TRUE(refused(second));
 
   const pid_t child = ::fork();
   ASSERT_NE(child, -1);
   if (child == 0) {
     const int own = ::open(path().c_str(), O_RDWR);
-    ::_exit(refused(sr_i_lock_file(own, false)) ? 0 : 1);
+    ::_exit(refused(own) ? 0 : 1);
   }
   int status = 0;
   ASSERT_EQ(::waitpid(child, &status, 0), child);
@@ -268,8 +283,60 @@ TEST_F(Files, TheLockBelongsToTheDescriptorThatTookIt) {
 
   ::close(fd_);
   fd_ = -1;
-  EXPECT_EQ(sr_i_lock_file(second, true), 0);
+  EXPECT_EQ(sr_i_lock_file(second), 0);
   ::close(second);
+}
+
+// The door calls of the namespace, in order, with the directory flushes
+// they are followed by.
+std::vector<std::string> Namespace_Calls;
+int recording_open(const char *p_path, int flags, mode_t mode) {
+  const int fd = Sr_Default_File_System.open(p_path, flags, mode);
+  if ((flags & O_DIRECTORY) != 0) {
+    Namespace_Calls.push_back("open directory " +
+                              std::filesystem::path(p_path).filename().string());
+  }
+  return fd;
+}
+int recording_fsync(int fd) {
+  Namespace_Calls.push_back("fsync");
+  return Sr_Default_File_System.fsync(fd);
+}
+int recording_rename(const char *p_from, const char *p_to) {
+  Namespace_Calls.push_back("rename");
+  return Sr_Default_File_System.rename(p_from, p_to);
+}
+int recording_mkdir(const char *p_path, mode_t mode) {
+  Namespace_Calls.push_back("mkdir");
+  return Sr_Default_File_System.mkdir(p_path, mode);
+}
+
+TEST_F(Files, RenamesAndNewDirectoriesAreFlushedIntoTheirDirectory) {
+  Namespace_Calls.clear();
+  Sr_File_System.open = recording_open;
+  Sr_File_System.fsync = recording_fsync;
+  Sr_File_System.rename = recording_rename;
+  Sr_File_System.mkdir = recording_mkdir;
+  const std::string directory_name = directory_.filename().string();
+
+  bool renamed = false;
+  ASSERT_EQ(sr_i_rename_durably(path().c_str(), path("moved").c_str(), &renamed), 0);
+  EXPECT_TRUE(renamed);
+  EXPECT_TRUE(std::filesystem::exists(path("moved")));
+  EXPECT_EQ(Namespace_Calls,
+            (std::vector<std::string>{"rename", "open directory " + directory_name, "fsync"}));
+
+  Namespace_Calls.clear();
+  ASSERT_EQ(sr_i_make_directory(path("sub").c_str()), 0);
+  ASSERT_EQ(sr_i_make_directory(path("sub").c_str()), 0);  // there already: nothing to flush
+  EXPECT_EQ(Namespace_Calls, (std::vector<std::string>{"mkdir", "open directory " + directory_name,
+                                                       "fsync", "mkdir"}));
+
+  // A rename that fails leaves the name as it was and says so.
+  renamed = true;
+  EXPECT_EQ(sr_i_rename_durably(path("absent").c_str(), path("moved").c_str(), &renamed),
+            SR_E_SYSTEM_CALL);
+  EXPECT_FALSE(renamed);
 }
 
 }  // namespace

@@ -119,7 +119,7 @@ TEST(KeyNotFound, TheKeyIsRenderedByItsType) {
       {QV_BINARY_PTR, nullptr, "***UNKNOWN KEY TYPE****", "(UNKNOWN_TABLE_NAME)"},
   };
   for (size_t at = 0; at < std::size(cases); ++at) {
-    EXPECT_EQ(trace_key_not_found(cases[at].p_table, &keys[at], cases[at].type),
+    EXPECT_EQ(sr_i_raise_key_not_found(cases[at].p_table, &keys[at], cases[at].type),
               SR_E_NO_ROW_FOR_KEY);
     const last_error error = read_last_error();
     EXPECT_EQ(error.code, 202);
@@ -164,18 +164,21 @@ TEST(FilesystemFull, TheLongestWholeComponentPrefixNamesTheFilesystem) {
     if (!one.mount_table.empty()) {
       std::ofstream(mount_table) << one.mount_table;
     }
-    EXPECT_EQ(trace_filesystem_full_for_path(one.path.c_str()), SR_E_FILESYSTEM_FULL);
+    EXPECT_EQ(sr_i_raise_filesystem_full(one.path.c_str()), SR_E_FILESYSTEM_FULL);
     EXPECT_EQ(read_last_error().text,
               "2605-016 The filesystem containing the local tree is full: mounted(" + one.device +
                   ") mounted_over(" + one.directory + ").\n")
         << one.path;
   }
+  // With no mount table to read, the error is raised all the same.
   std::filesystem::remove(mount_table);
   cu_set_error_1(205, 0, "", 1, 22, "earlier error\n");
-  EXPECT_EQ(trace_filesystem_full_for_path("/data/t"), SR_E_FILESYSTEM_FULL);
+  EXPECT_EQ(sr_i_raise_filesystem_full("/data/t"), SR_E_FILESYSTEM_FULL);
   const last_error error = read_last_error();
-  EXPECT_EQ(error.code, 205);
-  EXPECT_EQ(error.text, "earlier error\n");
+  EXPECT_EQ(error.code, SR_E_FILESYSTEM_FULL);
+  EXPECT_EQ(error.text,
+            "2605-016 The filesystem containing the local tree is full: mounted(UNKNOWN) "
+            "mounted_over(UNKNOWN).\n");
   Sr_Mount_Table_Path = p_saved_path;
 }
 

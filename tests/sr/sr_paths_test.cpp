@@ -131,10 +131,15 @@ TEST_F(MountPoints, DirectoryFailuresAreReportedAndMountNothing) {
     errno = EACCES;
     return -1;
   };
-  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/a", dir("denied").c_str(), 0), SR_E_SYSTEM_CALL);
+  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/a", dir("denied").c_str(), 0), SR_E_ACCESS);
+  Sr_File_System.mkdir = [](const char *, mode_t) {
+    errno = EIO;
+    return -1;
+  };
+  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/a", dir("broken").c_str(), 0), SR_E_SYSTEM_CALL);
   EXPECT_EQ(
       last_error().second.rfind("2605-010 The mkdir system call unexpectedly returned an errno "
-                                "of 13 to the sr_i_create_all_directories_in_path function",
+                                "of 5 to the sr_i_make_directory function",
                                 0),
       0u);
   EXPECT_TRUE(tree()->mount_points.empty());

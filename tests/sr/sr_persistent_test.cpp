@@ -17,6 +17,8 @@
 
 #include "rows/sr_i_transaction.h"
 #include "sr_row_test_support.h"
+#include "storage/sr_i_storage.h"
+#include "storage/sr_i_table_file.h"
 
 namespace {
 
@@ -70,13 +72,13 @@ TEST_F(Persistent, ANewTableIsItsMetadataAndAnEmptyCommitRecord) {
   ASSERT_EQ(bytes.size(), metadata_length + 24u);
   EXPECT_EQ(word_at(bytes, 8), 1u);
   EXPECT_EQ(word_at(bytes, metadata_length + 8), 0xFFFFFFFFu);
-  EXPECT_EQ(object(table)->disk_commit_record_offset, metadata_length);
+  EXPECT_EQ(object(table)->p_file->commit_record.offset, metadata_length);
   EXPECT_FALSE(std::filesystem::exists(file + ".rewrite"));
 
   struct stat status {};
   ASSERT_EQ(stat(file.c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 0777, 0644u);
-  EXPECT_EQ(fcntl(object(table)->file_fd, F_GETFD) & FD_CLOEXEC, FD_CLOEXEC);
+  EXPECT_EQ(fcntl(object(table)->p_file->fd, F_GETFD) & FD_CLOEXEC, FD_CLOEXEC);
 }
 
 TEST_F(Persistent, CommittedRowsOutliveTheirTree) {

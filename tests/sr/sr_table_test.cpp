@@ -29,8 +29,7 @@ class TableObject : public ::testing::Test {
 
 TEST_F(TableObject, NewTableStartsEmptyWithCountersAtOneAndNoFiles) {
   EXPECT_EQ(p_table_->change_counter, 1u);
-  EXPECT_EQ(p_table_->file_fd, -1);
-  EXPECT_EQ(p_table_->rewrite_file_fd, -1);
+  EXPECT_EQ(p_table_->p_file, nullptr);
   ASSERT_EQ(sr_i_establish_rows_index(p_table_, 0), 0);
   EXPECT_EQ(p_table_->maximum_rows, Sr_Default_Index_Rows);
 }

@@ -27,6 +27,7 @@
 #ifndef QV_SR_H
 #define QV_SR_H
 
+#include <stdarg.h>
 #include <stdint.h>
 
 #include "qv_cu.h"
@@ -501,6 +502,90 @@ QV_SR_EXPORT int32_t sr_delete_row_by_index_1(sr_opaque_handle_t table_handle, u
  */
 QV_SR_EXPORT int32_t sr_delete_rows_1(sr_opaque_handle_t table_handle,
                                       const char *selection_criteria, ...);
+
+/* ---- Queries --------------------------------------------------------------- */
+
+/*
+ * Copies the rows that `selection_string` selects into a new table and
+ * stores its handle in `*result`. The criteria are an expression over the
+ * column names, with replacement variables filled from the further
+ * arguments as for sr_delete_rows_1; null selects every row. The rows are
+ * those of the view the table's own setting shows (the applied view when
+ * SR_UNCOMMITTED_UPDATES_VISIBLE was set as the table was made, else the
+ * committed view); the criteria are judged on that same record.
+ *
+ * The new table is unnamed and memory-only, belongs to the tree, and is
+ * open for writing under explicit control (mode 6). Its columns: with a
+ * count of 0 every column of the source in order; otherwise the key column
+ * first, then each named column in the order given (the key named again is
+ * not repeated; any other column named twice is there twice). Definitions,
+ * qualifiers, defaults and structured-data definitions are carried; a
+ * hashed source's hash functions and bucket count are kept. Every row is
+ * committed, and its change counter is the source's plus 1. Close it with
+ * sr_close_table_1; closing the tree closes it too.
+ *
+ * Returns 0 (also when no row matches: the table is empty);
+ * SR_E_INVALID_HANDLE; SR_E_NULL_POINTER for a null `result`;
+ * SR_E_NO_COLUMNS for a count with a null name array; SR_E_INVALID_COLUMN
+ * for an unknown name; SR_E_INVALID_CRITERIA for an unknown replacement
+ * variable; SR_E_LIBRARY_CALL when the criteria do not compile or cannot be
+ * evaluated; SR_E_NO_MEMORY. On failure nothing is made and the source is
+ * unchanged. It may be called in a forked child.
+ */
+QV_SR_EXPORT int32_t sr_select_1(sr_opaque_handle_t table_handle, const char *const *column_names,
+                                 uint32_t array_count, sr_opaque_handle_t *result,
+                                 const char *selection_string, ...);
+
+/*
+ * Stores in `*p_p_selected_rows_fixed_index` a malloc'ed array of the fixed
+ * indexes of the rows that `p_selection_criteria` (a format as for
+ * sr_delete_rows_1, its values in `ap`; null selects every row) selects, in
+ * fixed-index order, and their number in `*p_total_selected_rows`. The rows
+ * are those of the applied view when `uncommitted_updates_visible` is not 0
+ * or the table's own setting says so, else of the committed view. Criteria
+ * are always judged on a row's applied values: in the committed view a
+ * changed row is judged by its pending values, and a row deleted in the
+ * applied view but still committed does not match. The caller frees the
+ * array with free; it is returned also when the count is 0.
+ *
+ * Returns 0; SR_E_INVALID_HANDLE; SR_E_NULL_POINTER for a null result
+ * pointer; SR_E_INVALID_CRITERIA; SR_E_LIBRARY_CALL; SR_E_NO_MEMORY. It may
+ * be called in a forked child.
+ */
+QV_SR_EXPORT int32_t sr_get_selected_rows_v_1(sr_opaque_handle_t table_handle,
+                                              const char *p_selection_criteria, va_list ap,
+                                              uint32_t uncommitted_updates_visible,
+                                              uint32_t *p_total_selected_rows,
+                                              uint32_t **p_p_selected_rows_fixed_index);
+
+/*
+ * The rows with pending changes, as fixed indexes in a malloc'ed array the
+ * caller frees: the added and updated rows in the order they were first
+ * changed, then the deleted rows. `*p_updated_rows_count` counts the added
+ * and updated rows only; the deleted ones follow beyond the count. With
+ * nothing pending the array is null and the count 0; with only deletions
+ * pending the count is 0 and the array holds the deleted rows. Returns 0;
+ * SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_NO_MEMORY.
+ */
+QV_SR_EXPORT int32_t sr_get_updated_rows_1(sr_opaque_handle_t table_handle,
+                                           uint32_t *p_updated_rows_count,
+                                           uint32_t **p_p_updated_rows_fixed_indices);
+
+/*
+ * The rows whose key equals `key_value` (several only where the key is
+ * qualified SR_PRIMARY_KEY_NOCHECK), as fixed indexes in a malloc'ed array
+ * the caller frees, with their number. Only rows of the view that
+ * `uncommitted_updates_visible` chooses count (the applied view when not
+ * 0); the table's own setting is not consulted. A hashed table lists them
+ * most recently added first, another in fixed-index order. Returns 0;
+ * SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_NO_ROW_FOR_KEY (with the
+ * key and table in the message) when no row has the key; SR_E_NO_MEMORY.
+ */
+QV_SR_EXPORT int32_t sr_get_duplicate_rows_1(sr_opaque_handle_t table_handle,
+                                             qv_value_t key_value,
+                                             uint32_t *p_duplicate_rows_count,
+                                             uint32_t **p_p_duplicate_rows_fixed_indices,
+                                             uint32_t uncommitted_updates_visible);
 
 /* ---- Transactions -------------------------------------------------------- */
 

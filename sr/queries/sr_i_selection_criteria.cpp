@@ -11,9 +11,10 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "tables/sr_i_columns.h"
 #include "frame/sr_i_errors.h"
+#include "frame/sr_i_tree.h"
 #include "rows/sr_i_rows.h"
+#include "tables/sr_i_columns.h"
 
 namespace {
 
@@ -397,4 +398,34 @@ int32_t sr_i_row_matches(const sr_i_table_t *p_table, const cu_expression_t *p_e
     return 0;
   }
   return sr_i_raise_library_call("cu_exec_expr", rc);
+}
+
+sr_i_table_criteria::~sr_i_table_criteria() {
+  if (p_expression_ != nullptr) {
+    cu_free_expr_1(p_expression_, 0);
+  }
+}
+
+int32_t sr_i_table_criteria::compile(sr_i_table_t *p_table, const char *p_criteria) {
+  if (p_criteria == nullptr) {
+    return 0;
+  }
+  // A table outside a tree has no conversion handle, and compiling refuses.
+  cu_iconv_t *p_conversion =
+      p_table->p_tree != nullptr ? p_table->p_tree->p_to_table_string_conversion_handle : nullptr;
+  return sr_i_compile_expression(p_criteria, p_table, &p_expression_, p_conversion);
+}
+
+int32_t sr_i_expand_criteria(const char *p_selection_criteria, va_list ap,
+                             sr_i_expanded_criteria &expanded) {
+  if (p_selection_criteria == nullptr) {
+    expanded.reset();
+    return 0;
+  }
+  char *p_expanded = nullptr;
+  if (const int32_t rc = sr_i_select_printf(&p_expanded, p_selection_criteria, ap); rc != 0) {
+    return rc;
+  }
+  expanded.reset(p_expanded);
+  return 0;
 }

@@ -9,6 +9,8 @@
 
 #include <cstdarg>
 #include <cstdint>
+#include <cstdlib>
+#include <memory>
 
 #include "qv_cu.h"
 #include "tables/sr_i_table.h"
@@ -21,6 +23,16 @@
  * (an unknown variable; the insert is the whole format) or 12, raised.
  */
 int32_t sr_i_select_printf(char **p_result, const char *p_selection_criteria, va_list ap);
+
+/* Expanded criteria, released with free. */
+struct sr_i_free_string {
+  void operator()(char *p_string) const { std::free(p_string); }
+};
+using sr_i_expanded_criteria = std::unique_ptr<char, sr_i_free_string>;
+
+/* sr_i_select_printf into `expanded`; null criteria stay null. */
+int32_t sr_i_expand_criteria(const char *p_selection_criteria, va_list ap,
+                             sr_i_expanded_criteria &expanded);
 
 /*
  * Compiles expanded criteria for rows of `p_table`: variables name columns
@@ -47,5 +59,36 @@ int32_t sr_i_validate_column_callback(void *p_token, const char *p_name, uint32_
  */
 int32_t sr_i_row_matches(const sr_i_table_t *p_table, const cu_expression_t *p_expression,
                          const void *p_record, bool *p_matches);
+
+/*
+ * Criteria compiled for one table, freed with the object: the expression
+ * of `compile` (null criteria compile to no expression, which every row
+ * matches), then `matches` per row record.
+ */
+class sr_i_table_criteria {
+ public:
+  sr_i_table_criteria() = default;
+  ~sr_i_table_criteria();
+  sr_i_table_criteria(const sr_i_table_criteria &) = delete;
+  sr_i_table_criteria &operator=(const sr_i_table_criteria &) = delete;
+
+  /* Compiles expanded `p_criteria` (or null) against `p_table`'s columns,
+   * strings converted with its tree's conversion handle. Returns 0, or the
+   * raised code of sr_i_compile_expression. */
+  int32_t compile(sr_i_table_t *p_table, const char *p_criteria);
+
+  /* Whether a row record of the table matches: 0 with `*p_matches` set, or
+   * 11 (raised). */
+  int32_t matches(const sr_i_table_t *p_table, const void *p_record, bool *p_matches) const {
+    if (p_expression_ == nullptr) {
+      *p_matches = true;
+      return 0;
+    }
+    return sr_i_row_matches(p_table, p_expression_, p_record, p_matches);
+  }
+
+ private:
+  cu_expression_t *p_expression_ = nullptr;
+};
 
 #endif /* SR_I_SELECTION_CRITERIA_H */

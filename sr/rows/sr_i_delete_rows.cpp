@@ -4,11 +4,10 @@
 // packed index until the next commit; its pending change becomes a deletion.
 
 #include "frame/sr_i_errors.h"
-#include "tables/sr_i_hash_table.h"
+#include "queries/sr_i_selection_criteria.h"
 #include "rows/sr_i_row_operations.h"
 #include "rows/sr_i_rows.h"
-#include "queries/sr_i_selection_criteria.h"
-#include "frame/sr_i_tree.h"
+#include "tables/sr_i_hash_table.h"
 
 int32_t sr_i_delete_row(sr_i_table_t *p_table, sr_i_index_entry_t *p_current_index_entry) {
   if (const int32_t rc = sr_i_common_add_change_entry(p_table, p_current_index_entry, 1); rc != 0) {
@@ -69,23 +68,11 @@ int32_t sr_i_delete_rows(sr_i_table_t *p_table, const char *p_selection_criteria
   if (p_table->total_applied_rows - p_table->applied_deletions == 0) {
     return sr_i_raise(SR_E_NO_ROWS);
   }
-  if (p_selection_criteria == nullptr) {
-    return delete_live_rows(p_table, [](const void *, bool &matches) {
-      matches = true;
-      return 0;
-    });
-  }
-  cu_iconv_t *p_conversion =
-      p_table->p_tree != nullptr ? p_table->p_tree->p_to_table_string_conversion_handle : nullptr;
-  cu_expression_t *p_expression = nullptr;
-  if (const int32_t rc =
-          sr_i_compile_expression(p_selection_criteria, p_table, &p_expression, p_conversion);
-      rc != 0) {
+  sr_i_table_criteria criteria;
+  if (const int32_t rc = criteria.compile(p_table, p_selection_criteria); rc != 0) {
     return rc;
   }
-  const int32_t rc = delete_live_rows(p_table, [&](const void *p_record, bool &matches) {
-    return sr_i_row_matches(p_table, p_expression, p_record, &matches);
+  return delete_live_rows(p_table, [&](const void *p_record, bool &matches) {
+    return criteria.matches(p_table, p_record, &matches);
   });
-  cu_free_expr_1(p_expression, 0);
-  return rc;
 }

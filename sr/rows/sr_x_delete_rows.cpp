@@ -3,12 +3,10 @@
 // selected by criteria.
 
 #include <cstdarg>
-#include <cstdlib>
-#include <memory>
 
 #include "frame/sr_i_frame.h"
-#include "rows/sr_i_row_operations.h"
 #include "queries/sr_i_selection_criteria.h"
+#include "rows/sr_i_row_operations.h"
 #include "rows/sr_i_transaction.h"
 
 namespace {
@@ -30,10 +28,6 @@ int32_t delete_row_at_packed_index(sr_i_table_t *p_table, uint32_t row_index) {
   return sr_i_delete_row(p_table, p_entry);
 }
 
-struct free_string {
-  void operator()(char *p_string) const { std::free(p_string); }
-};
-
 }  // namespace
 
 extern "C" int32_t sr_delete_row_by_index_1(sr_opaque_handle_t table_handle, uint32_t row_index) {
@@ -50,16 +44,12 @@ extern "C" int32_t sr_delete_rows_1(sr_opaque_handle_t table_handle, const char 
   va_start(replacement_values, selection_criteria);
   const int32_t rc = sr_i_run_entry_point(Delete_Rows, [&] {
     return sr_i_change_table(table_handle, [&](sr_i_table_t *p_table) -> int32_t {
-      if (selection_criteria == nullptr) {
-        return sr_i_delete_rows(p_table, nullptr);
-      }
-      char *p_expanded = nullptr;
+      sr_i_expanded_criteria expanded;
       if (const int32_t expand_rc =
-              sr_i_select_printf(&p_expanded, selection_criteria, replacement_values);
+              sr_i_expand_criteria(selection_criteria, replacement_values, expanded);
           expand_rc != 0) {
         return expand_rc;
       }
-      const std::unique_ptr<char, free_string> expanded(p_expanded);
       return sr_i_delete_rows(p_table, expanded.get());
     });
   });

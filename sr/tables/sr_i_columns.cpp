@@ -13,12 +13,13 @@
 
 #include <cctype>
 #include <cstring>
+#include <span>
 #include <string_view>
 #include <vector>
 
+#include "frame/sr_i_errors.h"
 #include "qv_pmsg.h"
 #include "tables/sr_i_columns.h"
-#include "frame/sr_i_errors.h"
 
 namespace {
 
@@ -192,16 +193,50 @@ int32_t sr_i_pack_variable_length_default_values(cu_iconv_t *p_conversion, sr_co
   return 0;
 }
 
-int32_t sr_i_build_metadata_record(sr_i_table_t *p_table, const sr_column_t *p_columns,
-                                   uint32_t total_columns, uint32_t total_variable_length_columns,
-                                   const std::vector<unsigned char> &packed_defaults) {
+namespace {
+
+// The in-memory form of a structured-data definition, as the metadata
+// record keeps it: a field count, then per field its type and its name with
+// its NUL.
+std::vector<unsigned char> pack_structured_definition(const sr_sd_def_t *p_definition) {
+  std::vector<unsigned char> packed(structured_definition_bytes(p_definition));
+  unsigned char *p_cursor = packed.data();
+  put_word(p_cursor, p_definition->number_of_fields);
+  for (uint32_t field = 0; field < p_definition->number_of_fields; ++field) {
+    put_word(p_cursor, static_cast<uint32_t>(p_definition->field_def[field].type));
+    put_string(p_cursor, p_definition->field_def[field].name);
+  }
+  return packed;
+}
+
+// The length of a definition in that form, read from the form itself.
+uint32_t packed_structured_definition_bytes(const void *p_packed) {
+  const auto *p_bytes = static_cast<const unsigned char *>(p_packed);
+  uint32_t total_fields;
+  std::memcpy(&total_fields, p_bytes, sizeof total_fields);
+  uint32_t bytes = 4;
+  for (uint32_t field = 0; field < total_fields; ++field) {
+    bytes +=
+        4 +
+        static_cast<uint32_t>(std::strlen(reinterpret_cast<const char *>(p_bytes + bytes + 4))) + 1;
+  }
+  return bytes;
+}
+
+// Reserves the table's metadata record in its empty pool and writes it:
+// header, the column array, the packed defaults, then each column's name
+// followed by its structured-data definition in packed form (the order the
+// table file keeps them in). The table's p_columns and each column's name
+// and sd_defn then point into the record.
+int32_t write_metadata_record(
+    sr_i_table_t *p_table, const sr_column_t *p_columns, uint32_t total_columns,
+    uint32_t total_variable_length_columns, std::span<const unsigned char> packed_defaults,
+    std::span<const std::span<const unsigned char>> structured_definitions) {
   uint32_t length = Metadata_Header_Bytes + static_cast<uint32_t>(packed_defaults.size()) +
                     total_columns * static_cast<uint32_t>(sizeof(sr_column_t));
   for (uint32_t column = 0; column < total_columns; ++column) {
-    length += static_cast<uint32_t>(std::strlen(p_columns[column].name)) + 1;
-    if (is_structured(p_columns[column].type)) {
-      length += structured_definition_bytes(p_columns[column].sd_defn);
-    }
+    length += static_cast<uint32_t>(std::strlen(p_columns[column].name)) + 1 +
+              static_cast<uint32_t>(structured_definitions[column].size());
   }
   void *p_data = nullptr;
   if (const int32_t rc =
@@ -230,26 +265,71 @@ int32_t sr_i_build_metadata_record(sr_i_table_t *p_table, const sr_column_t *p_c
     std::memcpy(p_cursor, packed_defaults.data(), packed_defaults.size());
     p_cursor += packed_defaults.size();
   }
-  // Each name is followed by its column's structured-data definition, the
-  // order the table file keeps them in.
   for (uint32_t column = 0; column < total_columns; ++column) {
     sr_column_t &stored = p_stored_columns[column];
     stored.name = put_string(p_cursor, p_columns[column].name);
-    if (!is_structured(stored.type)) {
+    const std::span<const unsigned char> definition = structured_definitions[column];
+    if (definition.empty()) {
       stored.sd_defn = nullptr;
       continue;
     }
-    const sr_sd_def_t *p_definition = p_columns[column].sd_defn;
     stored.sd_defn = reinterpret_cast<sr_sd_def_t *>(p_cursor);
-    put_word(p_cursor, p_definition->number_of_fields);
-    for (uint32_t field = 0; field < p_definition->number_of_fields; ++field) {
-      put_word(p_cursor, static_cast<uint32_t>(p_definition->field_def[field].type));
-      put_string(p_cursor, p_definition->field_def[field].name);
-    }
+    std::memcpy(p_cursor, definition.data(), definition.size());
+    p_cursor += definition.size();
   }
   p_table->p_metadata_record_data = p_data;
   p_table->p_columns = p_stored_columns;
   p_table->total_columns = total_columns;
   p_table->total_variable_length_columns = total_variable_length_columns;
   return 0;
+}
+
+}  // namespace
+
+int32_t sr_i_build_metadata_record(sr_i_table_t *p_table, const sr_column_t *p_columns,
+                                   uint32_t total_columns, uint32_t total_variable_length_columns,
+                                   const std::vector<unsigned char> &packed_defaults) {
+  std::vector<std::vector<unsigned char>> packed_definitions(total_columns);
+  std::vector<std::span<const unsigned char>> definitions(total_columns);
+  for (uint32_t column = 0; column < total_columns; ++column) {
+    if (is_structured(p_columns[column].type)) {
+      packed_definitions[column] = pack_structured_definition(p_columns[column].sd_defn);
+      definitions[column] = packed_definitions[column];
+    }
+  }
+  return write_metadata_record(p_table, p_columns, total_columns, total_variable_length_columns,
+                               packed_defaults, definitions);
+}
+
+int32_t sr_i_build_selected_metadata_record(sr_i_table_t *p_table, const sr_i_table_t *p_source,
+                                            std::span<const uint32_t> source_columns) {
+  const auto total_columns = static_cast<uint32_t>(source_columns.size());
+  std::vector<sr_column_t> columns(total_columns);
+  std::vector<unsigned char> packed_defaults;
+  std::vector<std::span<const unsigned char>> definitions(total_columns);
+  uint32_t total_variable_length_columns = 0;
+  // The source's packed defaults follow its column array.
+  const auto *p_source_defaults =
+      reinterpret_cast<const unsigned char *>(p_source->p_columns + p_source->total_columns);
+  for (uint32_t column = 0; column < total_columns; ++column) {
+    sr_column_t &definition = columns[column] = p_source->p_columns[source_columns[column]];
+    if (definition.sd_defn != nullptr) {
+      definitions[column] = {reinterpret_cast<const unsigned char *>(definition.sd_defn),
+                             packed_structured_definition_bytes(definition.sd_defn)};
+    }
+    if (!sr_i_is_variable_length(definition.type)) {
+      continue;
+    }
+    // A default body refers to nothing outside itself: it moves by its
+    // anchor's offset alone.
+    ++total_variable_length_columns;
+    qv_pmsg_value_anchor_t anchor;
+    std::memcpy(&anchor, &definition.default_value, sizeof anchor);
+    const unsigned char *p_body = p_source_defaults + anchor.offset;
+    anchor.offset = static_cast<uint32_t>(packed_defaults.size());
+    packed_defaults.insert(packed_defaults.end(), p_body, p_body + anchor.length);
+    std::memcpy(&definition.default_value, &anchor, sizeof anchor);
+  }
+  return write_metadata_record(p_table, columns.data(), total_columns,
+                               total_variable_length_columns, packed_defaults, definitions);
 }

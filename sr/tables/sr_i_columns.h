@@ -6,6 +6,7 @@
 #define SR_I_COLUMNS_H
 
 #include <cstdint>
+#include <span>
 #include <vector>
 
 #include "qv_cu.h"
@@ -57,5 +58,15 @@ int32_t sr_i_pack_variable_length_default_values(cu_iconv_t *p_conversion, sr_co
 int32_t sr_i_build_metadata_record(sr_i_table_t *p_table, const sr_column_t *p_columns,
                                    uint32_t total_columns, uint32_t total_variable_length_columns,
                                    const std::vector<unsigned char> &packed_defaults);
+
+/*
+ * Reserves the metadata record of `p_table` (an empty pool) holding the
+ * columns of `p_source` at the positions `source_columns`, in that order
+ * (a position may come twice): definitions, names, defaults and
+ * structured-data definitions copied, their references into the record
+ * made anew. Returns 0, 12 or 15 (raised).
+ */
+int32_t sr_i_build_selected_metadata_record(sr_i_table_t *p_table, const sr_i_table_t *p_source,
+                                            std::span<const uint32_t> source_columns);
 
 #endif /* SR_I_COLUMNS_H */

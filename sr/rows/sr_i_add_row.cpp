@@ -4,8 +4,6 @@
 // position), entered in the key hash table and queued as a pending addition.
 // A failure leaves the table exactly as it was.
 
-#include <cstring>
-
 #include "frame/sr_i_errors.h"
 #include "frame/sr_i_tree.h"
 #include "qv_cu.h"
@@ -59,14 +57,9 @@ class bucket_warmer {
         (sr_i_is_variable_length(type) && type != QV_CHAR_PTR && type != QV_RSRC_HANDLE_PTR)) {
       return;
     }
-    // The key as the hash table sees it: the 8 bytes of a fixed-size value,
-    // else the block the value points at.
     const qv_value_t stored = sr_i_value_or_empty(type, key);
-    const void *p_key = &stored;
-    if (sr_i_is_variable_length(type)) {
-      std::memcpy(&p_key, &stored, sizeof p_key);
-    }
-    known_ = sr_i_hash_table_try_bucket(p_hash_table_, p_key, &bucket_);
+    known_ =
+        sr_i_hash_table_try_bucket(p_hash_table_, sr_i_client_key_pointer(type, stored), &bucket_);
     if (known_) {
       __builtin_prefetch(&p_hash_table_->p_elements[bucket_]);
     }

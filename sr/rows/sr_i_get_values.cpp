@@ -55,17 +55,6 @@ int32_t read_column(const sr_i_table_t *p_table, const void *p_record, uint32_t 
   return 0;
 }
 
-// The pointer the hash table compares with its stored keys: the key's block
-// for a variable-length key type, the 8 bytes of the value otherwise.
-const void *hash_key_pointer(qv_data_type_t key_type, const qv_value_t &row_key) {
-  if (!sr_i_is_variable_length(key_type)) {
-    return &row_key;
-  }
-  const void *p_block;
-  std::memcpy(&p_block, &row_key, sizeof p_block);
-  return p_block;
-}
-
 // The first row of the packed index whose key equals `row_key`. A row's
 // committed key counts, its applied key only when it was never committed, so
 // a pending change of the key does not move the row. 202 is not raised here.
@@ -210,8 +199,9 @@ int32_t sr_i_get_fixed_row_index_for_key(sr_i_table_t *p_table, qv_value_t row_k
   const qv_value_t key = sr_i_value_or_empty(key_type, row_key);
   int32_t rc;
   if (p_table->p_rows_hash_table != nullptr) {
-    rc = sr_i_hash_table_get_index(p_table->p_rows_hash_table, hash_key_pointer(key_type, key),
-                                   p_fixed_row_index, nullptr);
+    rc = sr_i_hash_table_get_index(p_table->p_rows_hash_table,
+                                   sr_i_client_key_pointer(key_type, key), p_fixed_row_index,
+                                   nullptr);
   } else {
     rc = scan_for_key(p_table, key, p_fixed_row_index);
   }

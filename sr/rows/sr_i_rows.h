@@ -81,6 +81,19 @@ inline const unsigned char *sr_i_default_data(const sr_i_table_t *p_table) {
 /* The key pointer of a record (see above). */
 const void *sr_i_row_key(const sr_i_table_t *p_table, const void *p_record);
 
+/* The key pointer of a client's key value, which the key hash table hashes
+ * and compares with the key pointers of records: the block the value points
+ * at for a variable-length key type, the value's own 8 bytes otherwise (so
+ * the pointer is only good while `key` lives). */
+inline const void *sr_i_client_key_pointer(qv_data_type_t key_type, const qv_value_t &key) {
+  if (!sr_i_is_variable_length(key_type)) {
+    return &key;
+  }
+  const void *p_block;
+  std::memcpy(&p_block, &key, sizeof p_block);
+  return p_block;
+}
+
 /* The column of that exact name, or -1. `likely_column`, when a column of
  * the table, is compared first: callers naming several columns mostly name
  * them in table order. */

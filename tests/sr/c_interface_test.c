@@ -40,6 +40,8 @@ int main(void) {
   qv_value_t value;
   const char *names[1] = {"Port"};
   qv_value_t *values[1] = {&value};
+  uint32_t count = 0;
+  uint32_t *p_rows = NULL;
 
   CHECK(sr_open_tree_1(NULL, 0, 0) == SR_E_INVALID_HANDLE);
   CHECK(last_code(text, sizeof text) == 100);
@@ -63,6 +65,15 @@ int main(void) {
   CHECK(sr_add_row_1(table, names, values, 1) == 0);
   value.val_uint32 = 0;
   CHECK(sr_get_field_by_index_1(table, 0, "Port", &value) == 0 && value.val_uint32 == 8080);
+  /* The row was committed at once (implicit control): nothing pending, and
+   * the key is held by that one row. */
+  CHECK(sr_get_updated_rows_1(table, &count, &p_rows) == 0 && count == 0 && p_rows == NULL);
+  value.val_uint32 = 8080;
+  CHECK(sr_get_duplicate_rows_1(table, value, &count, &p_rows, 0) == 0 && count == 1 &&
+        p_rows != NULL && p_rows[0] == 0);
+  free(p_rows);
+  value.val_uint32 = 8081;
+  CHECK(sr_get_duplicate_rows_1(table, value, &count, &p_rows, 0) == SR_E_NO_ROW_FOR_KEY);
   CHECK(sr_close_tree_1(tree) == 0);
   CHECK((cu_dtc_table_1[QV_CHAR_PTR_ARRAY] & CU_DTC_POINTER) != 0);
   CHECK(strcmp(cu_mesgtbl_qv_sr_set[0], "Reserved: DO NOT USE!") == 0);

@@ -3,6 +3,7 @@
  * unit is compiled by the C compiler, links against the shared libraries and
  * checks the contract of the calls it makes. Exit status 0 means success.
  */
+#include <stdarg.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -32,10 +33,21 @@ static int32_t last_code(char *p_text, size_t size) {
   return code;
 }
 
+static int32_t list_selected(sr_opaque_handle_t table, uint32_t *p_count, uint32_t **pp_rows,
+                             const char *p_criteria, ...) {
+  va_list ap;
+  int32_t rc;
+  va_start(ap, p_criteria);
+  rc = sr_get_selected_rows_v_1(table, p_criteria, ap, 0, p_count, pp_rows);
+  va_end(ap);
+  return rc;
+}
+
 int main(void) {
   char text[512];
   sr_opaque_handle_t tree = NULL;
   sr_opaque_handle_t table = NULL;
+  sr_opaque_handle_t result = NULL;
   sr_column_t column;
   qv_value_t value;
   const char *names[1] = {"Port"};
@@ -74,6 +86,14 @@ int main(void) {
   free(p_rows);
   value.val_uint32 = 8081;
   CHECK(sr_get_duplicate_rows_1(table, value, &count, &p_rows, 0) == SR_E_NO_ROW_FOR_KEY);
+  /* Selection, with the format's values as C variadic arguments and as a
+   * va_list (through a variadic helper of our own). */
+  CHECK(sr_select_1(table, names, 1, &result, "Port == $ui", (uint32_t)8080) == 0);
+  CHECK(sr_get_field_by_index_1(result, 0, "Port", &value) == 0 && value.val_uint32 == 8080);
+  CHECK(sr_close_table_1(result) == 0);
+  CHECK(list_selected(table, &count, &p_rows, "Port > $ui", (uint32_t)80) == 0 && count == 1 &&
+        p_rows[0] == 0);
+  free(p_rows);
   CHECK(sr_close_tree_1(tree) == 0);
   CHECK((cu_dtc_table_1[QV_CHAR_PTR_ARRAY] & CU_DTC_POINTER) != 0);
   CHECK(strcmp(cu_mesgtbl_qv_sr_set[0], "Reserved: DO NOT USE!") == 0);

@@ -7,7 +7,10 @@
 
 #include <cstdarg>
 #include <cstdlib>
+#include <fstream>
+#include <iterator>
 #include <map>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -300,6 +303,109 @@ TEST_F(Select, FailuresComeInTheirOrderAndLeaveNothingBehind) {
   EXPECT_EQ(object(table)->change_counter, counter);
   EXPECT_EQ(counts(table), rows);
   EXPECT_EQ(count_of(table, "d", 1), 4);  // pending changes untouched
+}
+
+// ---- The guide's worked example ------------------------------------------
+
+// The cells of the markdown table rows in `text` that follow the line
+// starting with `header`, up to the first line that is not a table row.
+std::vector<std::vector<std::string>> table_after(const std::string &text,
+                                                  const std::string &header) {
+  std::vector<std::vector<std::string>> rows;
+  std::istringstream lines(text.substr(text.find("\n" + header) + 1));
+  std::string line;
+  std::getline(lines, line);  // the header
+  std::getline(lines, line);  // the rule
+  while (std::getline(lines, line) && line.starts_with("|")) {
+    std::vector<std::string> cells;
+    std::string cell;
+    for (size_t at = 1; at < line.size(); ++at) {
+      if (line[at] == '\\' && at + 1 < line.size() && line[at + 1] == '|') {
+        cell += line[++at];  // an escaped bar inside a cell
+      } else if (line[at] == '|') {
+        const size_t first = cell.find_first_not_of(' ');
+        cells.push_back(first == std::string::npos
+                            ? ""
+                            : cell.substr(first, cell.find_last_not_of(' ') - first + 1));
+        cell.clear();
+      } else {
+        cell += line[at];
+      }
+    }
+    rows.push_back(cells);
+  }
+  return rows;
+}
+
+std::vector<std::string> split_names(const std::string &list) {
+  std::vector<std::string> names;
+  std::istringstream items(list);
+  for (std::string name; std::getline(items, name, ',');) {
+    name.erase(0, name.find_first_not_of(' '));
+    if (!name.empty() && name != "(none)") {
+      names.push_back(name);
+    }
+  }
+  return names;
+}
+
+TEST_F(Select, TheGuidesWorkedExampleSelectsWhatItSays) {
+  std::ifstream guide(std::string(QV_SOURCE_DIR) + "/docs/expressions.md");
+  const std::string text{std::istreambuf_iterator<char>(guide), {}};
+  const auto rows = table_after(text, "| Name | Mtu | Metric | Aliases |");
+  const auto examples = table_after(text, "| Criteria | Selects |");
+  ASSERT_EQ(rows.size(), 4u);
+  ASSERT_GE(examples.size(), 5u);
+
+  sr_opaque_handle_t interfaces =
+      make_table("/interfaces",
+                 {column("Name", QV_CHAR_PTR, SR_PRIMARY_KEY), column("Mtu", QV_UINT32),
+                  column("Metric", QV_INT32), column("Aliases", QV_CHAR_PTR_ARRAY)},
+                 Implicit);
+  value_arena arena;
+  for (const auto &row : rows) {
+    std::vector<qv_value_t> aliases;
+    for (const std::string &alias : split_names(row[3])) {
+      aliases.push_back(arena.string(alias));
+    }
+    ASSERT_EQ(add_fields(interfaces, {{"Name", arena.string(row[0])},
+                                      {"Mtu", number32(std::stoul(row[1]))},
+                                      {"Metric", int32_value(std::stoi(row[2]))},
+                                      {"Aliases", arena.array(aliases)}}),
+              0);
+  }
+  auto names_of = [&](sr_opaque_handle_t table) {
+    std::vector<std::string> names;
+    for (int32_t packed = 0;; ++packed) {
+      qv_value_t name{};
+      if (sr_get_field_by_index_1(table, packed, "Name", &name) != 0) {
+        return names;
+      }
+      names.push_back(name.ptr_char);
+      std::free(name.ptr_char);
+    }
+  };
+  for (const auto &example : examples) {
+    std::string criteria = example[0].substr(1, example[0].size() - 2);  // the code span
+    SCOPED_TRACE(criteria);
+    const std::vector<std::string> wanted = split_names(example[1]);
+    sr_opaque_handle_t result = nullptr;
+    ASSERT_EQ(sr_select_1(interfaces, nullptr, 0, &result, criteria.c_str()), 0);
+    EXPECT_EQ(names_of(result), wanted);
+    std::vector<std::string> listed_names;
+    for (const uint32_t fixed : listed(interfaces, 0, criteria.c_str())) {
+      listed_names.push_back(string_at_fixed(interfaces, fixed, "Name", 0));
+    }
+    EXPECT_EQ(listed_names, wanted);
+  }
+
+  // The C snippet closing the section.
+  sr_opaque_handle_t wide = nullptr;
+  const char *columns[] = {"Mtu"};
+  ASSERT_EQ(sr_select_1(interfaces, columns, 1, &wide, "Mtu >= $ui", uint32_t{1500}), 0);
+  EXPECT_EQ(object(wide)->total_columns, 2u);
+  EXPECT_STREQ(object(wide)->p_columns[1].name, "Mtu");
+  EXPECT_EQ(names_of(wide), (std::vector<std::string>{"eth0", "eth1", "lo"}));
 }
 
 }  // namespace

@@ -11,7 +11,8 @@
  * changes one service, deletes "db" while it exists and adds a queue, in one
  * explicit transaction. Before the commit it prints both views of the
  * table: the committed one, which other readers see, and the applied one,
- * with the transaction's changes. Then it commits and prints the result.
+ * with the transaction's changes. Then it commits, prints the result, and
+ * selects the enabled services that run on one host.
  */
 #include <stdio.h>
 #include <stdlib.h>
@@ -116,6 +117,33 @@ static int32_t find_row(sr_opaque_handle_t table, const char *p_name) {
 }
 
 /*
+ * A selection: the enabled services that run on `p_host`, copied into a new
+ * table of two columns (the key, name, always comes first), printed, and
+ * closed again.
+ */
+static void print_services_on(sr_opaque_handle_t table, const char *p_host) {
+  const char *columns[] = {"port"};
+  sr_opaque_handle_t selected = NULL;
+  check(sr_select_1(table, columns, 1, &selected, "enabled != 0 && $s in hosts", p_host),
+        "sr_select_1");
+  printf("Enabled services on %s:", p_host);
+  const char *names[] = {"name", "port"};
+  for (int32_t row = 0;; ++row) {
+    qv_value_t name, port;
+    qv_value_t *results[] = {&name, &port};
+    const int32_t rc = sr_get_fields_by_index_1(selected, row, names, results, 2);
+    if (rc == SR_E_NO_ROW_FOR_INDEX) {
+      break;
+    }
+    check(rc, "sr_get_fields_by_index_1");
+    printf(" %s (port %d)", name.ptr_char, port.val_int32);
+    free(name.ptr_char);
+  }
+  printf("\n");
+  check(sr_close_table_1(selected), "sr_close_table_1");
+}
+
+/*
  * Rows are found by name through a hash table of 64 buckets. Without one, a
  * table keyed by strings checks a new key by comparing it with every live
  * row in row order, which also compares a row that reuses the place of a
@@ -203,6 +231,7 @@ int main(int argc, char **argv) {
   print_table(table, 1, "Applied view, before the commit");
   check(sr_commit_1(table), "sr_commit_1");
   print_table(table, 0, "After the commit");
+  print_services_on(table, "alpha");
 
   check(sr_close_table_1(table), "sr_close_table_1");
   check(sr_close_tree_1(tree), "sr_close_tree_1");

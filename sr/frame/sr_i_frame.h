@@ -25,11 +25,11 @@
 #include <cstdint>
 #include <new>
 
-#include "qv_cu.h"
-#include "qv_sr.h"
 #include "frame/sr_i_errors.h"
 #include "frame/sr_i_source_location.h"
 #include "frame/sr_i_trace.h"
+#include "qv_cu.h"
+#include "qv_sr.h"
 
 /* What the frame needs to know of an exported function. */
 struct sr_i_entry_point_t {

@@ -19,8 +19,8 @@
 #include <set>
 #include <string>
 
-#include "qv_cu.h"
 #include "frame/sr_i_read_write_lock.h"
+#include "qv_cu.h"
 
 /* A mount point: the registry path prefix `name` maps onto the directory
  * `filesystem_path`, whose files are written in blocks of `block_size`. */

@@ -581,8 +581,7 @@ QV_SR_EXPORT int32_t sr_get_updated_rows_1(sr_opaque_handle_t table_handle,
  * SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_NO_ROW_FOR_KEY (with the
  * key and table in the message) when no row has the key; SR_E_NO_MEMORY.
  */
-QV_SR_EXPORT int32_t sr_get_duplicate_rows_1(sr_opaque_handle_t table_handle,
-                                             qv_value_t key_value,
+QV_SR_EXPORT int32_t sr_get_duplicate_rows_1(sr_opaque_handle_t table_handle, qv_value_t key_value,
                                              uint32_t *p_duplicate_rows_count,
                                              uint32_t **p_p_duplicate_rows_fixed_indices,
                                              uint32_t uncommitted_updates_visible);

@@ -11,11 +11,11 @@
 #include <cstring>
 
 #include "frame/sr_i_errors.h"
-#include "tables/sr_i_hash_table.h"
-#include "tables/sr_i_record_buffer_pool.h"
+#include "frame/sr_i_tree.h"
 #include "rows/sr_i_row_operations.h"
 #include "rows/sr_i_rows.h"
-#include "frame/sr_i_tree.h"
+#include "tables/sr_i_hash_table.h"
+#include "tables/sr_i_record_buffer_pool.h"
 
 namespace {
 

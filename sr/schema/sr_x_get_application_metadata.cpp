@@ -3,9 +3,9 @@
 // container) in the view the table reads by default: the applied one when
 // the table shows uncommitted updates, else the committed one.
 
-#include "schema/sr_i_application_metadata.h"
 #include "frame/sr_i_frame.h"
 #include "frame/sr_i_read_write_lock.h"
+#include "schema/sr_i_application_metadata.h"
 #include "tables/sr_i_table.h"
 
 namespace {

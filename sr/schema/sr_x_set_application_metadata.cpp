@@ -3,10 +3,10 @@
 // added when missing) with a copy of the caller's bytes, as a change that
 // commit makes durable and abort undoes.
 
-#include "schema/sr_i_application_metadata.h"
 #include "frame/sr_i_frame.h"
-#include "tables/sr_i_table.h"
 #include "rows/sr_i_transaction.h"
+#include "schema/sr_i_application_metadata.h"
+#include "tables/sr_i_table.h"
 
 namespace {
 constexpr sr_i_entry_point_t Set_Application_Metadata{91, true};

@@ -7,11 +7,11 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "frame/sr_i_frame.h"
+#include "frame/sr_i_tree.h"
 #include "qv_pmsg.h"
 #include "tables/sr_i_columns.h"
-#include "frame/sr_i_frame.h"
 #include "tables/sr_i_table.h"
-#include "frame/sr_i_tree.h"
 
 namespace {
 

@@ -10,10 +10,10 @@
 #include <cstring>
 #include <new>
 
-#include "qv_cu.h"
-#include "tables/sr_i_columns.h"
 #include "frame/sr_i_errors.h"
+#include "qv_cu.h"
 #include "storage/sr_i_storage.h"
+#include "tables/sr_i_columns.h"
 
 namespace {
 

@@ -10,10 +10,10 @@
 #include <cstring>
 #include <vector>
 
-#include "tables/sr_i_columns.h"
-#include "tables/sr_i_create_table.h"
 #include "frame/sr_i_errors.h"
 #include "frame/sr_i_tree.h"
+#include "tables/sr_i_columns.h"
+#include "tables/sr_i_create_table.h"
 
 namespace {
 

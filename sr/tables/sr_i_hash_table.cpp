@@ -17,8 +17,8 @@
 #include <cstring>
 #include <new>
 
-#include "qv_cu.h"
 #include "frame/sr_i_errors.h"
+#include "qv_cu.h"
 
 namespace {
 

@@ -5,11 +5,11 @@
 
 #include <memory>
 
-#include "tables/sr_i_create_table.h"
 #include "frame/sr_i_frame.h"
 #include "frame/sr_i_paths.h"
-#include "storage/sr_i_storage.h"
 #include "frame/sr_i_tree.h"
+#include "storage/sr_i_storage.h"
+#include "tables/sr_i_create_table.h"
 
 namespace {
 

@@ -12,10 +12,10 @@
 #include <thread>
 #include <vector>
 
-#include "tables/sr_i_hash_table.h"
-#include "tables/sr_i_table.h"
 #include "frame/sr_i_tree.h"
 #include "sr_row_test_support.h"
+#include "tables/sr_i_hash_table.h"
+#include "tables/sr_i_table.h"
 
 namespace {
 
@@ -89,18 +89,6 @@ TEST_F(Tables, EveryColumnIsCheckedBeforeTheKeysAreCounted) {
             0);
 }
 
-TEST_F(Tables, ModesDecideControlAndAreAlwaysWritable) {
-  sr_opaque_handle_t implicit = nullptr, explicit_table = nullptr;
-  EXPECT_EQ(create("/m8", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 8), SR_E_INVALID_MODE);
-  EXPECT_EQ(create("/m-1", {column("k", QV_INT32, SR_PRIMARY_KEY)}, -1), SR_E_INVALID_MODE);
-  ASSERT_EQ(create("/m1", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 1, &implicit), 0);
-  ASSERT_EQ(create("/m5", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 5, &explicit_table), 0);
-  EXPECT_EQ(object(implicit)->mode, Sr_Mode_Writable);
-  EXPECT_EQ(object(implicit)->implicitly_controlled, 1u);
-  EXPECT_EQ(object(explicit_table)->mode, Sr_Mode_Writable);
-  EXPECT_EQ(object(explicit_table)->implicitly_controlled, 0u);
-}
-
 TEST_F(Tables, ResourceHandleKeysGetTheBuiltInHashTable) {
   sr_opaque_handle_t handle_keyed = nullptr, int_keyed = nullptr;
   ASSERT_EQ(create("/h", {column("k", QV_RSRC_HANDLE_PTR, SR_PRIMARY_KEY)}, 0, &handle_keyed), 0);
@@ -120,20 +108,28 @@ TEST_F(Tables, ResourceHandleKeysGetTheBuiltInHashTable) {
 }
 
 TEST_F(Tables, ARefusedPersistentTableLeavesNoFile) {
-  const auto directory =
-      std::filesystem::temp_directory_path() / ("sr_create_" + std::to_string(getpid()));
-  ASSERT_EQ(sr_mount_local_tree_1(tree_, "/disk", directory.c_str(), 0), 0);
+  mount_disk();
   EXPECT_EQ(create("/disk/t", {column("k", QV_BINARY_PTR, SR_PRIMARY_KEY)}), SR_E_INVALID_COLUMN);
-  EXPECT_TRUE(std::filesystem::is_empty(directory));
+  EXPECT_TRUE(std::filesystem::is_empty(directory_));
   // A transient table's own path cannot become a mount point.
   ASSERT_EQ(create("/cfg", {column("k", QV_INT32, SR_PRIMARY_KEY)}), 0);
-  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/cfg", directory.c_str(), 0), SR_E_TABLE_EXISTS);
-  std::filesystem::remove_all(directory);
+  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/cfg", directory_.c_str(), 0), SR_E_TABLE_EXISTS);
 }
 
+// Creation takes modes 0 to 7, always writable, implicitly controlled below
+// 4; opening takes modes 1, 2, 3 and 6 (reading, writing implicitly or
+// explicitly controlled), shares one object, and the control kinds of the
+// writing handles must agree.
 TEST_F(Tables, OpeningSharesOneObjectAndControlKindsMustAgree) {
   sr_opaque_handle_t created = nullptr, first = nullptr, second = nullptr, other = nullptr;
-  ASSERT_EQ(create("/shared", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 0, &created), 0);
+  EXPECT_EQ(create("/m8", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 8), SR_E_INVALID_MODE);
+  EXPECT_EQ(create("/m-1", {column("k", QV_INT32, SR_PRIMARY_KEY)}, -1), SR_E_INVALID_MODE);
+  ASSERT_EQ(create("/m5", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 5, &other), 0);
+  EXPECT_EQ(object(other)->mode, Sr_Mode_Writable);
+  EXPECT_EQ(object(other)->implicitly_controlled, 0u);
+  ASSERT_EQ(create("/shared", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 1, &created), 0);
+  EXPECT_EQ(object(created)->mode, Sr_Mode_Writable);
+  EXPECT_EQ(object(created)->implicitly_controlled, 1u);
   EXPECT_EQ(sr_open_table_1(tree_, "/missing", 2, &other), SR_E_NO_TABLE);
   for (int32_t refused : {0, 4, 5, 8, -1}) {
     EXPECT_EQ(sr_open_table_1(tree_, "/shared", refused, &other), SR_E_INVALID_MODE) << refused;

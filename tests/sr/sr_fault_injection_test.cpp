@@ -7,7 +7,7 @@
 // retried step or an abort, then a further transaction), and that the file,
 // opened by another tree, holds a committed state: the old one, or the new
 // one when the failed call came after the commit point. Last, a read-only
-// table whose reading again for writing fails.
+// table read again for writing, once with a read that fails.
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -504,33 +504,44 @@ TEST_F(FaultInjection, CommitAndAbortFailuresLeaveACommittedState) {
   fail_every_call_of({Committing, Aborting}, "commit and abort");
 }
 
-// A read-only table turning writable is read again from its file; when that
-// read fails, the table stays read-only with the references it had, so that
-// closing its last handle still drops it from memory.
-TEST_F(FaultInjection, AFailedReloadForWritingKeepsTheReadOnlyTableAndItsReferences) {
+// A read-only table turning writable is read again from its file, and finds
+// what another program committed meanwhile. When that read fails the table
+// stays read-only with the references it had; once it succeeds both handles
+// write, and closing them drops the table from memory.
+TEST_F(FaultInjection, AReadOnlyTableIsReadAgainForWritingAndAFailedReadKeepsItAsItWas) {
   std::filesystem::create_directory(mount_directory_);
   ASSERT_NE(tree_ = mounted_tree(mount_directory_), nullptr);
   sr_opaque_handle_t table = nullptr;
   ASSERT_NO_FATAL_FAILURE(create_committed(&table));
   ASSERT_EQ(sr_close_table_1(table), 0);
-
   sr_opaque_handle_t reader = nullptr;
   ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 1, &reader), 0);
+  sr_opaque_handle_t other = mounted_tree(mount_directory_);
+  ASSERT_EQ(sr_open_table_1(other, "/disk/t", 2, &table), 0);
+  ASSERT_EQ(add_named(table, "late", 5), 0);
+  ASSERT_EQ(sr_close_tree_1(other), 0);
+
   Injector = injector_t{.target = Read, .index = 1, .error = EIO};
   sr_opaque_handle_t writer = nullptr;
-  EXPECT_EQ(sr_open_table_1(tree_, "/disk/t", 6, &writer), SR_E_SYSTEM_CALL);
+  EXPECT_EQ(sr_open_table_1(tree_, "/disk/t", 2, &writer), SR_E_SYSTEM_CALL);
   EXPECT_EQ(Injector.failures, 1);
   Injector.target = Total_Kinds;
   EXPECT_EQ(object(reader)->references, 1u);
   EXPECT_EQ(rows_in(reader, 0), Committed_Rows);
-  EXPECT_EQ(add_named(reader, "late", 99), SR_E_ACCESS);
+  EXPECT_EQ(add_named(reader, "mine", 6), SR_E_ACCESS);
 
+  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 2, &writer), 0);
+  EXPECT_EQ(writer, reader);
+  EXPECT_EQ(object(reader)->references, 2u);
+  EXPECT_EQ(add_named(reader, "mine", 6), 0);
+  rows_t rows = Committed_Rows;
+  rows["late"] = 5;
+  rows["mine"] = 6;
+  EXPECT_EQ(rows_in(writer, 0), rows);
   ASSERT_EQ(sr_close_table_1(reader), 0);
+  ASSERT_EQ(sr_close_table_1(writer), 0);
   EXPECT_TRUE(static_cast<sr_i_tree_t *>(tree_)->tables.empty())
       << "the table outlived its last handle";
-  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 6, &writer), 0);
-  EXPECT_EQ(object(writer)->references, 1u);
-  EXPECT_EQ(rows_in(writer, 0), Committed_Rows);
   EXPECT_EQ(sr_close_tree_1(tree_), 0);
 }
 

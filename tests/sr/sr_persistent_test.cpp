@@ -149,26 +149,6 @@ TEST_F(Persistent, ARewriteLeavesOnlyTheLiveRows) {
   EXPECT_EQ(sr_close_tree_1(other), 0);
 }
 
-TEST_F(Persistent, AReadOnlyTableOpenedForWritingIsReadAgain) {
-  ASSERT_EQ(sr_close_table_1(create_named_counts("/disk/t", Implicit)), 0);
-  sr_opaque_handle_t reader = nullptr;
-  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 1, &reader), 0);
-  // Meanwhile another program adds a row.
-  sr_opaque_handle_t other = second_tree();
-  sr_opaque_handle_t writer = nullptr;
-  ASSERT_EQ(sr_open_table_1(other, "/disk/t", 2, &writer), 0);
-  ASSERT_EQ(add_named(writer, "late", 5), 0);
-  ASSERT_EQ(sr_close_tree_1(other), 0);
-
-  EXPECT_EQ(count_of(reader, "late", 0), -1);
-  sr_opaque_handle_t upgraded = nullptr;
-  ASSERT_EQ(sr_open_table_1(tree_, "/disk/t", 2, &upgraded), 0);
-  EXPECT_EQ(upgraded, reader);
-  EXPECT_EQ(object(reader)->references, 2u);
-  EXPECT_EQ(count_of(reader, "late", 0), 5);
-  EXPECT_EQ(add_named(reader, "mine", 6), 0);
-}
-
 TEST_F(Persistent, DamagedFilesAreRefusedWithACode) {
   sr_opaque_handle_t table = create_named_counts("/disk/t", Implicit);
   ASSERT_EQ(add_named(table, "a", 1), 0);

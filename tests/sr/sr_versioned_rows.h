@@ -34,13 +34,7 @@ inline constexpr int32_t Open_Explicit = 6;
 inline constexpr uint32_t Hash_Buckets = 64;
 
 inline uint32_t hash_id(const void *p_key) {
-  int32_t id;
-  std::memcpy(&id, p_key, sizeof id);
-  return static_cast<uint32_t>(id) % Hash_Buckets;
-}
-
-inline int32_t compare_ids(const void *p_stored_key, const void *p_key) {
-  return std::memcmp(p_stored_key, p_key, sizeof(int32_t)) == 0 ? 0 : 1;
+  return static_cast<uint32_t>(sr_test::int32_key_at(p_key)) % Hash_Buckets;
 }
 
 using sr_test::int32_value;
@@ -53,13 +47,13 @@ inline int32_t create_table(sr_opaque_handle_t tree, const char *p_path, int32_t
                             sr_test::column("Version", QV_INT32),
                             sr_test::column("Payload", QV_CHAR_PTR)};
   return sr_create_hashed_key_table_1(tree, p_path, columns, 3, mode, Hash_Buckets, hash_id,
-                                      compare_ids, p_table);
+                                      sr_test::compare_int32_keys, p_table);
 }
 
 inline int32_t open_table(sr_opaque_handle_t tree, const char *p_path, int32_t mode,
                           sr_opaque_handle_t *p_table) {
-  return sr_open_hashed_key_table_1(tree, p_path, mode, Hash_Buckets, hash_id, compare_ids,
-                                    p_table);
+  return sr_open_hashed_key_table_1(tree, p_path, mode, Hash_Buckets, hash_id,
+                                    sr_test::compare_int32_keys, p_table);
 }
 
 // 40 to 40 + `spread` - 1 bytes, different for every version of every row.

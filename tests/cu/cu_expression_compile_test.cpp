@@ -70,12 +70,7 @@ TEST(ExpressionCompile, TheCallbackIsAskedAboutColumnsAndTheirFields) {
                                                       {"Speed", 5, 9},  // Link is column 9
                                                       {"Addresses", 9, CU_EXPR_NO_PARENT},
                                                       {"Prefix", 6, 20}};
-  ASSERT_EQ(table.questions.size(), expected.size());
-  for (size_t at = 0; at < expected.size(); ++at) {
-    EXPECT_EQ(table.questions[at].name, expected[at].name);
-    EXPECT_EQ(table.questions[at].length, expected[at].length);
-    EXPECT_EQ(table.questions[at].parent_id, expected[at].parent_id);
-  }
+  EXPECT_TRUE(table.questions == expected);
 }
 
 // "inf" and "nan" are literals only when the table has no column of that name.

@@ -35,6 +35,7 @@ class test_table {
     std::string name;
     uint32_t length;
     uint32_t parent_id;
+    bool operator==(const question &) const = default;
   };
   std::vector<question> questions;
 

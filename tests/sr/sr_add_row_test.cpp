@@ -2,11 +2,19 @@
 // defaults, null pointers stored as empty values, long keys and values, key
 // checks by scan and by hash, revival of a deleted key at its old position,
 // the row index growing under pending changes, and an add whose memory
-// cannot be had leaving the table as it was.
+// cannot be had leaving the table as it was. Beneath them the table object:
+// its row index hands out the lowest free position, also as it grows and
+// while part of it was never used, and it answers block containment for the
+// file writer.
 
 #include <gtest/gtest.h>
 
+#include <cstddef>
+#include <cstdlib>
+#include <cstring>
 #include <map>
+#include <random>
+#include <set>
 #include <string>
 #include <utility>
 #include <vector>
@@ -14,6 +22,7 @@
 #include "rows/sr_i_rows.h"
 #include "sr_row_test_support.h"
 #include "tables/sr_i_allocation.h"
+#include "tables/sr_i_table.h"
 
 namespace {
 
@@ -62,9 +71,8 @@ TEST_F(AddRow, ChecksComeInTheirOrderAndAFailureLeavesNoTrace) {
   EXPECT_EQ(add_named(table, "c", 3), SR_E_APPLIED_UNCOMMITTED);
   ASSERT_EQ(sr_commit_1(table), 0);
   EXPECT_EQ(add_named(table, "c", 3), 0);
-}
 
-TEST_F(AddRow, AReadOnlyHandleIsRefused) {
+  // A read-only handle is refused.
   ASSERT_EQ(sr_close_table_1(create_numbered("/add/readonly", Explicit)), 0);
   sr_opaque_handle_t reader = nullptr;
   ASSERT_EQ(sr_open_table_1(tree_, "/add/readonly", 1, &reader), 0);
@@ -152,30 +160,6 @@ TEST_F(AddRow, ADeletedKeyComesBackAtItsOldPosition) {
   EXPECT_EQ(read.val_int32, 42);
 }
 
-TEST_F(AddRow, TheIndexDoublesAndPendingChangesFollowTheirRows) {
-  sr_opaque_handle_t table = create_numbered("/add/grow", Explicit);
-  EXPECT_EQ(object(table)->maximum_rows, 100u);
-  for (int32_t id = 0; id < 101; ++id) {
-    ASSERT_EQ(add_numbered(table, id, id * 10), 0);
-  }
-  EXPECT_EQ(object(table)->maximum_rows, 200u);
-  uint32_t listed = 0;
-  for (auto *p_change = object(table)->p_rows_change_list; p_change != nullptr;
-       p_change = p_change->p_next, ++listed) {
-    const sr_i_index_entry_t *p_entry = p_change->p_index_entry;
-    ASSERT_GE(p_entry, object(table)->p_rows_fixed_index);
-    ASSERT_LT(p_entry, object(table)->p_rows_fixed_index + 200);
-    EXPECT_EQ(p_entry->p_pending_change, p_change);
-  }
-  EXPECT_EQ(listed, 101u);
-  apply_commit(table);
-  for (int32_t id = 0; id < 101; ++id) {
-    qv_value_t read{};
-    ASSERT_EQ(sr_get_field_by_key_1(table, int32_value(id), "count", &read), 0);
-    EXPECT_EQ(read.val_int32, id * 10);
-  }
-}
-
 // ---- Allocations that fail -----------------------------------------------
 
 // The allocation through the table's door that fails: the n-th from now (1
@@ -186,12 +170,21 @@ bool allocation_fails() {
   return Allocations_Until_Failure > 0 && --Allocations_Until_Failure == 0;
 }
 
+// A grown block always moves, as it does when the heap cannot grow it in
+// place: whatever points into it must follow.
 constexpr sr_i_allocation_calls_t Failing_Allocation = {
     .allocate = [](size_t length) -> void * {
       return allocation_fails() ? nullptr : Sr_Default_Allocation.allocate(length);
     },
     .reallocate = [](void *p_block, size_t length) -> void * {
-      return allocation_fails() ? nullptr : Sr_Default_Allocation.reallocate(p_block, length);
+      if (allocation_fails()) {
+        return nullptr;
+      }
+      void *p_moved = std::malloc(length);
+      void *p_grown = Sr_Default_Allocation.reallocate(p_block, length);
+      std::memcpy(p_moved, p_grown, length);
+      std::free(p_grown);
+      return p_moved;
     },
 };
 
@@ -209,27 +202,9 @@ class AddRowWithoutMemory : public RowTables {
     RowTables::TearDown();
   }
 
-  // The rows of one view, id to count, read by packed index.
+  // The rows of one view, id to count.
   static std::map<int32_t, int32_t> rows_in(sr_opaque_handle_t table, uint32_t uncommitted) {
-    std::map<int32_t, int32_t> rows;
-    for (int32_t at = 0;; ++at) {
-      qv_value_t id{}, count{};
-      const char *names[] = {"id", "count"};
-      qv_value_t *values[] = {&id, &count};
-      const int32_t rc = sr_get_fields_by_index_and_visibility_1(table, at, names, values, 2,
-                                                                 uncommitted, nullptr);
-      if (rc == SR_E_NO_ROW_FOR_INDEX) {
-        return rows;
-      }
-      if (rc == SR_E_ROW_DELETED) {
-        continue;
-      }
-      if (rc != 0) {
-        ADD_FAILURE() << "reading packed row " << at << " gave " << rc;
-        return rows;
-      }
-      rows[id.val_int32] = count.val_int32;
-    }
+    return sr_test::rows_in<int32_t>(table, "id", uncommitted);
   }
 };
 
@@ -261,25 +236,29 @@ struct index_state {
   bool operator==(const index_state &) const = default;
 };
 
-// A full index of 100 committed rows, with a row set and a row deleted
+// A full index of 100 committed rows, with rows set and a row deleted
 // pending: the next add must grow the index, and either allocation of the
-// growth fails.
+// growth fails. Then the add is made again: after an abort, or on top of the
+// pending changes, which must follow their rows into the grown index.
 TEST_F(AddRowWithoutMemory, AGrowthThatFailsLeavesTheIndexAndTheTransactionAsTheyWere) {
   for (const int failing : {1, 2}) {
     SCOPED_TRACE("allocation " + std::to_string(failing) + " of the growth fails");
     const std::string path = "/add/no_memory_" + std::to_string(failing);
     sr_opaque_handle_t table = create_numbered(path.c_str(), Explicit);
+    EXPECT_EQ(object(table)->maximum_rows, 100u);
     std::map<int32_t, int32_t> committed;
     for (int32_t id = 0; id < 100; ++id) {
       ASSERT_EQ(add_numbered(table, id, id), 0);
       committed[id] = id;
     }
     apply_commit(table);
-    qv_value_t changed = int32_value(500);
-    ASSERT_EQ(sr_set_field_by_key_1(table, int32_value(5), "count", &changed), 0);
-    ASSERT_EQ(sr_delete_rows_1(table, "id == 7"), 0);
     std::map<int32_t, int32_t> applied = committed;
-    applied[5] = 500;
+    for (int32_t id = 0; id < 5; ++id) {
+      qv_value_t changed = int32_value(500 + id);
+      ASSERT_EQ(sr_set_field_by_key_1(table, int32_value(id), "count", &changed), 0);
+      applied[id] = 500 + id;
+    }
+    ASSERT_EQ(sr_delete_rows_1(table, "id == 7"), 0);
     applied.erase(7);
     ASSERT_EQ(object(table)->p_rows_free_chain, nullptr);
     const index_state before(object(table));
@@ -295,17 +274,27 @@ TEST_F(AddRowWithoutMemory, AGrowthThatFailsLeavesTheIndexAndTheTransactionAsThe
     EXPECT_EQ(rows_in(table, 1), applied);
     EXPECT_EQ(rows_in(table, 0), committed);
 
-    // The pending changes still abort, and the add goes through once memory
-    // can be had, and commits.
-    ASSERT_EQ(sr_abort_1(table), 0);
-    EXPECT_EQ(rows_in(table, 1), committed);
+    if (failing == 1) {
+      ASSERT_EQ(sr_abort_1(table), 0);
+      EXPECT_EQ(rows_in(table, 1), committed);
+      applied = committed;
+    }
     ASSERT_EQ(add_numbered(table, 100, 100), 0);
+    applied[100] = 100;
     EXPECT_EQ(object(table)->maximum_rows, 200u);
-    ASSERT_EQ(sr_set_field_by_key_1(table, int32_value(5), "count", &changed), 0);
+    const sr_i_index_entry_t *p_fixed = object(table)->p_rows_fixed_index;
+    size_t listed = 0;
+    for (const sr_i_change_entry_t *p_list :
+         {object(table)->p_rows_change_list, object(table)->p_delete_rows_change_list}) {
+      for (auto *p_change = p_list; p_change != nullptr; p_change = p_change->p_next, ++listed) {
+        const sr_i_index_entry_t *p_entry = p_change->p_index_entry;
+        ASSERT_TRUE(p_entry >= p_fixed && p_entry < p_fixed + 200) << "a change lost its row";
+        EXPECT_EQ(p_entry->p_pending_change, p_change);
+      }
+    }
+    EXPECT_EQ(listed, failing == 1 ? 1u : 7u);
     apply_commit(table);
-    committed[100] = 100;
-    committed[5] = 500;
-    EXPECT_EQ(rows_in(table, 0), committed);
+    EXPECT_EQ(rows_in(table, 0), applied);
   }
 }
 
@@ -342,6 +331,72 @@ TEST_F(AddRowWithoutMemory, AChangeThatCannotBeQueuedGivesTheRowBack) {
   std::map<int32_t, int32_t> with_new_row = committed;
   with_new_row[3] = 30;
   EXPECT_EQ(rows_in(table, 0), with_new_row);
+}
+
+// ---- The table object ---------------------------------------------------
+
+class TableObject : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    p_table_ = sr_i_create_null_table();
+    ASSERT_NE(p_table_, nullptr);
+  }
+  void TearDown() override { sr_i_close_table(p_table_); }
+
+  size_t position_of(const sr_i_index_entry_t *p_entry) const {
+    return static_cast<size_t>(p_entry - p_table_->p_rows_fixed_index);
+  }
+  sr_i_table_t *p_table_ = nullptr;
+};
+
+// Positions given back in any order while part of the index was never
+// handed out, and growth whenever nothing is free: every take is the lowest
+// free position, cleared of what its last row left there.
+TEST_F(TableObject, TakesAgreeWithASetOfFreePositionsThroughReturnsAndGrowth) {
+  ASSERT_EQ(sr_i_establish_rows_index(p_table_, 0), 0);  // no size: the default
+  ASSERT_EQ(p_table_->maximum_rows, Sr_Default_Index_Rows);
+  std::set<size_t> free_positions;
+  for (size_t position = 0; position < Sr_Default_Index_Rows; ++position) {
+    free_positions.insert(position);
+  }
+  std::vector<size_t> taken;
+  std::mt19937 random(3);
+  for (int step = 0; step < 3000; ++step) {
+    if (taken.empty() || random() % 3 != 0) {
+      sr_i_index_entry_t *p_entry = sr_i_rows_free_chain_remove(p_table_);
+      if (free_positions.empty()) {
+        ASSERT_EQ(p_entry, nullptr);
+        const uint32_t old_rows = p_table_->maximum_rows;
+        ASSERT_EQ(sr_i_grow_index(p_table_, old_rows), 0);
+        for (size_t position = old_rows; position < 2 * size_t{old_rows}; ++position) {
+          free_positions.insert(position);
+        }
+        continue;
+      }
+      ASSERT_NE(p_entry, nullptr);
+      ASSERT_EQ(position_of(p_entry), *free_positions.begin()) << "step " << step;
+      ASSERT_EQ(p_entry->p_committed, nullptr) << "step " << step;
+      free_positions.erase(free_positions.begin());
+      taken.push_back(position_of(p_entry));
+      p_entry->p_committed = p_entry;  // a row's state, to be cleared when it goes
+    } else {
+      const size_t at = random() % taken.size();
+      sr_i_rows_free_chain_insert(p_table_, p_table_->p_rows_fixed_index + taken[at]);
+      free_positions.insert(taken[at]);
+      taken.erase(taken.begin() + static_cast<std::ptrdiff_t>(at));
+    }
+  }
+  EXPECT_GT(p_table_->maximum_rows, 4 * Sr_Default_Index_Rows);
+}
+
+TEST_F(TableObject, RecordEndingOnABlockBoundaryIsNotContained) {
+  p_table_->block_size = 4096;
+  uint32_t block = 99;
+  EXPECT_FALSE(sr_i_record_contained_in_block(p_table_, 4000, 96, block));
+  EXPECT_TRUE(sr_i_record_contained_in_block(p_table_, 4000, 95, block));
+  EXPECT_EQ(block, 0u);
+  EXPECT_TRUE(sr_i_record_contained_in_block(p_table_, 8192, 100, block));
+  EXPECT_EQ(block, 2u);
 }
 
 }  // namespace

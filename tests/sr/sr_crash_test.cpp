@@ -26,13 +26,10 @@
 #include <map>
 #include <optional>
 #include <random>
-#include <sstream>
 #include <string>
 
-#include "qv_sr.h"
 #include "frame/sr_i_frame.h"
-#include "tables/sr_i_table.h"
-#include "rows/sr_i_transaction.h"
+#include "qv_sr.h"
 #include "sr_versioned_rows.h"
 
 namespace {
@@ -59,34 +56,6 @@ constexpr int Crash_Points_Per_Table = 50;
 constexpr const char *Table_Path = "/disk/crash/t";
 constexpr const char *Table_File = "crash,t";
 
-std::string encode(const table_state &state) {
-  if (!state.exists) {
-    return "absent";
-  }
-  std::ostringstream out;
-  out << state.counter;
-  for (const auto &[id, version] : state.rows) {
-    out << ' ' << id << ':' << version;
-  }
-  return out.str();
-}
-
-table_state decode(const std::string &text) {
-  table_state state;
-  if (text == "absent") {
-    return state;
-  }
-  state.exists = true;
-  std::istringstream in(text);
-  in >> state.counter;
-  std::string row;
-  while (in >> row) {
-    const size_t colon = row.find(':');
-    state.rows[std::stoi(row.substr(0, colon))] = std::stoi(row.substr(colon + 1));
-  }
-  return state;
-}
-
 // Payloads of 40 to about 900 bytes and 12 to 60 rows keep the file past
 // the size at which rewrites start, and the pipe messages short.
 constexpr uint32_t Payload_Spread = 860;
@@ -94,8 +63,7 @@ constexpr uint32_t Payload_Spread = 860;
 // The child: random transactions for ever, each reported to the parent. It
 // writes lines "P <kind> <state>" before a commit may begin and
 // "C <kind> <state>" once it has returned, or "E <what>" before it gives
-// up. The kind of a commit is create, implicit, apply (which rewrites the
-// file when it is mostly dead records) or rewrite (forced); a reported
+// up. The kind of a commit is create, or one of random_changes; a reported
 // commit that replaced the file says rewritten.
 class child_writer {
  public:
@@ -113,13 +81,16 @@ class child_writer {
       check(open_table(tree_, Table_Path, implicit ? Open_Implicit : Open_Explicit, &table_),
             "sr_open_hashed_key_table_1");
       for (uint32_t steps = 1 + rng_() % 10; steps > 0; --steps) {
-        if (implicit) {
-          // Deleted by packed index: the row's place among the live rows.
-          no_problem(changes_.implicit_change(
-              table_, committed_, true, [this](const auto &next) { announce("implicit", next); }));
-          confirm("implicit", committed_);
-        } else {
-          explicit_transaction();
+        const char *p_kind = nullptr;
+        const auto announce = [&](const char *p_what, const table_state &next) {
+          p_kind = p_what;
+          say(std::string("P ") + p_what + " " + describe(next));
+        };
+        // Implicit deletions by packed index: the row's place among the live rows.
+        no_problem(implicit ? changes_.implicit_change(table_, committed_, true, announce)
+                            : changes_.explicit_transaction(table_, committed_, 8, announce));
+        if (p_kind != nullptr) {
+          confirm(p_kind);
         }
       }
     }
@@ -139,22 +110,17 @@ class child_writer {
     }
   }
 
-  void announce(const char *p_kind, const table_state &state) {
-    say(std::string("P ") + p_kind + " " + encode(state));
-  }
-
   ino_t file_inode() const {
     struct stat status {};
     stat((directory_ + "/" + Table_File).c_str(), &status);
     return status.st_ino;
   }
 
-  void confirm(const char *p_kind, const table_state &state) {
-    committed_ = state;
-    const bool replaced = file_inode() != file_inode_;
+  // Reports the state committed, and whether the commit replaced the file.
+  void confirm(const char *p_kind) {
+    const bool replaced = file_inode() != file_inode_ && std::strcmp(p_kind, "create") != 0;
     file_inode_ = file_inode();
-    const bool created = std::strcmp(p_kind, "create") == 0;
-    say(std::string("C ") + (replaced && !created ? "rewritten" : p_kind) + " " + encode(state));
+    say(std::string("C ") + (replaced ? "rewritten" : p_kind) + " " + describe(committed_));
   }
 
   void check(int32_t rc, const char *p_call) {
@@ -171,11 +137,11 @@ class child_writer {
   void open_or_create() {
     const int32_t rc = open_table(tree_, Table_Path, Open_Implicit, &table_);
     if (rc == SR_E_NO_TABLE) {
-      const table_state created{true, 1, {}};
-      announce("create", created);
+      committed_ = {true, 1, {}};
+      say("P create " + describe(committed_));
       check(create_table(tree_, Table_Path, rng_() % 2 ? 0 : 4, &table_),
             "sr_create_hashed_key_table_1");
-      confirm("create", created);
+      confirm("create");
     } else {
       check(rc, "sr_open_hashed_key_table_1");
       no_problem(read_rows(table_, committed_, Payload_Spread));
@@ -183,32 +149,6 @@ class child_writer {
     }
     for (const auto &[id, version] : committed_.rows) {
       changes_.next_id = std::max(changes_.next_id, id + 1);
-    }
-  }
-
-  // Several changes through the explicitly controlled handle, then abort,
-  // apply and abort, or apply (appending or rewriting) and commit.
-  void explicit_transaction() {
-    table_state next = committed_;
-    no_problem(changes_.transaction(table_, committed_, next, 1 + rng_() % 8));
-    const uint64_t counter = rng_() % 2 ? 0 : committed_.counter + 1 + rng_() % 3;
-    next.counter = counter == 0 ? committed_.counter + 1 : counter;
-    auto *p_table = static_cast<sr_i_table_t *>(table_);
-    // A rewrite is forced through the internal apply; the table's write
-    // lock is of no use in this single-threaded process.
-    const uint32_t choice = rng_() % 20;
-    if (choice == 0) {
-      check(sr_abort_1(table_), "sr_abort_1");
-    } else if (choice <= 2) {
-      check(choice == 1 ? sr_apply_1(table_, counter) : sr_i_apply(p_table, 1, counter),
-            "apply before an abort");
-      check(sr_abort_1(table_), "sr_abort_1 after an apply");
-    } else {
-      const char *p_kind = choice <= 6 ? "rewrite" : "apply";
-      announce(p_kind, next);
-      check(choice <= 6 ? sr_i_apply(p_table, 1, counter) : sr_apply_1(table_, counter), p_kind);
-      check(sr_commit_1(table_), "sr_commit_1");
-      confirm(p_kind, next);
     }
   }
 
@@ -240,7 +180,7 @@ void take_line(const std::string &line, child_report &report) {
   }
   const size_t space = line.find(' ', 2);
   const std::string kind = line.substr(2, space - 2);
-  const table_state state = decode(line.substr(space + 1));
+  const table_state state = parse_state(line.substr(space + 1));
   if (line[0] == 'P') {
     report.announced = state;
     report.announced_kind = kind;
@@ -254,11 +194,9 @@ void take_line(const std::string &line, child_report &report) {
 
 class Crash : public ::testing::Test {
  protected:
-  void SetUp() override {
-    char pattern[] = "/tmp/qv_crash_XXXXXX";
-    ASSERT_NE(mkdtemp(pattern), nullptr);
-    directory_ = pattern;
-  }
+  // On a disk: its flushes take long enough for the kills to land inside
+  // commits, creations among them.
+  void SetUp() override { ASSERT_NE(directory_ = sr_test::new_directory("qv_crash", false), ""); }
   void TearDown() override { std::filesystem::remove_all(directory_); }
 
   // Runs one child with `seed`, kills it once it has sent `messages` lines
@@ -374,9 +312,9 @@ TEST_F(Crash, AKilledWriterLeavesTheLastCommittedStateOrTheOneInFlight) {
       ADD_FAILURE() << "seed " << seed << " (SR_CRASH_SEED), crash point " << point
                     << ", child seed " << child_seed << ", killed after " << messages
                     << " messages + " << delay
-                    << " us\n  found:     " << (read ? encode(found) : problem)
-                    << "\n  committed: " << encode(known) << "\n  announced: "
-                    << (report.announced ? report.announced_kind + " " + encode(*report.announced)
+                    << " us\n  found:     " << (read ? describe(found) : problem)
+                    << "\n  committed: " << describe(known) << "\n  announced: "
+                    << (report.announced ? report.announced_kind + " " + describe(*report.announced)
                                          : "none")
                     << "\n  files kept in " << keep_files(point);
       break;

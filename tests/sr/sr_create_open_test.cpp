@@ -1,10 +1,12 @@
 // Creating, opening and closing transient tables through the exported
 // calls: column validation and its order, the key moved first without
 // touching the caller's array, modes, shared objects and their references,
-// the metadata handed out, and many threads at once.
+// the metadata handed out; and threads at once, creating, opening and
+// closing tables of one tree, or reading rows while a writer commits.
 
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
@@ -12,10 +14,10 @@
 #include <thread>
 #include <vector>
 
-#include "tables/sr_i_hash_table.h"
-#include "tables/sr_i_table.h"
 #include "frame/sr_i_tree.h"
 #include "sr_row_test_support.h"
+#include "tables/sr_i_hash_table.h"
+#include "tables/sr_i_table.h"
 
 namespace {
 
@@ -89,18 +91,6 @@ TEST_F(Tables, EveryColumnIsCheckedBeforeTheKeysAreCounted) {
             0);
 }
 
-TEST_F(Tables, ModesDecideControlAndAreAlwaysWritable) {
-  sr_opaque_handle_t implicit = nullptr, explicit_table = nullptr;
-  EXPECT_EQ(create("/m8", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 8), SR_E_INVALID_MODE);
-  EXPECT_EQ(create("/m-1", {column("k", QV_INT32, SR_PRIMARY_KEY)}, -1), SR_E_INVALID_MODE);
-  ASSERT_EQ(create("/m1", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 1, &implicit), 0);
-  ASSERT_EQ(create("/m5", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 5, &explicit_table), 0);
-  EXPECT_EQ(object(implicit)->mode, Sr_Mode_Writable);
-  EXPECT_EQ(object(implicit)->implicitly_controlled, 1u);
-  EXPECT_EQ(object(explicit_table)->mode, Sr_Mode_Writable);
-  EXPECT_EQ(object(explicit_table)->implicitly_controlled, 0u);
-}
-
 TEST_F(Tables, ResourceHandleKeysGetTheBuiltInHashTable) {
   sr_opaque_handle_t handle_keyed = nullptr, int_keyed = nullptr;
   ASSERT_EQ(create("/h", {column("k", QV_RSRC_HANDLE_PTR, SR_PRIMARY_KEY)}, 0, &handle_keyed), 0);
@@ -120,20 +110,28 @@ TEST_F(Tables, ResourceHandleKeysGetTheBuiltInHashTable) {
 }
 
 TEST_F(Tables, ARefusedPersistentTableLeavesNoFile) {
-  const auto directory =
-      std::filesystem::temp_directory_path() / ("sr_create_" + std::to_string(getpid()));
-  ASSERT_EQ(sr_mount_local_tree_1(tree_, "/disk", directory.c_str(), 0), 0);
+  mount_disk();
   EXPECT_EQ(create("/disk/t", {column("k", QV_BINARY_PTR, SR_PRIMARY_KEY)}), SR_E_INVALID_COLUMN);
-  EXPECT_TRUE(std::filesystem::is_empty(directory));
+  EXPECT_TRUE(std::filesystem::is_empty(directory_));
   // A transient table's own path cannot become a mount point.
   ASSERT_EQ(create("/cfg", {column("k", QV_INT32, SR_PRIMARY_KEY)}), 0);
-  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/cfg", directory.c_str(), 0), SR_E_TABLE_EXISTS);
-  std::filesystem::remove_all(directory);
+  EXPECT_EQ(sr_mount_local_tree_1(tree_, "/cfg", directory_.c_str(), 0), SR_E_TABLE_EXISTS);
 }
 
+// Creation takes modes 0 to 7, always writable, implicitly controlled below
+// 4; opening takes modes 1, 2, 3 and 6 (reading, writing implicitly or
+// explicitly controlled), shares one object, and the control kinds of the
+// writing handles must agree.
 TEST_F(Tables, OpeningSharesOneObjectAndControlKindsMustAgree) {
   sr_opaque_handle_t created = nullptr, first = nullptr, second = nullptr, other = nullptr;
-  ASSERT_EQ(create("/shared", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 0, &created), 0);
+  EXPECT_EQ(create("/m8", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 8), SR_E_INVALID_MODE);
+  EXPECT_EQ(create("/m-1", {column("k", QV_INT32, SR_PRIMARY_KEY)}, -1), SR_E_INVALID_MODE);
+  ASSERT_EQ(create("/m5", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 5, &other), 0);
+  EXPECT_EQ(object(other)->mode, Sr_Mode_Writable);
+  EXPECT_EQ(object(other)->implicitly_controlled, 0u);
+  ASSERT_EQ(create("/shared", {column("k", QV_INT32, SR_PRIMARY_KEY)}, 1, &created), 0);
+  EXPECT_EQ(object(created)->mode, Sr_Mode_Writable);
+  EXPECT_EQ(object(created)->implicitly_controlled, 1u);
   EXPECT_EQ(sr_open_table_1(tree_, "/missing", 2, &other), SR_E_NO_TABLE);
   for (int32_t refused : {0, 4, 5, 8, -1}) {
     EXPECT_EQ(sr_open_table_1(tree_, "/shared", refused, &other), SR_E_INVALID_MODE) << refused;
@@ -242,6 +240,77 @@ TEST_F(Tables, ManyThreadsCreateOpenAndCloseTablesOfOneTree) {
   EXPECT_EQ(failures, 0);
   EXPECT_EQ(static_cast<sr_i_tree_t *>(tree_)->tables.size(),
             static_cast<size_t>(Threads * Rounds + Rounds));
+}
+
+// Many reader threads and one writer on one table: readers never see a row
+// half-changed (a row's two columns always agree) and never fail with
+// anything but "no such row", while the writer adds, updates, deletes and
+// commits through an implicitly controlled handle.
+using RowThreads = RowTables;
+
+TEST_F(RowThreads, ReadersSeeWholeRowsWhileAWriterCommits) {
+  // The note of each row always spells its count: a torn row breaks that.
+  sr_opaque_handle_t table = create_named_counts("/threads/t", Implicit, SR_PRIMARY_KEY_NOCHECK);
+  constexpr int Rows = 20;
+  for (int row = 0; row < Rows; ++row) {
+    const std::string text = std::to_string(row);
+    ASSERT_EQ(add_fields(table, {{"name", string_value(text.c_str())},
+                                 {"count", int32_value(row)},
+                                 {"note", string_value(text.c_str())}}),
+              0);
+  }
+
+  std::atomic<bool> writing{true};
+  std::atomic<int> torn{0}, unexpected{0}, reads{0};
+  auto reader = [&](uint32_t uncommitted) {
+    while (writing.load()) {
+      for (int32_t packed = 0; packed < Rows; ++packed) {
+        qv_value_t count{}, note{};
+        const char *names[] = {"count", "note"};
+        qv_value_t *results[] = {&count, &note};
+        const int32_t rc = sr_get_fields_by_index_and_visibility_1(table, packed, names, results, 2,
+                                                                   uncommitted, nullptr);
+        if (rc == 0) {
+          if (std::to_string(count.val_int32) != note.ptr_char) {
+            ++torn;
+          }
+          std::free(note.ptr_char);
+          ++reads;
+        } else if (rc != SR_E_NO_ROW_FOR_INDEX && rc != SR_E_ROW_DELETED) {
+          ++unexpected;
+        }
+      }
+    }
+  };
+  std::vector<std::thread> readers;
+  for (int at = 0; at < 4; ++at) {
+    readers.emplace_back(reader, static_cast<uint32_t>(at % 2));
+  }
+
+  while (reads.load() == 0) {
+    std::this_thread::yield();  // the readers are under way before the writer starts
+  }
+  for (int round = 0; round < 300; ++round) {
+    const int32_t value = 1000 + round;
+    const std::string text = std::to_string(value);
+    const field_list row{{"count", int32_value(value)}, {"note", string_value(text.c_str())}};
+    ASSERT_EQ(
+        sr_set_fields_by_index_1(table, round % Rows, row.names.data(), row.pointers.data(), 2), 0);
+    if (round % 10 == 0) {
+      ASSERT_EQ(sr_delete_row_by_index_1(table, 0), 0);
+      ASSERT_EQ(add_fields(table, {{"name", string_value("again")},
+                                   {"count", int32_value(value)},
+                                   {"note", string_value(text.c_str())}}),
+                0);
+    }
+  }
+  writing = false;
+  for (std::thread &thread : readers) {
+    thread.join();
+  }
+  EXPECT_EQ(torn.load(), 0);
+  EXPECT_EQ(unexpected.load(), 0);
+  EXPECT_GT(reads.load(), 0);
 }
 
 }  // namespace

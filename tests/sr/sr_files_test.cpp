@@ -12,9 +12,7 @@
 #include <cerrno>
 #include <climits>
 #include <filesystem>
-#include <fstream>
 #include <functional>
-#include <iterator>
 #include <regex>
 #include <string>
 #include <utility>
@@ -89,11 +87,7 @@ class Files : public ::testing::Test {
   void SetUp() override {
     Script = script_t{};
     Sr_File_System.usleep = counting_usleep;
-    directory_ = std::filesystem::temp_directory_path() /
-                 ("sr_files_" + std::to_string(getpid()) + "_" +
-                  ::testing::UnitTest::GetInstance()->current_test_info()->name());
-    std::filesystem::remove_all(directory_);
-    std::filesystem::create_directory(directory_);
+    ASSERT_NE((directory_ = sr_test::new_directory("qv_files")), "");
     // A failed flush leaves its diagnostic file in the working directory.
     previous_directory_ = std::filesystem::current_path();
     std::filesystem::current_path(directory_);
@@ -107,10 +101,6 @@ class Files : public ::testing::Test {
     std::filesystem::remove_all(directory_);
   }
   std::string path(const char *p_name = "table") const { return (directory_ / p_name).string(); }
-  static std::string contents(const std::string &file) {
-    std::ifstream stream(file);
-    return {std::istreambuf_iterator<char>(stream), {}};
-  }
 
   std::filesystem::path directory_;
   std::filesystem::path previous_directory_;
@@ -193,12 +183,12 @@ TEST_F(Files, InterruptsAreRetried100TimesAndEveryFailureIsRaisedWithItsCode) {
   }
 }
 
-TEST_F(Files, ShortWritesAndReadsMoveEveryByte) {
+TEST_F(Files, ShortTransfersMoveEveryByte) {
   Sr_File_System.write = scripted_write;
   Sr_File_System.read = scripted_read;
   Script.most_bytes = 3;
   ASSERT_EQ(sr_i_write(fd_, path().c_str(), "0123456789", 10), 0);
-  EXPECT_EQ(contents(path()), "0123456789");
+  EXPECT_EQ(sr_test::file_bytes(path()), "0123456789");
   EXPECT_EQ(Script.attempts, 4);
 
   ASSERT_EQ(::lseek(fd_, 0, SEEK_SET), 0);
@@ -208,16 +198,16 @@ TEST_F(Files, ShortWritesAndReadsMoveEveryByte) {
   EXPECT_EQ(std::string(buffer, bytes_read), "01234567");
   ASSERT_EQ(sr_i_read(fd_, buffer, 8, &bytes_read), 0);
   EXPECT_EQ(std::string(buffer, bytes_read), "89");  // fewer only at the end of the file
-}
 
-TEST_F(Files, PartialWritevResumesInsideTheVectorAndCountsEveryByte) {
+  // A partial writev resumes inside the vector and counts every byte.
   Sr_File_System.writev = scripted_writev;
-  Script.most_bytes = 3;
+  ASSERT_EQ(::ftruncate(fd_, 0), 0);
+  ASSERT_EQ(::lseek(fd_, 0, SEEK_SET), 0);
   char abc[] = "abc", defg[] = "defg", hij[] = "hij";
   iovec vector[] = {{abc, 3}, {defg, 4}, {nullptr, 0}, {hij, 3}};
   uint32_t counter = 5;
   ASSERT_EQ(sr_i_writev(fd_, path().c_str(), vector, 4, 10, &counter), 0);
-  EXPECT_EQ(contents(path()), "abcdefghij");
+  EXPECT_EQ(sr_test::file_bytes(path()), "abcdefghij");
   EXPECT_EQ(counter, 15u);
   // "abc" ends the first entry exactly: the next call still starts with it.
   const std::vector<std::pair<const iovec *, int>> expected = {
@@ -231,7 +221,7 @@ TEST_F(Files, PartialWritevResumesInsideTheVectorAndCountsEveryByte) {
   counter = 0;
   EXPECT_EQ(sr_i_writev(fd_, path().c_str(), rest, 2, 7, &counter), SR_E_FILESYSTEM_FULL);
   EXPECT_EQ(counter, 4u);
-  EXPECT_EQ(contents(path()), "abcdefghijabcd");
+  EXPECT_EQ(sr_test::file_bytes(path()), "abcdefghijabcd");
 }
 
 TEST_F(Files, EveryFailedFlushRewritesTheDiagnosticFile) {
@@ -243,13 +233,13 @@ TEST_F(Files, EveryFailedFlushRewritesTheDiagnosticFile) {
 
   Script.interruptions = 1;  // recorded although the retry succeeds
   EXPECT_EQ(sr_i_flush_file(fd_, path().c_str()), 0);
-  std::string text = contents(diagnostic);
+  std::string text = sr_test::file_bytes(diagnostic);
   ASSERT_TRUE(std::regex_match(text, match, line_format)) << text;
   EXPECT_EQ(match[1], "4");
 
   Script = script_t{.good_attempts = 0, .failure = EIO};
   EXPECT_EQ(sr_i_flush_file(fd_, path().c_str()), SR_E_SYSTEM_CALL);
-  text = contents(diagnostic);
+  text = sr_test::file_bytes(diagnostic);
   ASSERT_TRUE(std::regex_match(text, match, line_format)) << text;  // one line: truncated
   EXPECT_EQ(match[1], "5");
 }
@@ -290,33 +280,27 @@ TEST_F(Files, TheLockBelongsToTheDescriptorThatTookIt) {
 // The door calls of the namespace, in order, with the directory flushes
 // they are followed by.
 std::vector<std::string> Namespace_Calls;
-int recording_open(const char *p_path, int flags, mode_t mode) {
-  const int fd = Sr_Default_File_System.open(p_path, flags, mode);
-  if ((flags & O_DIRECTORY) != 0) {
-    Namespace_Calls.push_back("open directory " +
-                              std::filesystem::path(p_path).filename().string());
-  }
-  return fd;
-}
-int recording_fsync(int fd) {
-  Namespace_Calls.push_back("fsync");
-  return Sr_Default_File_System.fsync(fd);
-}
-int recording_rename(const char *p_from, const char *p_to) {
-  Namespace_Calls.push_back("rename");
-  return Sr_Default_File_System.rename(p_from, p_to);
-}
-int recording_mkdir(const char *p_path, mode_t mode) {
-  Namespace_Calls.push_back("mkdir");
-  return Sr_Default_File_System.mkdir(p_path, mode);
-}
 
 TEST_F(Files, RenamesAndNewDirectoriesAreFlushedIntoTheirDirectory) {
   Namespace_Calls.clear();
-  Sr_File_System.open = recording_open;
-  Sr_File_System.fsync = recording_fsync;
-  Sr_File_System.rename = recording_rename;
-  Sr_File_System.mkdir = recording_mkdir;
+  Sr_File_System.open = [](const char *p_path, int flags, mode_t mode) {
+    if ((flags & O_DIRECTORY) != 0) {
+      Namespace_Calls.push_back("open " + std::filesystem::path(p_path).filename().string());
+    }
+    return Sr_Default_File_System.open(p_path, flags, mode);
+  };
+  Sr_File_System.fsync = [](int fd) {
+    Namespace_Calls.push_back("fsync");
+    return Sr_Default_File_System.fsync(fd);
+  };
+  Sr_File_System.rename = [](const char *p_from, const char *p_to) {
+    Namespace_Calls.push_back("rename");
+    return Sr_Default_File_System.rename(p_from, p_to);
+  };
+  Sr_File_System.mkdir = [](const char *p_path, mode_t mode) {
+    Namespace_Calls.push_back("mkdir");
+    return Sr_Default_File_System.mkdir(p_path, mode);
+  };
   const std::string directory_name = directory_.filename().string();
 
   bool renamed = false;
@@ -324,13 +308,13 @@ TEST_F(Files, RenamesAndNewDirectoriesAreFlushedIntoTheirDirectory) {
   EXPECT_TRUE(renamed);
   EXPECT_TRUE(std::filesystem::exists(path("moved")));
   EXPECT_EQ(Namespace_Calls,
-            (std::vector<std::string>{"rename", "open directory " + directory_name, "fsync"}));
+            (std::vector<std::string>{"rename", "open " + directory_name, "fsync"}));
 
   Namespace_Calls.clear();
   ASSERT_EQ(sr_i_make_directory(path("sub").c_str()), 0);
   ASSERT_EQ(sr_i_make_directory(path("sub").c_str()), 0);  // there already: nothing to flush
-  EXPECT_EQ(Namespace_Calls, (std::vector<std::string>{"mkdir", "open directory " + directory_name,
-                                                       "fsync", "mkdir"}));
+  EXPECT_EQ(Namespace_Calls,
+            (std::vector<std::string>{"mkdir", "open " + directory_name, "fsync", "mkdir"}));
 
   // A rename that fails leaves the name as it was and says so.
   renamed = true;

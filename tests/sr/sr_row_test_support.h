@@ -1,6 +1,7 @@
 // sr_row_test_support.h - what the row and transaction tests share: a tree
 // with helpers to create tables and to add, read and count rows through the
-// exported calls.
+// exported calls, and the temporary directories and files of the tests of
+// persistent tables.
 
 #ifndef SR_ROW_TEST_SUPPORT_H
 #define SR_ROW_TEST_SUPPORT_H
@@ -9,9 +10,14 @@
 
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
+#include <fstream>
 #include <initializer_list>
+#include <iterator>
+#include <map>
 #include <memory>
 #include <string>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
@@ -108,6 +114,29 @@ inline sr_opaque_handle_t mounted_tree(const std::string &directory) {
   return tree;
 }
 
+// A new, empty directory named `p_prefix` and a random suffix, in memory
+// (/dev/shm) where the system offers it and `in_memory` asks for it, else in
+// /tmp; "" when none can be made.
+inline std::string new_directory(const char *p_prefix, bool in_memory = true) {
+  for (const char *p_place : {in_memory ? "/dev/shm" : "/tmp", "/tmp"}) {
+    std::string pattern = std::string(p_place) + "/" + p_prefix + "_XXXXXX";
+    if (mkdtemp(pattern.data()) != nullptr) {
+      return pattern;
+    }
+  }
+  ADD_FAILURE() << "no temporary directory";
+  return "";
+}
+
+// A file's bytes, none when it cannot be read; and a file made of `bytes`.
+inline std::string file_bytes(const std::string &path) {
+  std::ifstream in(path, std::ios::binary);
+  return {std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>()};
+}
+inline void write_file(const std::string &path, const std::string &bytes) {
+  std::ofstream(path, std::ios::binary | std::ios::trunc) << bytes;
+}
+
 inline int32_t add_fields(sr_opaque_handle_t table, const field_list &row) {
   return sr_add_row_1(table, row.names.data(), row.pointers.data(), row.count());
 }
@@ -122,6 +151,35 @@ inline int32_t add_numbered(sr_opaque_handle_t table, int32_t id, int32_t count)
   return add_fields(table, {{"id", int32_value(id)}, {"count", int32_value(count)}});
 }
 
+// The rows of one view (`uncommitted` 1: the applied one), key to "count",
+// read by packed index; rows without a record in that view are left out.
+// Key is std::string for a string key column, int32_t for an int32 one.
+template <class Key>
+std::map<Key, int32_t> rows_in(sr_opaque_handle_t table, const char *p_key, uint32_t uncommitted) {
+  std::map<Key, int32_t> rows;
+  for (int32_t at = 0;; ++at) {
+    field_list row{{p_key, {}}, {"count", {}}};
+    const int32_t rc = sr_get_fields_by_index_and_visibility_1(
+        table, at, row.names.data(), row.pointers.data(), 2, uncommitted, nullptr);
+    if (rc == SR_E_NO_ROW_FOR_INDEX) {
+      return rows;
+    }
+    if (rc == SR_E_ROW_DELETED) {
+      continue;
+    }
+    if (rc != 0) {
+      ADD_FAILURE() << "reading packed row " << at << " gave " << rc;
+      return rows;
+    }
+    if constexpr (std::is_same_v<Key, std::string>) {
+      rows[row.values[0].ptr_char] = row.values[1].val_int32;
+      std::free(row.values[0].ptr_char);
+    } else {
+      rows[row.values[0].val_int32] = row.values[1].val_int32;
+    }
+  }
+}
+
 inline sr_i_table_t *object(sr_opaque_handle_t handle) {
   return static_cast<sr_i_table_t *>(handle);
 }
@@ -133,7 +191,18 @@ inline constexpr int32_t Explicit = 4;
 class RowTables : public ::testing::Test {
  protected:
   void SetUp() override { ASSERT_EQ(sr_open_tree_1(&tree_, 0, 0), 0); }
-  void TearDown() override { EXPECT_EQ(sr_close_tree_1(tree_), 0); }
+  void TearDown() override {
+    EXPECT_EQ(sr_close_tree_1(tree_), 0);
+    if (!directory_.empty()) {
+      std::filesystem::remove_all(directory_);
+    }
+  }
+
+  // "/disk" mounted on a new directory (directory_), removed at the end.
+  void mount_disk() {
+    directory_ = new_directory("qv_tables");
+    ASSERT_EQ(sr_mount_local_tree_1(tree_, "/disk", directory_.c_str(), 0), 0);
+  }
 
   // A table of `columns`; with `p_hash`, one whose int32 key has a hash
   // table of `buckets` buckets.
@@ -230,6 +299,7 @@ class RowTables : public ::testing::Test {
   }
 
   sr_opaque_handle_t tree_ = nullptr;
+  std::string directory_;
 };
 
 }  // namespace sr_test

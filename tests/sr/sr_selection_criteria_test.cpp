@@ -11,12 +11,13 @@
 #include <cstring>
 #include <memory>
 #include <string>
+#include <tuple>
 #include <vector>
 
-#include "pmsg_test_values.h"
-#include "rows/sr_i_rows.h"
-#include "queries/sr_i_selection_criteria.h"
 #include "frame/sr_i_tree.h"
+#include "pmsg_test_values.h"
+#include "queries/sr_i_selection_criteria.h"
+#include "rows/sr_i_rows.h"
 #include "sr_row_test_support.h"
 
 namespace {
@@ -179,12 +180,7 @@ class Criteria : public RowTables {
   }
 
   // The callback's answer: its code, and the id and type it filled in.
-  struct answer {
-    int32_t rc;
-    uint32_t id;
-    qv_data_type_t type;
-    bool operator==(const answer &) const = default;
-  };
+  using answer = std::tuple<int32_t, uint32_t, qv_data_type_t>;
   answer resolve(const char *p_name, uint32_t parent_id = CU_EXPR_NO_PARENT) {
     cu_validate_data_t data{QV_UNKNOWN, 0xDEAD};
     const int32_t rc = sr_i_validate_column_callback(

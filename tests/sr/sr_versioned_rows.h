@@ -14,10 +14,13 @@
 #include <map>
 #include <random>
 #include <set>
+#include <sstream>
 #include <string>
 
 #include "qv_sr.h"
+#include "rows/sr_i_transaction.h"
 #include "sr_row_test_support.h"
+#include "tables/sr_i_table.h"
 
 namespace sr_versioned {
 
@@ -31,13 +34,7 @@ inline constexpr int32_t Open_Explicit = 6;
 inline constexpr uint32_t Hash_Buckets = 64;
 
 inline uint32_t hash_id(const void *p_key) {
-  int32_t id;
-  std::memcpy(&id, p_key, sizeof id);
-  return static_cast<uint32_t>(id) % Hash_Buckets;
-}
-
-inline int32_t compare_ids(const void *p_stored_key, const void *p_key) {
-  return std::memcmp(p_stored_key, p_key, sizeof(int32_t)) == 0 ? 0 : 1;
+  return static_cast<uint32_t>(sr_test::int32_key_at(p_key)) % Hash_Buckets;
 }
 
 using sr_test::int32_value;
@@ -50,13 +47,13 @@ inline int32_t create_table(sr_opaque_handle_t tree, const char *p_path, int32_t
                             sr_test::column("Version", QV_INT32),
                             sr_test::column("Payload", QV_CHAR_PTR)};
   return sr_create_hashed_key_table_1(tree, p_path, columns, 3, mode, Hash_Buckets, hash_id,
-                                      compare_ids, p_table);
+                                      sr_test::compare_int32_keys, p_table);
 }
 
 inline int32_t open_table(sr_opaque_handle_t tree, const char *p_path, int32_t mode,
                           sr_opaque_handle_t *p_table) {
-  return sr_open_hashed_key_table_1(tree, p_path, mode, Hash_Buckets, hash_id, compare_ids,
-                                    p_table);
+  return sr_open_hashed_key_table_1(tree, p_path, mode, Hash_Buckets, hash_id,
+                                    sr_test::compare_int32_keys, p_table);
 }
 
 // 40 to 40 + `spread` - 1 bytes, different for every version of every row.
@@ -95,20 +92,29 @@ struct table_state {
   bool operator==(const table_state &) const = default;
 };
 
+// A state as text, "no table" or "counter 3: 1v2 5v1" (Id v Version), and
+// the state such a text describes.
 inline std::string describe(const table_state &state) {
   if (!state.exists) {
     return "no table";
   }
-  std::string text = "counter " + std::to_string(state.counter) + ", " +
-                     std::to_string(state.rows.size()) + " rows:";
-  int shown = 0;
+  std::string text = "counter " + std::to_string(state.counter) + ":";
   for (const auto &[id, version] : state.rows) {
-    if (++shown > 40) {
-      return text + " ...";
-    }
     text += " " + std::to_string(id) + "v" + std::to_string(version);
   }
   return text;
+}
+
+inline table_state parse_state(const std::string &text) {
+  table_state state;
+  std::istringstream in(text);
+  std::string word;
+  char separator;
+  state.exists = in >> word >> state.counter >> separator && word == "counter";
+  for (int32_t id, version; in >> id >> separator >> version;) {
+    state.rows[id] = version;
+  }
+  return state;
 }
 
 // The committed rows of an open table into `state`: an empty string, or
@@ -170,7 +176,10 @@ inline std::string read_table(const std::string &directory, const char *p_regist
 // Each call returns an empty string, or the call that failed.
 class random_changes {
  public:
-  using listener = std::function<void(const table_state &)>;
+  // Hears of a commit about to begin: its kind ("implicit"; "apply", which
+  // appends, or rewrites a file of mostly dead records; "rewrite", forced)
+  // and the state it commits.
+  using listener = std::function<void(const char *p_kind, const table_state &)>;
 
   random_changes(std::mt19937 &rng, uint32_t spread, size_t fewest, size_t most)
       : rng_(rng), spread_(spread), fewest_(fewest), most_(most) {}
@@ -178,9 +187,8 @@ class random_changes {
   int32_t next_id = 1;
 
   // One change through an implicitly controlled handle, which commits it:
-  // `state` becomes the new committed state. `announce` hears of that state
-  // before the call. A row is deleted by its packed index (`by_index`) or
-  // by a selection of its Id.
+  // `state` becomes the new committed state. A row is deleted by its packed
+  // index (`by_index`) or by a selection of its Id.
   std::string implicit_change(sr_opaque_handle_t table, table_state &state, bool by_index,
                               const listener &announce = {}) {
     table_state next = state;
@@ -192,19 +200,23 @@ class random_changes {
     return "";
   }
 
-  // `changes` changes of an explicitly controlled transaction on top of
-  // `committed`, recorded in `next`; now and then a row deleted earlier in
-  // the transaction comes back.
-  std::string transaction(sr_opaque_handle_t table, const table_state &committed, table_state &next,
-                          uint32_t changes) {
+  // 1 to `most_changes` changes through an explicitly controlled handle (now
+  // and then a row deleted earlier in the transaction comes back), applied
+  // (appended or rewritten), then aborted or committed, half of the time
+  // with a change counter of its own. A commit makes `state` the new
+  // committed state. The rewrite is forced through the internal apply, whose
+  // callers take the table's write lock: these writers run no other thread.
+  std::string explicit_transaction(sr_opaque_handle_t table, table_state &state,
+                                   uint32_t most_changes, const listener &announce = {}) {
+    table_state next = state;
     std::set<int32_t> deleted;
-    for (; changes > 0; --changes) {
+    for (uint32_t changes = 1 + rng_() % most_changes; changes > 0; --changes) {
       int32_t rc = 0;
       if (!deleted.empty() && rng_() % 4 == 0) {
         const int32_t id = *deleted.begin();
         deleted.erase(deleted.begin());
-        const auto old = committed.rows.find(id);
-        next.rows[id] = old == committed.rows.end() ? 1 : old->second + 1;
+        const auto old = state.rows.find(id);
+        next.rows[id] = old == state.rows.end() ? 1 : old->second + 1;
         rc = add_row(table, id, next.rows[id], spread_);
       } else {
         rc = change(table, next, false, {}, &deleted);
@@ -212,6 +224,27 @@ class random_changes {
       if (rc != 0) {
         return "a change in a transaction gave " + std::to_string(rc);
       }
+    }
+    const uint64_t counter = rng_() % 2 ? 0 : state.counter + 1 + rng_() % 3;
+    next.counter = counter == 0 ? state.counter + 1 : counter;
+    // 0 and 1 applied and aborted, 2 to 7 committed; 1 to 3 rewrite.
+    const uint32_t ending = rng_() % 8;
+    const bool rewrite = ending >= 1 && ending <= 3;
+    const char *p_kind = rewrite ? "rewrite" : "apply";
+    if (ending >= 2 && announce) {
+      announce(p_kind, next);
+    }
+    int32_t rc = rewrite ? sr_i_apply(static_cast<sr_i_table_t *>(table), 1, counter)
+                         : sr_apply_1(table, counter);
+    if (rc == 0) {
+      rc = ending < 2 ? sr_abort_1(table) : sr_commit_1(table);
+    }
+    if (rc != 0) {
+      return std::string(p_kind) + (ending < 2 ? " and abort" : " and commit") + " gave " +
+             std::to_string(rc);
+    }
+    if (ending >= 2) {
+      state = next;
     }
     return "";
   }
@@ -244,7 +277,7 @@ class random_changes {
       ++next.rows[id.val_int32];
     }
     if (announce) {
-      announce(next);
+      announce("implicit", next);
     }
     switch (kind) {
       case Add:

@@ -27,5 +27,11 @@ write_basic_package_version_file(${PROJECT_BINARY_DIR}/qvConfigVersion.cmake
 install(FILES ${PROJECT_BINARY_DIR}/qvConfig.cmake ${PROJECT_BINARY_DIR}/qvConfigVersion.cmake
   DESTINATION ${CMAKE_INSTALL_LIBDIR}/cmake/qv)
 
+# The pkg-config file names its prefix relative to its own directory
+# (${pcfiledir}, e.g. "${pcfiledir}/../.."), so the prefix given at install
+# time, or a later move of the whole tree, needs no edit.
+file(RELATIVE_PATH qv_pkgconfig_to_prefix "/prefix/${CMAKE_INSTALL_LIBDIR}/pkgconfig" "/prefix")
+string(REGEX REPLACE "/$" "" qv_pkgconfig_to_prefix "${qv_pkgconfig_to_prefix}")
+set(QV_PKG_CONFIG_PREFIX "\${pcfiledir}/${qv_pkgconfig_to_prefix}")
 configure_file(${PROJECT_SOURCE_DIR}/cmake/qv_sr.pc.in ${PROJECT_BINARY_DIR}/qv_sr.pc @ONLY)
 install(FILES ${PROJECT_BINARY_DIR}/qv_sr.pc DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig)

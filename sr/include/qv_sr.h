@@ -226,6 +226,25 @@ QV_SR_EXPORT int32_t sr_open_tree_1(sr_opaque_handle_t *tree_handle, uint32_t nu
  */
 QV_SR_EXPORT int32_t sr_close_tree_1(sr_opaque_handle_t tree_handle);
 
+/* ---- Registry paths ------------------------------------------------------
+ *
+ * A table (and a mount point) is named by a registry path such as
+ * "/example/services":
+ *  - 1 to 255 bytes, each a letter or a digit (as isalnum() judges it in the
+ *    current C locale: ASCII only in the C locale and in UTF-8 locales), "_"
+ *    or "/"; no "//". Anything else (a blank, ".", "-", ",", a byte of a
+ *    UTF-8 character) makes the call return SR_E_INVALID_PATH.
+ *  - The leading "/" is optional and significant: "/a" and "a" are two
+ *    different tables, and a mount point "/a" covers "/a/t" but not "a/t".
+ *    A trailing "/" is accepted and is part of the name ("/a/" is not "/a");
+ *    a lone "/" is a valid path.
+ *  - Paths are compared byte for byte (case matters); nothing is
+ *    normalised.
+ *  - A mount point covers the paths that continue it by whole components:
+ *    "/a" covers "/a/t" and "/a/b/t", not "/ab/t" nor "/a" itself. Give a
+ *    mount point without a trailing "/": with one it covers no path.
+ */
+
 /* ---- Tables ------------------------------------------------------------ */
 
 /*
@@ -239,6 +258,18 @@ QV_SR_EXPORT int32_t sr_close_tree_1(sr_opaque_handle_t tree_handle);
  * without it every change is applied and committed before its call returns.
  * The table is always open for writing. A table whose key is a resource
  * handle gets a key hash table.
+ *
+ * Keys without a hash table: a table made by this call whose key is a
+ * number or a string (it has no key hash table) checks a new key under
+ * SR_PRIMARY_KEY by comparing it with the rows in fixed-index order, and a
+ * new row takes the lowest free place. Once a row before the last live row
+ * has been deleted and the deletion committed, the new row lands in that
+ * place, the scan meets it, and every sr_add_row_1 is refused with
+ * SR_E_DUPLICATE_KEY, whatever the key, for as long as a live row follows
+ * the freed place. A table whose rows are ever deleted should have a key
+ * hash table (sr_create_hashed_key_table_1, which also makes lookups by key
+ * fast), or an SR_PRIMARY_KEY_NOCHECK key, which checks nothing: the caller
+ * then finds rows sharing a key with sr_get_duplicate_rows_1.
  * Returns 0; SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_INVALID_MODE;
  * SR_E_INVALID_PATH; SR_E_NO_COLUMNS; SR_E_INVALID_COLUMN (a name, type,
  * qualifier, missing structured-data definition or key type); SR_E_KEY_EXPECTED
@@ -419,7 +450,9 @@ QV_SR_EXPORT int32_t sr_set_application_metadata_1(sr_opaque_handle_t table_hand
  * resource handle as the invalid handle); the others take their defaults.
  * Returns 0; SR_E_APPLIED_UNCOMMITTED; SR_E_KEY_EXPECTED when the key column
  * is not named or its value pointer is null; SR_E_NO_COLUMNS when a name is
- * unknown or given twice; SR_E_DUPLICATE_KEY under SR_PRIMARY_KEY;
+ * unknown or given twice; SR_E_DUPLICATE_KEY under SR_PRIMARY_KEY (also for
+ * a new key on a table without a key hash table after a deletion: see
+ * sr_create_table_1);
  * SR_E_LIBRARY_CALL when a value cannot be encoded. The table is unchanged
  * after a failure.
  */

@@ -1,6 +1,7 @@
 # Installation: the four shared libraries, their public headers, the
-# message catalog, a CMake package (find_package(qv) gives qv::qv_sr ...)
-# and a pkg-config file (pkg-config --cflags --libs qv_sr).
+# message catalog, the trace printer (qv-print-trace), a CMake package
+# (find_package(qv) gives qv::qv_sr ...) and a pkg-config file
+# (pkg-config --cflags --libs qv_sr).
 include(CMakePackageConfigHelpers)
 
 set(QV_PUBLIC_HEADERS
@@ -17,6 +18,8 @@ install(TARGETS qv_cu qv_tr qv_pmsg qv_sr
   INCLUDES DESTINATION ${CMAKE_INSTALL_INCLUDEDIR})
 install(FILES ${QV_PUBLIC_HEADERS} DESTINATION ${CMAKE_INSTALL_INCLUDEDIR})
 install(FILES ${PROJECT_BINARY_DIR}/nls/qv_sr.cat DESTINATION ${CMAKE_INSTALL_DATADIR}/qv/nls)
+install(PROGRAMS ${PROJECT_SOURCE_DIR}/tools/print-trace.sh DESTINATION ${CMAKE_INSTALL_BINDIR}
+  RENAME qv-print-trace)
 
 install(EXPORT qvTargets NAMESPACE qv:: DESTINATION ${CMAKE_INSTALL_LIBDIR}/cmake/qv)
 configure_package_config_file(${PROJECT_SOURCE_DIR}/cmake/qvConfig.cmake.in

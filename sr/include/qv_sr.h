@@ -22,7 +22,9 @@
  *     at once, without a message and without taking a lock (a thread of the
  *     parent may have held one at the fork); reading calls still work.
  *  6. Tracing is off unless QV_TRACE_LEVELS enables the component "_SRA"
- *     (categories "API", "Errors", "Wherever"; see qv_tr.h).
+ *     (categories "API", "Errors", "Wherever"; see qv_tr.h). The record
+ *     identifiers are listed in docs/tracing.md; the program qv-print-trace
+ *     (tools/print-trace.sh) prints a trace file with their names.
  */
 #ifndef QV_SR_H
 #define QV_SR_H

@@ -21,6 +21,13 @@ endif()
 
 find_package(Threads REQUIRED)
 
+# Installed files find each other wherever the prefix is moved: an installed
+# library looks for the others beside itself, an installed program in the
+# library directory relative to its own. The build tree keeps its own
+# absolute run paths.
+file(RELATIVE_PATH qv_bin_to_lib "/prefix/${CMAKE_INSTALL_BINDIR}" "/prefix/${CMAKE_INSTALL_LIBDIR}")
+set(CMAKE_INSTALL_RPATH "\$ORIGIN/${qv_bin_to_lib}")
+
 # qv_add_library(<name> VERSION_SCRIPT <file> SOURCES <files...>
 #                [PUBLIC_LIBS <targets...>] [PRIVATE_LIBS <targets...>])
 # Defines <name> (the shared library lib<name>.so exporting only what the
@@ -47,6 +54,7 @@ function(qv_add_library name)
   set_target_properties(${name} PROPERTIES
     VERSION ${PROJECT_VERSION}
     SOVERSION ${PROJECT_VERSION_MAJOR}
+    INSTALL_RPATH "\$ORIGIN"
     LINK_DEPENDS ${ARG_VERSION_SCRIPT})
   target_link_options(${name} PRIVATE "LINKER:--version-script=${ARG_VERSION_SCRIPT}")
   if(QV_SANITIZE STREQUAL "")

@@ -171,11 +171,11 @@ static sr_opaque_handle_t create_services(sr_opaque_handle_t tree) {
       column("hosts", QV_CHAR_PTR_ARRAY, SR_STANDARD)};
   columns[2].default_value.val_uint32 = 1;
   columns[3].default_value.val_float64 = 1.0;
-  const int32_t explicit_control = 4;
   sr_opaque_handle_t table = NULL;
-  check(sr_create_hashed_key_table_1(tree, "/example/services", columns, 5, explicit_control,
-                                     Name_Buckets, hash_name, compare_names, &table),
-        "sr_create_hashed_key_table_1");
+  check(
+      sr_create_hashed_key_table_1(tree, "/example/services", columns, 5, SR_MODE_EXPLICIT_CONTROL,
+                                   Name_Buckets, hash_name, compare_names, &table),
+      "sr_create_hashed_key_table_1");
   const char *const web_hosts[] = {"alpha", "beta", NULL};
   const char *const db_hosts[] = {"gamma", NULL};
   const char *const cache_hosts[] = {"alpha", "delta", "epsilon", NULL};
@@ -194,8 +194,7 @@ int main(int argc, char **argv) {
   sr_opaque_handle_t tree = NULL, table = NULL;
   check(sr_open_tree_1(&tree, 0, 0), "sr_open_tree_1");
   check(sr_mount_local_tree_1(tree, "/example", p_directory, 1), "sr_mount_local_tree_1");
-  const int32_t explicit_writer = 6;
-  const int32_t rc = sr_open_hashed_key_table_1(tree, "/example/services", explicit_writer,
+  const int32_t rc = sr_open_hashed_key_table_1(tree, "/example/services", SR_MODE_WRITE_EXPLICIT,
                                                 Name_Buckets, hash_name, compare_names, &table);
   if (rc == SR_E_NO_TABLE) {
     table = create_services(tree);

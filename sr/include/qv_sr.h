@@ -22,7 +22,9 @@
  *     at once, without a message and without taking a lock (a thread of the
  *     parent may have held one at the fork); reading calls still work.
  *  6. Tracing is off unless QV_TRACE_LEVELS enables the component "_SRA"
- *     (categories "API", "Errors", "Wherever"; see qv_tr.h).
+ *     (categories "API", "Errors", "Wherever"; see qv_tr.h). The record
+ *     identifiers are listed in docs/tracing.md; the program qv-print-trace
+ *     (tools/print-trace.sh) prints a trace file with their names.
  */
 #ifndef QV_SR_H
 #define QV_SR_H
@@ -177,6 +179,29 @@ typedef int32_t (*sr_hash_keys_compare_function_t)(const void *p_stored_key, con
 /* A tree or table handle. */
 typedef void *sr_opaque_handle_t;
 
+/*
+ * Modes of sr_create_table_1 and sr_open_table_1 (and their hashed-key
+ * forms), bits OR-ed together. A table is implicitly controlled (each
+ * changing call applies and commits before it returns) or explicitly
+ * controlled (the caller calls sr_apply_1 and sr_commit_1).
+ *   create: 0 or SR_MODE_WRITE             writable, implicitly controlled;
+ *           SR_MODE_EXPLICIT_CONTROL or
+ *           SR_MODE_WRITE_EXPLICIT         writable, explicitly controlled;
+ *           the SR_MODE_READ bit changes nothing (a new table is always
+ *           writable); any value from 0 to 7 is accepted.
+ *   open:   SR_MODE_READ                   read only;
+ *           SR_MODE_WRITE                  writable, implicitly controlled;
+ *           SR_MODE_WRITE_EXPLICIT         writable, explicitly controlled;
+ *           the SR_MODE_READ bit may be added to either writable mode;
+ *           0, 4 and any value above 7 are refused (SR_E_INVALID_MODE).
+ * The numbers are part of the interface: programs that pass them keep
+ * working.
+ */
+#define SR_MODE_READ 1
+#define SR_MODE_WRITE 2
+#define SR_MODE_EXPLICIT_CONTROL 4
+#define SR_MODE_WRITE_EXPLICIT 6 /* SR_MODE_WRITE | SR_MODE_EXPLICIT_CONTROL */
+
 /* A key hash table of the library's internal interface (opaque here). */
 struct sr_hash_table_struct_t;
 
@@ -203,6 +228,25 @@ QV_SR_EXPORT int32_t sr_open_tree_1(sr_opaque_handle_t *tree_handle, uint32_t nu
  */
 QV_SR_EXPORT int32_t sr_close_tree_1(sr_opaque_handle_t tree_handle);
 
+/* ---- Registry paths ------------------------------------------------------
+ *
+ * A table (and a mount point) is named by a registry path such as
+ * "/example/services":
+ *  - 1 to 255 bytes, each a letter or a digit (as isalnum() judges it in the
+ *    current C locale: ASCII only in the C locale and in UTF-8 locales), "_"
+ *    or "/"; no "//". Anything else (a blank, ".", "-", ",", a byte of a
+ *    UTF-8 character) makes the call return SR_E_INVALID_PATH.
+ *  - The leading "/" is optional and significant: "/a" and "a" are two
+ *    different tables, and a mount point "/a" covers "/a/t" but not "a/t".
+ *    A trailing "/" is accepted and is part of the name ("/a/" is not "/a");
+ *    a lone "/" is a valid path.
+ *  - Paths are compared byte for byte (case matters); nothing is
+ *    normalised.
+ *  - A mount point covers the paths that continue it by whole components:
+ *    "/a" covers "/a/t" and "/a/b/t", not "/ab/t" nor "/a" itself. Give a
+ *    mount point without a trailing "/": with one it covers no path.
+ */
+
 /* ---- Tables ------------------------------------------------------------ */
 
 /*
@@ -211,10 +255,23 @@ QV_SR_EXPORT int32_t sr_close_tree_1(sr_opaque_handle_t tree_handle);
  * sr_close_table_1). Exactly one column is the key (base qualifier
  * SR_PRIMARY_KEY or SR_PRIMARY_KEY_NOCHECK, of a numeric type, QV_CHAR_PTR
  * or QV_RSRC_HANDLE_PTR); it becomes column 0 of the table. The caller's
- * array is not changed. `mode` 0 to 7: bit 4 makes the table explicitly
- * controlled (the caller applies and commits); otherwise every change is
- * applied and committed before its call returns. The table is always open
- * for writing. A table whose key is a resource handle gets a key hash table.
+ * array is not changed. `mode` (see SR_MODE_READ): SR_MODE_EXPLICIT_CONTROL
+ * makes the table explicitly controlled (the caller applies and commits);
+ * without it every change is applied and committed before its call returns.
+ * The table is always open for writing. A table whose key is a resource
+ * handle gets a key hash table.
+ *
+ * Keys without a hash table: a table made by this call whose key is a
+ * number or a string (it has no key hash table) checks a new key under
+ * SR_PRIMARY_KEY by comparing it with the rows in fixed-index order, and a
+ * new row takes the lowest free place. Once a row before the last live row
+ * has been deleted and the deletion committed, the new row lands in that
+ * place, the scan meets it, and every sr_add_row_1 is refused with
+ * SR_E_DUPLICATE_KEY, whatever the key, for as long as a live row follows
+ * the freed place. A table whose rows are ever deleted should have a key
+ * hash table (sr_create_hashed_key_table_1, which also makes lookups by key
+ * fast), or an SR_PRIMARY_KEY_NOCHECK key, which checks nothing: the caller
+ * then finds rows sharing a key with sr_get_duplicate_rows_1.
  * Returns 0; SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_INVALID_MODE;
  * SR_E_INVALID_PATH; SR_E_NO_COLUMNS; SR_E_INVALID_COLUMN (a name, type,
  * qualifier, missing structured-data definition or key type); SR_E_KEY_EXPECTED
@@ -241,8 +298,9 @@ QV_SR_EXPORT int32_t sr_create_hashed_key_table_1(
 
 /*
  * Opens the table `p_registry_path` of the tree. Every opening of a table
- * in a tree shares one object. `mode`: 1 read only; 2 or 3 writable and
- * implicitly controlled; 6 or 7 writable and explicitly controlled. The
+ * in a tree shares one object. `mode` (see SR_MODE_READ): SR_MODE_READ read
+ * only; SR_MODE_WRITE writable and implicitly controlled;
+ * SR_MODE_WRITE_EXPLICIT writable and explicitly controlled. The
  * first writable opening decides the control kind; a writable opening of
  * the other kind while it is open is refused. A read-only table opened for
  * writing becomes writable for every handle.
@@ -394,7 +452,9 @@ QV_SR_EXPORT int32_t sr_set_application_metadata_1(sr_opaque_handle_t table_hand
  * resource handle as the invalid handle); the others take their defaults.
  * Returns 0; SR_E_APPLIED_UNCOMMITTED; SR_E_KEY_EXPECTED when the key column
  * is not named or its value pointer is null; SR_E_NO_COLUMNS when a name is
- * unknown or given twice; SR_E_DUPLICATE_KEY under SR_PRIMARY_KEY;
+ * unknown or given twice; SR_E_DUPLICATE_KEY under SR_PRIMARY_KEY (also for
+ * a new key on a table without a key hash table after a deletion: see
+ * sr_create_table_1);
  * SR_E_LIBRARY_CALL when a value cannot be encoded. The table is unchanged
  * after a failure.
  */
@@ -515,14 +575,14 @@ QV_SR_EXPORT int32_t sr_delete_rows_1(sr_opaque_handle_t table_handle,
  * committed view); the criteria are judged on that same record.
  *
  * The new table is unnamed and memory-only, belongs to the tree, and is
- * open for writing under explicit control (mode 6). Its columns: with a
- * count of 0 every column of the source in order; otherwise the key column
- * first, then each named column in the order given (the key named again is
- * not repeated; any other column named twice is there twice). Definitions,
- * qualifiers, defaults and structured-data definitions are carried; a
- * hashed source's hash functions and bucket count are kept. Every row is
- * committed, and its change counter is the source's plus 1. Close it with
- * sr_close_table_1; closing the tree closes it too.
+ * open for writing under explicit control (SR_MODE_WRITE_EXPLICIT). Its
+ * columns: with a count of 0 every column of the source in order; otherwise
+ * the key column first, then each named column in the order given (the key
+ * named again is not repeated; any other column named twice is there
+ * twice). Definitions, qualifiers, defaults and structured-data definitions
+ * are carried; a hashed source's hash functions and bucket count are kept.
+ * Every row is committed, and its change counter is the source's plus 1.
+ * Close it with sr_close_table_1; closing the tree closes it too.
  *
  * Returns 0 (also when no row matches: the table is empty);
  * SR_E_INVALID_HANDLE; SR_E_NULL_POINTER for a null `result`;

@@ -403,9 +403,9 @@ int32_t sr_i_open_persistent_table(sr_i_tree_t *p_tree, const char *p_registry_p
   table_closer table{p_table};
   p_table->p_rows_hash_table = p_rows_hash_table;
   p_table->p_tree = p_tree;
-  const bool writable = (mode & 2) != 0;
+  const bool writable = (mode & SR_MODE_WRITE) != 0;
   p_table->mode = writable ? Sr_Mode_Writable : Sr_Mode_Read_Only;
-  p_table->implicitly_controlled = (mode & 4) ? 0 : 1;
+  p_table->implicitly_controlled = (mode & SR_MODE_EXPLICIT_CONTROL) ? 0 : 1;
   p_table->block_size = block_size;
   if ((p_table->p_name = strdup(p_file_path)) == nullptr) {
     return sr_i_raise_no_memory();

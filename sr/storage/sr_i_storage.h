@@ -63,8 +63,9 @@ int32_t sr_i_create_persistent_table(struct sr_i_tree_struct_t *p_tree, const ch
 
 /*
  * Loads the persistent table in `p_file_path` at its committed state.
- * `mode` is a normalised open mode (bit 2: writable, which locks the file,
- * waiting for another writer to close it; bit 4: explicit control).
+ * `mode` is a normalised open mode (SR_MODE_WRITE: writable, which locks
+ * the file, waiting for another writer to close it; SR_MODE_EXPLICIT_CONTROL:
+ * explicit control).
  * `p_rows_hash_table` (or null) is taken over whatever the outcome.
  * Returns 0 or a raised code: 10, 12, 14, 16, 101, 200, 206, 213, 214, 215.
  */

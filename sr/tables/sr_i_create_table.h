@@ -16,10 +16,11 @@
 
 struct sr_i_tree_struct_t;
 
-/* Create modes: bit 4 asks for explicit control (the caller applies and
- * commits); 0 to 7 are accepted. */
-inline constexpr int32_t Sr_Create_Explicit_Control = 4;
-inline constexpr int32_t Sr_Highest_Create_Mode = 7;
+/* Create modes: SR_MODE_EXPLICIT_CONTROL asks for explicit control (the
+ * caller applies and commits); 0 to 7 are accepted. */
+inline constexpr int32_t Sr_Create_Explicit_Control = SR_MODE_EXPLICIT_CONTROL;
+inline constexpr int32_t Sr_Highest_Create_Mode =
+    SR_MODE_READ | SR_MODE_WRITE | SR_MODE_EXPLICIT_CONTROL;
 
 /*
  * Makes a transient table named `p_name` (null for an unnamed table) with a

@@ -39,7 +39,7 @@ int32_t sr_x_create_table(sr_opaque_handle_t tree_handle, const char *p_registry
     return sr_i_raise(SR_E_INVALID_MODE);
   }
   // A created table is always open for writing; only explicit control stays.
-  mode = (mode & Sr_Create_Explicit_Control) ? 6 : 2;
+  mode = (mode & Sr_Create_Explicit_Control) ? SR_MODE_WRITE_EXPLICIT : SR_MODE_WRITE;
   auto *p_tree = static_cast<sr_i_tree_t *>(tree_handle);
   sr_i_write_guard tree_lock(&p_tree->lock);
   if (tree_lock.result() != 0) {

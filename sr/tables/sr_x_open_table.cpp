@@ -19,20 +19,21 @@ namespace {
 constexpr sr_i_entry_point_t Open_Table{77, false};
 constexpr sr_i_entry_point_t Open_Hashed_Key_Table{79, false};
 
-constexpr int32_t Open_For_Reading = 1;
-constexpr int32_t Open_For_Writing = 2;
-constexpr int32_t Open_Explicit_Control = 4;
+constexpr int32_t Open_For_Reading = SR_MODE_READ;
+constexpr int32_t Open_For_Writing = SR_MODE_WRITE;
+constexpr int32_t Open_Explicit_Control = SR_MODE_EXPLICIT_CONTROL;
 
-// The accepted modes in their normal form (1, 2 or 6), or 0 for a refused one.
+// The accepted modes in their normal form (SR_MODE_READ, SR_MODE_WRITE or
+// SR_MODE_WRITE_EXPLICIT), or 0 for a refused one.
 int32_t normalised_open_mode(int32_t mode) {
   switch (mode) {
-    case 1:
+    case SR_MODE_READ:
       return Open_For_Reading;
-    case 2:
-    case 3:
+    case SR_MODE_WRITE:
+    case SR_MODE_WRITE | SR_MODE_READ:
       return Open_For_Writing;
-    case 6:
-    case 7:
+    case SR_MODE_WRITE_EXPLICIT:
+    case SR_MODE_WRITE_EXPLICIT | SR_MODE_READ:
       return Open_For_Writing | Open_Explicit_Control;
     default:
       return 0;

@@ -94,6 +94,24 @@ int main(void) {
   CHECK(list_selected(table, &count, &p_rows, "Port > $ui", (uint32_t)80) == 0 && count == 1 &&
         p_rows[0] == 0);
   free(p_rows);
+
+  /* The named modes: a table created under explicit control keeps its
+   * changes pending; a writable opening must ask for the same control, and
+   * a mode naming no kind of opening is refused. The numbers stay valid. */
+  CHECK(sr_create_table_1(tree, "/c/explicit", &column, 1, SR_MODE_EXPLICIT_CONTROL, &table) == 0);
+  value.val_uint32 = 443;
+  CHECK(sr_add_row_1(table, names, values, 1) == 0);
+  CHECK(sr_get_updated_rows_1(table, &count, &p_rows) == 0 && count == 1);
+  free(p_rows);
+  CHECK(sr_open_table_1(tree, "/c/explicit", SR_MODE_WRITE, &result) == SR_E_EXCLUSIVE_MODES);
+  CHECK(sr_open_table_1(tree, "/c/explicit", SR_MODE_EXPLICIT_CONTROL, &result) ==
+        SR_E_INVALID_MODE);
+  CHECK(sr_open_table_1(tree, "/c/explicit", SR_MODE_WRITE_EXPLICIT, &result) == 0);
+  CHECK(sr_close_table_1(result) == 0);
+  CHECK(sr_open_table_1(tree, "/c/explicit", 6, &result) == 0);
+  CHECK(sr_close_table_1(result) == 0);
+  CHECK(sr_open_table_1(tree, "/c/ports", SR_MODE_READ | SR_MODE_WRITE, &result) == 0);
+  CHECK(sr_close_table_1(result) == 0);
   CHECK(sr_close_tree_1(tree) == 0);
   CHECK((cu_dtc_table_1[QV_CHAR_PTR_ARRAY] & CU_DTC_POINTER) != 0);
   CHECK(strcmp(cu_mesgtbl_qv_sr_set[0], "Reserved: DO NOT USE!") == 0);

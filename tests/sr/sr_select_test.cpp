@@ -199,6 +199,54 @@ TEST_F(Select, TheResultCarriesTheChosenColumnsWithTheirDefinitionsAndValues) {
   EXPECT_EQ(results_in_tree(), 1u);  // the other one goes with the tree
 }
 
+TEST_F(Select, EveryTypeSurvivesACopyColumnByColumn) {
+  value_arena arena;
+  const auto samples = sample_values(arena);
+  sr_sd_def_t *p_any =
+      static_cast<sr_sd_def_t *>(std::calloc(1, sizeof(sr_sd_def_t) + sizeof(sr_sd_field_def_t)));
+  p_any->number_of_fields = 1;
+  p_any->field_def[0] = {QV_INT32, const_cast<char *>("f")};
+  std::vector<std::string> names;
+  std::vector<sr_column_t> columns = {column("id", QV_INT32, SR_PRIMARY_KEY)};
+  for (size_t at = 0; at < samples.size(); ++at) {
+    names.push_back("c" + std::to_string(at));
+  }
+  for (size_t at = 0; at < samples.size(); ++at) {
+    columns.push_back(column(names[at].c_str(), as_type(samples[at].first)));
+    columns.back().sd_defn = p_any;
+  }
+  sr_opaque_handle_t table = make_table("/types", columns, Implicit);
+  std::free(p_any);
+  std::vector<const char *> row_names = {"id"};
+  std::vector<qv_value_t> row_values = {int32_value(1)};
+  for (size_t at = 0; at < samples.size(); ++at) {
+    row_names.push_back(names[at].c_str());
+    row_values.push_back(samples[at].second);
+  }
+  std::vector<qv_value_t *> row_pointers;
+  for (qv_value_t &value : row_values) {
+    row_pointers.push_back(&value);
+  }
+  ASSERT_EQ(sr_add_row_1(table, row_names.data(), row_pointers.data(),
+                         static_cast<uint32_t>(row_names.size())),
+            0);
+
+  // Backwards, so that every body moves to another place in the record.
+  std::vector<const char *> reversed(row_names.rbegin(), row_names.rend() - 1);
+  sr_opaque_handle_t result = nullptr;
+  ASSERT_EQ(
+      sr_select_1(table, reversed.data(), static_cast<uint32_t>(reversed.size()), &result, nullptr),
+      0);
+  for (size_t at = 0; at < samples.size(); ++at) {
+    qv_value_t value{};
+    ASSERT_EQ(sr_get_field_by_key_1(result, int32_value(1), names[at].c_str(), &value), 0);
+    EXPECT_TRUE(values_equal(samples[at].first, samples[at].second, value)) << names[at];
+    if (!is_fixed_type(samples[at].first)) {
+      std::free(value.ptr_char);
+    }
+  }
+}
+
 TEST_F(Select, SelectingReadsTheTablesViewAndListingTheAskedOneJudgingPendingValues) {
   sr_opaque_handle_t committed_view = pending_table("/hidden");
   setenv("SR_UNCOMMITTED_UPDATES_VISIBLE", "1", 1);

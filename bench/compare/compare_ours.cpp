@@ -5,6 +5,7 @@
 // count, so a lookup costs one bucket walk.
 
 #include <array>
+#include <cstdarg>
 #include <cstdlib>
 #include <cstring>
 #include <functional>
@@ -14,6 +15,7 @@
 #include <string_view>
 #include <vector>
 
+#include "compare_ours.h"
 #include "compare_workloads.h"
 #include "qv_sr.h"
 
@@ -149,20 +151,6 @@ struct read_row {
     std::free(note.ptr_char);
   }
 };
-
-// Loaded transient tables are kept for the whole run, one per size, since
-// Google Benchmark calls a benchmark several times while it settles on an
-// iteration count and loading a million rows each time would dominate.
-sr_opaque_handle_t loaded_transient_table(int64_t rows) {
-  static tree owner;
-  static std::map<int64_t, sr_opaque_handle_t> tables;
-  auto &table = tables[rows];
-  if (table == nullptr && owner.ok()) {
-    const std::string path = "/loaded" + std::to_string(rows);
-    table = create_loaded_table(owner.handle(), path.c_str(), rows);
-  }
-  return table;
-}
 
 void read_by_key(benchmark::State &state) {
   const auto rows = static_cast<uint32_t>(state.range(0));
@@ -382,7 +370,95 @@ void memory(benchmark::State &state) {
   }
 }
 
+// sr_get_selected_rows_v_1 with the criteria's values as arguments.
+int32_t get_selected_rows(sr_opaque_handle_t table, uint32_t *p_total, uint32_t **pp_rows,
+                          const char *p_criteria, ...) {
+  va_list values;
+  va_start(values, p_criteria);
+  const int32_t rc = sr_get_selected_rows_v_1(table, p_criteria, values, 0, p_total, pp_rows);
+  va_end(values);
+  return rc;
+}
+
+// The committed view's rows that one of the two criteria pick, as the
+// malloc'ed array of fixed indexes the call hands over (and the caller
+// frees).
+template <bool Mixed>
+void selection_scan(benchmark::State &state) {
+  const auto rows = static_cast<uint32_t>(state.range(0));
+  sr_opaque_handle_t table = loaded_transient_table(rows);
+  if (!check(state, table != nullptr, "load the table")) {
+    return;
+  }
+  const selection_criteria criteria = selection_criteria_for(rows);
+  char *const p_excluded_note = const_cast<char *>(criteria.excluded.note);
+  for (auto _ : state) {
+    uint32_t total = 0;
+    uint32_t *p_rows = nullptr;
+    const int32_t rc =
+        Mixed ? get_selected_rows(table, &total, &p_rows, Mixed_Criteria, p_excluded_note,
+                                  criteria.low, criteria.high)
+              : get_selected_rows(table, &total, &p_rows, Integer_Criteria, criteria.above);
+    if (!check(state, rc == 0, "sr_get_selected_rows_v_1")) {
+      return;
+    }
+    benchmark::DoNotOptimize(p_rows);
+    std::free(p_rows);
+    if (!check(state, total == (Mixed ? criteria.mixed_matches : criteria.integer_matches),
+               "rows selected")) {
+      return;
+    }
+  }
+  state.SetItemsProcessed(state.iterations() * rows);
+}
+
+// The rows the integer criteria pick, every column, copied into a new table
+// by sr_select_1; checking and closing that table is not timed.
+void selection_copy(benchmark::State &state) {
+  const auto rows = static_cast<uint32_t>(state.range(0));
+  sr_opaque_handle_t table = loaded_transient_table(rows);
+  if (!check(state, table != nullptr, "load the table")) {
+    return;
+  }
+  const selection_criteria criteria = selection_criteria_for(rows);
+  for (auto _ : state) {
+    sr_opaque_handle_t result = nullptr;
+    if (!check(state,
+               sr_select_1(table, nullptr, 0, &result, Integer_Criteria, criteria.above) == 0,
+               "sr_select_1")) {
+      return;
+    }
+    state.PauseTiming();
+    sr_table_metadata_t *p_metadata = nullptr;
+    const bool copied = sr_get_table_metadata_1(result, 0, &p_metadata) == 0 &&
+                        p_metadata->number_of_rows == criteria.integer_matches;
+    if (p_metadata != nullptr) {
+      sr_free_table_metadata_1(p_metadata);
+    }
+    const bool closed = sr_close_table_1(result) == 0;
+    if (!check(state, copied && closed, "rows copied")) {
+      return;
+    }
+    state.ResumeTiming();
+  }
+  state.SetItemsProcessed(state.iterations() * rows);
+}
+
 }  // namespace
+
+// Loaded transient tables are kept for the whole run, one per size, since
+// Google Benchmark calls a benchmark several times while it settles on an
+// iteration count and loading a million rows each time would dominate.
+sr_opaque_handle_t loaded_transient_table(int64_t rows) {
+  static tree owner;
+  static std::map<int64_t, sr_opaque_handle_t> tables;
+  auto &table = tables[rows];
+  if (table == nullptr && owner.ok()) {
+    const std::string path = "/loaded" + std::to_string(rows);
+    table = create_loaded_table(owner.handle(), path.c_str(), rows);
+  }
+  return table;
+}
 
 void register_ours() {
   add(W1_Read_By_Key, "ours", read_by_key);
@@ -395,6 +471,12 @@ void register_ours() {
   add(W5_Durable_Batch, "ours", durable_batch, {Durable_Table_Rows})->Unit(benchmark::kMillisecond);
   add(W6_Open_And_Scan, "ours", open_and_scan)->Unit(benchmark::kMillisecond);
   add(W7_Memory, "ours", memory)->Iterations(1);
+  add(W8_Select_Integer, "ours", selection_scan<false>, Selection_Scan_Row_Counts)
+      ->Unit(benchmark::kMillisecond);
+  add(W8_Select_Mixed, "ours", selection_scan<true>, Selection_Scan_Row_Counts)
+      ->Unit(benchmark::kMillisecond);
+  add(W9_Selection_Copy, "ours", selection_copy, Selection_Copy_Row_Counts)
+      ->Unit(benchmark::kMillisecond);
 }
 
 }  // namespace compare

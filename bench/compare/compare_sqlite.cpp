@@ -1,7 +1,9 @@
 // compare_sqlite.cpp - the SQLite side of the comparison: reads by key and by
 // rowid from an in-memory database, bulk loads, durable changes and batches on
 // disk in rollback-journal and WAL modes, a new reader scanning a table file,
-// and the memory an in-memory table holds per row.
+// the memory an in-memory table holds per row, and selections from an
+// in-memory table (the rowids criteria pick, and a temporary table of those
+// rows).
 //
 // SQLite is used the way its documentation recommends for speed: statements
 // prepared once and reset between runs, loads inside one transaction, and a
@@ -12,6 +14,7 @@
 #include <algorithm>
 #include <cstring>
 #include <filesystem>
+#include <map>
 #include <memory>
 #include <string>
 #include <vector>
@@ -37,6 +40,18 @@ constexpr const char *Select_By_Rowid =
     "SELECT key, count, total, ratio, note FROM config WHERE id = ?1";
 constexpr const char *Update_Count = "UPDATE config SET count = ?2 WHERE key = ?1";
 constexpr const char *Select_All = "SELECT * FROM config";
+// The criteria of compare_workloads.h; no index covers count or note, so
+// each is a scan of the whole table.
+constexpr const char *Select_Integer = "SELECT rowid FROM config WHERE count > ?1";
+constexpr const char *Select_Mixed =
+    "SELECT rowid FROM config WHERE note != ?1 AND count >= ?2 AND count < ?3";
+// Temporary tables are kept in memory (as our result table is) rather than
+// in the temporary file this build uses by default.
+constexpr const char *Temporary_Tables_In_Memory = "PRAGMA temp_store=MEMORY";
+constexpr const char *Copy_Integer =
+    "CREATE TEMP TABLE selected AS SELECT * FROM config WHERE count > ?1";
+constexpr const char *Count_Copied = "SELECT count(*) FROM selected";
+constexpr const char *Drop_Copy = "DROP TABLE selected";
 
 // Where a database lives and how its commits reach the disk.
 struct storage {
@@ -370,6 +385,107 @@ void memory(benchmark::State &state) {
   }
 }
 
+// The in-memory rowid table of `rows` rows the selections read, loaded on
+// first use and kept for the whole run, as our loaded tables are. Null when
+// it could not be made.
+connection *loaded_rowid_database(uint32_t rows) {
+  static std::map<uint32_t, std::unique_ptr<connection>> databases;
+  std::unique_ptr<connection> &db = databases[rows];
+  if (db == nullptr) {
+    auto made = std::make_unique<connection>(":memory:");
+    if (!create_table(*made, Memory, Rowid_Table, make_rows(0, rows)) ||
+        !made->execute(Temporary_Tables_In_Memory)) {
+      return nullptr;
+    }
+    db = std::move(made);
+  }
+  return db.get();
+}
+
+// Binds the values of one of the two criteria.
+bool bind_criteria(sqlite3_stmt *stmt, bool mixed, const selection_criteria &criteria) {
+  if (!mixed) {
+    return sqlite3_bind_int(stmt, 1, criteria.above) == SQLITE_OK;
+  }
+  return bind_text(stmt, 1, criteria.excluded.note) &&
+         sqlite3_bind_int(stmt, 2, criteria.low) == SQLITE_OK &&
+         sqlite3_bind_int(stmt, 3, criteria.high) == SQLITE_OK;
+}
+
+// Steps through every row the prepared SELECT returns, reading its rowid.
+template <bool Mixed>
+void selection_scan(benchmark::State &state) {
+  const auto rows = static_cast<uint32_t>(state.range(0));
+  connection *db = loaded_rowid_database(rows);
+  if (!check(state, db != nullptr, "load")) {
+    return;
+  }
+  statement select(*db, Mixed ? Select_Mixed : Select_Integer);
+  const selection_criteria criteria = selection_criteria_for(rows);
+  if (!check(state, select.prepared() && bind_criteria(select.handle(), Mixed, criteria),
+             "prepare select")) {
+    return;
+  }
+  for (auto _ : state) {
+    uint32_t selected = 0;
+    int result;
+    while ((result = sqlite3_step(select.handle())) == SQLITE_ROW) {
+      benchmark::DoNotOptimize(sqlite3_column_int64(select.handle(), 0));
+      ++selected;
+    }
+    sqlite3_reset(select.handle());
+    if (!check(state,
+               result == SQLITE_DONE &&
+                   selected == (Mixed ? criteria.mixed_matches : criteria.integer_matches),
+               "select")) {
+      return;
+    }
+  }
+  state.SetItemsProcessed(state.iterations() * rows);
+}
+
+// The number of rows in the copy; -1 when it cannot be counted.
+int64_t count_copied(connection &db) {
+  statement count(db, Count_Copied);
+  if (!count.prepared() || sqlite3_step(count.handle()) != SQLITE_ROW) {
+    return -1;
+  }
+  return sqlite3_column_int64(count.handle(), 0);
+}
+
+// CREATE TEMP TABLE ... AS SELECT of the rows the integer criteria pick;
+// counting and dropping the copy is not timed.
+void selection_copy(benchmark::State &state) {
+  const auto rows = static_cast<uint32_t>(state.range(0));
+  connection *db = loaded_rowid_database(rows);
+  if (!check(state, db != nullptr, "load")) {
+    return;
+  }
+  const selection_criteria criteria = selection_criteria_for(rows);
+  for (auto _ : state) {
+    // Prepared in each run: dropping the copy changes the schema, which
+    // would make SQLite prepare a kept statement again anyway.
+    state.PauseTiming();
+    auto copy = std::make_unique<statement>(*db, Copy_Integer);
+    if (!check(state, copy->prepared() && bind_criteria(copy->handle(), false, criteria),
+               "prepare copy")) {
+      return;
+    }
+    state.ResumeTiming();
+    if (!check(state, copy->run(), "copy")) {
+      return;
+    }
+    state.PauseTiming();
+    copy.reset();
+    const bool copied = count_copied(*db) == criteria.integer_matches;
+    if (!check(state, copied && db->execute(Drop_Copy), "count and drop the copy")) {
+      return;
+    }
+    state.ResumeTiming();
+  }
+  state.SetItemsProcessed(state.iterations() * rows);
+}
+
 void add_bulk_load(const storage &where, void (*function)(benchmark::State &)) {
   // A few runs of the big loads give a steady figure without taking minutes.
   for (int64_t rows : Row_Counts) {
@@ -400,6 +516,12 @@ void register_sqlite() {
   add_durable<Delete_File>({Durable_Table_Rows});
   add(W6_Open_And_Scan, Delete_File.system, &open_and_scan)->UseRealTime();
   add(W7_Memory, Memory.system, &memory)->Iterations(1)->UseRealTime();
+  add(W8_Select_Integer, Memory.system, &selection_scan<false>, Selection_Scan_Row_Counts)
+      ->Unit(benchmark::kMillisecond);
+  add(W8_Select_Mixed, Memory.system, &selection_scan<true>, Selection_Scan_Row_Counts)
+      ->Unit(benchmark::kMillisecond);
+  add(W9_Selection_Copy, Memory.system, &selection_copy, Selection_Copy_Row_Counts)
+      ->Unit(benchmark::kMillisecond);
 }
 
 }  // namespace compare

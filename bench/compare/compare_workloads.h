@@ -7,8 +7,8 @@
 // argument, so Google Benchmark names it "<workload>/<system>/<rows>". The
 // report groups by workload and rows and compares every system with the one
 // named "ours". Rates are items per second (an item is one row read, one row
-// written or one change); workload 7 reports the counter "bytes_per_row"
-// instead.
+// written, one row scanned or one change); workload 7 reports the counter
+// "bytes_per_row" instead.
 #ifndef COMPARE_WORKLOADS_H
 #define COMPARE_WORKLOADS_H
 
@@ -60,6 +60,12 @@ inline config_row make_row(uint32_t i) {
 //  w6 open and scan: a table file of `rows` rows opened by a new reader and
 //     every column of every row read.
 //  w7 memory: bytes held per row by a table of `rows` rows in memory.
+//  w8 selection scan: the rows that criteria pick, listed by position
+//     (ours: fixed indexes; SQLite: rowids), from a table held in memory; one
+//     item is one row scanned. Two criteria: an integer comparison, and a
+//     string comparison with an integer range (see selection_criteria).
+//  w9 selection copy: the rows the integer criteria pick copied into a new
+//     table in memory; one item is one row scanned, not one row copied.
 inline constexpr const char *W1_Read_By_Key = "w1_read_by_key";
 inline constexpr const char *W2_Read_By_Packed_Index = "w2_read_by_packed_index";
 inline constexpr const char *W2_Read_By_Fixed_Index = "w2_read_by_fixed_index";
@@ -69,6 +75,9 @@ inline constexpr const char *W4_Durable_Add = "w4_durable_add";
 inline constexpr const char *W5_Durable_Batch = "w5_durable_batch";
 inline constexpr const char *W6_Open_And_Scan = "w6_open_and_scan";
 inline constexpr const char *W7_Memory = "w7_memory";
+inline constexpr const char *W8_Select_Integer = "w8_selection_scan_integer";
+inline constexpr const char *W8_Select_Mixed = "w8_selection_scan_mixed";
+inline constexpr const char *W9_Selection_Copy = "w9_selection_copy";
 
 // Rows of the tables the durable workloads change, and changes per batch.
 inline constexpr uint32_t Durable_Table_Rows = 1000;
@@ -76,6 +85,44 @@ inline constexpr uint32_t Batch_Changes = 1000;
 
 // The table sizes of the scaling workloads.
 inline const std::vector<int64_t> Row_Counts = {1000, 100000, 1000000};
+
+// The table sizes of the selection scan and of the selection copy.
+inline const std::vector<int64_t> Selection_Scan_Row_Counts = {100000, 1000000};
+inline const std::vector<int64_t> Selection_Copy_Row_Counts = {1000000};
+
+// The values of the selection criteria for a table of `rows` rows, the same
+// in every system; each picks about a tenth of the rows.
+//  integer: count > above, true for the last tenth of the rows.
+//  mixed: note != excluded_note && count >= low && count < high. Every
+//     note is different, so the string comparison is true for all rows but
+//     one; it comes first so that every row pays for it, and the range picks
+//     a tenth of the rows from the middle of the table, the excluded note's
+//     row among them.
+struct selection_criteria {
+  int32_t above;
+  int32_t low;
+  int32_t high;
+  config_row excluded;  // its note is the excluded one
+  uint32_t integer_matches;
+  uint32_t mixed_matches;
+};
+
+inline selection_criteria selection_criteria_for(uint32_t rows) {
+  selection_criteria criteria{};
+  const uint32_t tenth = rows / 10;
+  criteria.above = static_cast<int32_t>(rows - tenth) - 1;
+  criteria.low = static_cast<int32_t>(rows / 2);
+  criteria.high = criteria.low + static_cast<int32_t>(tenth);
+  criteria.excluded = make_row(static_cast<uint32_t>(criteria.low) + 1);
+  criteria.integer_matches = tenth;
+  criteria.mixed_matches = tenth - 1;
+  return criteria;
+}
+
+// The criteria in the registry's language, with "$" replacement variables
+// for the values above in the order they are listed.
+inline constexpr const char *Integer_Criteria = "count > $i";
+inline constexpr const char *Mixed_Criteria = "note != $s && count >= $i && count < $i";
 
 // The n-th key a read workload looks up in a table of `rows` rows: a fixed
 // stride through the table, coprime with every size above, so consecutive
@@ -140,6 +187,7 @@ void register_ours();
 void register_sqlite();
 void register_lmdb();
 void register_floors();
+void register_record_floor();
 
 }  // namespace compare
 

@@ -35,6 +35,27 @@ struct table_view {
   }
 };
 
+// How many index positions ahead of the row being judged the walk asks for
+// the record the view shows there to be brought into the cache. A row
+// record takes about 100 to 200 bytes and starts anywhere in a line, so its
+// first three lines are asked for; reaching it only when it is judged would
+// leave the walk waiting for every record in turn.
+constexpr uint32_t Prefetch_Distance = 8;
+constexpr uintptr_t Cache_Line_Bytes = 64;
+constexpr uintptr_t Prefetched_Lines = 3;
+
+// The addresses are computed as integers: the lines after a short record lie
+// beyond it, and a prefetch never faults.
+void prefetch_record(const void *p_record) {
+  if (p_record == nullptr) {
+    return;
+  }
+  const auto address = reinterpret_cast<uintptr_t>(p_record);
+  for (uintptr_t line = 0; line < Prefetched_Lines; ++line) {
+    __builtin_prefetch(reinterpret_cast<const void *>(address + line * Cache_Line_Bytes));
+  }
+}
+
 // Calls `visit(position, entry, record)` for each row the view shows, in
 // fixed-index order, and stops at the first failure it returns.
 template <typename Visit>
@@ -42,6 +63,9 @@ int32_t walk_view(const sr_i_table_t *p_table, table_view view, Visit &&visit) {
   const uint32_t total_rows = view.total_rows(p_table);
   uint32_t seen = 0;
   for (uint32_t position = 0; position < p_table->maximum_rows && seen < total_rows; ++position) {
+    if (position + Prefetch_Distance < p_table->maximum_rows) {
+      prefetch_record(view.record(p_table->p_rows_fixed_index[position + Prefetch_Distance]));
+    }
     const sr_i_index_entry_t &entry = p_table->p_rows_fixed_index[position];
     const void *p_record = view.record(entry);
     if (p_record == nullptr) {

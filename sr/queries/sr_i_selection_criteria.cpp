@@ -383,21 +383,12 @@ int32_t sr_i_validate_column_callback(void *p_token, const char *p_name, uint32_
   return 0;
 }
 
-int32_t sr_i_row_matches(const sr_i_table_t *p_table, const cu_expression_t *p_expression,
-                         const void *p_record, bool *p_matches) {
-  uint32_t result = 0;
-  const int32_t rc =
-      cu_exec_expr_1(p_expression, CU_EXPR_MODE_ENCODED_SLOTS, sr_i_row_slot(p_record, 0),
-                     p_table->total_columns, &result, sr_i_row_variable_part(p_table, p_record));
-  if (rc == 0) {
-    *p_matches = result != 0;
-    return 0;
-  }
-  if (means_no_match(rc)) {
+int32_t sr_i_evaluation_failure(int32_t evaluation_result, bool *p_matches) {
+  if (means_no_match(evaluation_result)) {
     *p_matches = false;
     return 0;
   }
-  return sr_i_raise_library_call("cu_exec_expr", rc);
+  return sr_i_raise_library_call("cu_exec_expr", evaluation_result);
 }
 
 sr_i_table_criteria::~sr_i_table_criteria() {

@@ -13,6 +13,7 @@
 #include <memory>
 
 #include "qv_cu.h"
+#include "rows/sr_i_rows.h"
 #include "tables/sr_i_table.h"
 
 /*
@@ -53,12 +54,31 @@ int32_t sr_i_validate_column_callback(void *p_token, const char *p_name, uint32_
                                       uint32_t parent_id, cu_validate_data_t *p_return_data);
 
 /*
+ * What an evaluation that did not return 0 means: the evaluator's "no
+ * match" results (an arithmetic fault, a missing value, an index out of
+ * range) give 0 with `*p_matches` false, any other 11 naming
+ * "cu_exec_expr", raised.
+ */
+int32_t sr_i_evaluation_failure(int32_t evaluation_result, bool *p_matches);
+
+/*
  * Evaluates the expression on a row record of `p_table`. Returns 0 with
  * `*p_matches` set (the evaluator's "no match" results count as no match),
- * or 11 naming "cu_exec_expr", raised.
+ * or 11 naming "cu_exec_expr", raised. Inline: a selection calls it once per
+ * row.
  */
-int32_t sr_i_row_matches(const sr_i_table_t *p_table, const cu_expression_t *p_expression,
-                         const void *p_record, bool *p_matches);
+inline int32_t sr_i_row_matches(const sr_i_table_t *p_table, const cu_expression_t *p_expression,
+                                const void *p_record, bool *p_matches) {
+  uint32_t result = 0;
+  const int32_t rc =
+      cu_exec_expr_1(p_expression, CU_EXPR_MODE_ENCODED_SLOTS, sr_i_row_slot(p_record, 0),
+                     p_table->total_columns, &result, sr_i_row_variable_part(p_table, p_record));
+  if (rc != 0) {
+    return sr_i_evaluation_failure(rc, p_matches);
+  }
+  *p_matches = result != 0;
+  return 0;
+}
 
 /*
  * Criteria compiled for one table, freed with the object: the expression

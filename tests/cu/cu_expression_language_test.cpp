@@ -68,6 +68,14 @@ TEST(ExpressionValues, StringsBinariesAndHandles) {
              R"(Name =~ "^(e|x)+t{1,3}h[[:digit:]]{1,2}$" && Name =~ "^[^]a-d]+(0|1){,2}(x*)?$")",
              R"(Link.Media =~ "^cop" && Path =~ "\\temp")",
              R"(Path =~ "^([A-Z]+:)?(\\[a-z]+)+\\'x'$")");
+  // Equality needs the same length as well as the same bytes: a prefix, a
+  // longer value or the empty one is never equal, with the constant on
+  // either side.
+  expect_row(Match, R"(Name != "eth")", R"(Name != "eth00")", R"(Name != "")", R"("eth" != Name)",
+             R"(Mac != "0x001122aabb")", R"(Mac != "0x")", R"(Aliases[1] != "uplink")");
+  expect_row(No_Match, R"(Name == "eth")", R"(Name == "eth00")", R"(Name == "")",
+             R"("eth" == Name)", R"("eth00" == Name)", R"(Mac == "0x001122aabb")",
+             R"(Mac == "0x001122aabbcc00")", R"(Aliases[1] != "")");
   // Double quotes take backslashes as they are.
   expect_row(Match, R"(Path == "C:\temp\'x'")");
   // Handles compare by their identity words first.
@@ -121,6 +129,10 @@ TEST(ExpressionValues, LogicalOperatorsShortCircuit) {
   expect_row(Match, R"(Id == 7 && Name == "eth0")", R"(Id == 8 || Name == "eth0")",
              "Id == 8 || Id == 9 || Id == 7", "Id == 7 && Weight", "(Id == 7) + (Weight > 2) == 2",
              "(Id && 5) == 1", "(0 || Weight) == 1");
+  // A comparison's 0 or 1 is a number like any other, also where && or ||
+  // ends with it.
+  expect_row(Match, "(Id > 3) * 5 == 5", "(Id > 9) * 5 == 0", "(Id == 7 && Id > 3) * 2 == 2",
+             R"((Id == 8 || Name != "eth0") + 1 == 1)", "Id > 3 == 1", "(Id > 3) - (Id > 9) == 1");
   // The element past the end is never read.
   expect_row(Match, "Id == 7 || Vlans[9] == 0");
   expect_row(No_Match, R"(Id == 8 && Name == "eth0")", "Weight && 0");

@@ -1,0 +1,24 @@
+// compare_ours.h - what the rest of the comparison borrows from our side: the
+// loaded tables of the read workloads, so that the record floor walks the
+// very records our selection reads.
+#ifndef COMPARE_OURS_H
+#define COMPARE_OURS_H
+
+#include <cstdint>
+
+#include "qv_sr.h"
+
+namespace compare {
+
+// The column positions of the comparison's table, in the order it is made.
+inline constexpr uint32_t Count_Column = 1;
+inline constexpr uint32_t Note_Column = 4;
+
+// The transient table of `rows` rows (0 .. rows-1, committed) that the read
+// workloads share, loaded on first use and kept for the whole run; null when
+// it could not be loaded.
+sr_opaque_handle_t loaded_transient_table(int64_t rows);
+
+}  // namespace compare
+
+#endif  // COMPARE_OURS_H

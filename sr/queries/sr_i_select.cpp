@@ -220,17 +220,15 @@ int32_t sr_i_select(sr_i_table_t *p_table, const char *const *p_column_names,
   }
   const uint32_t *p_column_indices = total_column_names != 0 ? columns.data() : nullptr;
   const table_view view{p_table->uncommitted_updates_visible != 0};
-  if (const int32_t rc = walk_view(p_table, view,
-                                   [&](uint32_t, const sr_i_index_entry_t &, const void *p_record) {
-                                     bool matches = false;
-                                     int32_t rc = criteria.matches(p_table, p_record, &matches);
-                                     if (rc == 0 && matches) {
-                                       rc = sr_i_copy_row(p_table, p_record, p_new_table,
-                                                          p_column_indices);
-                                     }
-                                     return rc;
-                                   });
-      rc != 0) {
+  const auto copy_if_matching = [&](uint32_t, const sr_i_index_entry_t &, const void *p_record) {
+    bool matches = false;
+    int32_t copy_rc = criteria.matches(p_table, p_record, &matches);
+    if (copy_rc == 0 && matches) {
+      copy_rc = sr_i_copy_row(p_table, p_record, p_new_table, p_column_indices);
+    }
+    return copy_rc;
+  };
+  if (const int32_t rc = walk_view(p_table, view, copy_if_matching); rc != 0) {
     return rc;
   }
   p_new_table->total_committed_rows = p_new_table->total_applied_rows;

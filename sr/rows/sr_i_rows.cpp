@@ -271,23 +271,54 @@ sr_row_state_t sr_i_get_row_state_for_fixed_index(const sr_i_table_t *p_table,
 }
 
 int32_t sr_i_establish_secondary_row_access(sr_i_table_t *p_table) {
-  const auto key_qualifier =
-      p_table->total_columns > 0 ? p_table->p_columns[0].qualifier : SR_UNKNOWN_QUALIFIER;
   uint32_t found = 0;
   for (uint32_t position = 0;
        position < p_table->maximum_rows && found < p_table->total_committed_rows; ++position) {
     sr_i_index_entry_t &entry = p_table->p_rows_fixed_index[position];
-    if (entry.p_committed == nullptr) {
-      continue;
+    if (entry.p_committed != nullptr) {
+      p_table->p_rows_packed_index[found] = position;
+      entry.packed_index = found++;
     }
-    p_table->p_rows_packed_index[found] = position;
-    entry.packed_index = found++;
-    if (p_table->p_rows_hash_table == nullptr) {
-      continue;
+  }
+  sr_hash_table_t *p_hash_table = p_table->p_rows_hash_table;
+  if (p_hash_table == nullptr) {
+    return 0;
+  }
+  // Each insertion starts at its bucket head, a cache miss in a large
+  // table: the keys a few rows ahead are hashed, and their heads asked for,
+  // while the current row goes in.
+  constexpr uint32_t Look_Ahead = 8;
+  uint32_t buckets[Look_Ahead];
+  const auto key_of = [p_table](uint32_t packed) {
+    return sr_i_row_key(
+        p_table, p_table->p_rows_fixed_index[p_table->p_rows_packed_index[packed]].p_committed);
+  };
+  const auto hash_ahead = [&](uint32_t packed) {
+    uint32_t &bucket = buckets[packed % Look_Ahead];
+    const int32_t rc = sr_i_hash_table_bucket(p_hash_table, key_of(packed), &bucket);
+    if (rc == 0) {
+      __builtin_prefetch(&p_hash_table->p_elements[bucket]);
     }
-    const int32_t rc = sr_i_hash_table_add(
-        p_table->p_rows_hash_table, sr_i_row_key(p_table, entry.p_committed), position,
-        &entry.hash_index, &entry.p_hash_table_element, key_qualifier);
+    return rc;
+  };
+  for (uint32_t packed = 0; packed < found && packed < Look_Ahead; ++packed) {
+    if (const int32_t rc = hash_ahead(packed); rc != 0) {
+      return rc;
+    }
+  }
+  const auto key_qualifier = p_table->p_columns[0].qualifier;
+  for (uint32_t packed = 0; packed < found; ++packed) {
+    const uint32_t bucket = buckets[packed % Look_Ahead];
+    if (packed + Look_Ahead < found) {
+      if (const int32_t rc = hash_ahead(packed + Look_Ahead); rc != 0) {
+        return rc;
+      }
+    }
+    const uint32_t position = p_table->p_rows_packed_index[packed];
+    sr_i_index_entry_t &entry = p_table->p_rows_fixed_index[position];
+    const int32_t rc = sr_i_hash_table_add_to_bucket(p_hash_table, bucket, key_of(packed), position,
+                                                     &entry.p_hash_table_element, key_qualifier,
+                                                     &entry.hash_index);
     if (rc != 0) {
       // A duplicate of a key under SR_PRIMARY_KEY reaches here unraised.
       return rc == SR_E_DUPLICATE_KEY ? sr_i_raise(SR_E_DUPLICATE_KEY) : rc;

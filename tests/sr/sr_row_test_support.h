@@ -8,6 +8,7 @@
 
 #include <gtest/gtest.h>
 
+#include <cstdarg>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
@@ -178,6 +179,16 @@ std::map<Key, int32_t> rows_in(sr_opaque_handle_t table, const char *p_key, uint
       rows[row.values[0].val_int32] = row.values[1].val_int32;
     }
   }
+}
+
+// sr_get_selected_rows_v_1 with the criteria's values as arguments.
+inline int32_t list_rows(sr_opaque_handle_t table, uint32_t visible, uint32_t *p_total,
+                         uint32_t **pp_rows, const char *p_criteria, ...) {
+  va_list ap;
+  va_start(ap, p_criteria);
+  const int32_t rc = sr_get_selected_rows_v_1(table, p_criteria, ap, visible, p_total, pp_rows);
+  va_end(ap);
+  return rc;
 }
 
 inline sr_i_table_t *object(sr_opaque_handle_t handle) {

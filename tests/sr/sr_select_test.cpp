@@ -23,16 +23,6 @@ namespace {
 
 using namespace sr_test;
 
-// sr_get_selected_rows_v_1 with the criteria's values as arguments.
-int32_t list_rows(sr_opaque_handle_t table, uint32_t visible, uint32_t *p_total, uint32_t **pp_rows,
-                  const char *p_criteria, ...) {
-  va_list ap;
-  va_start(ap, p_criteria);
-  const int32_t rc = sr_get_selected_rows_v_1(table, p_criteria, ap, visible, p_total, pp_rows);
-  va_end(ap);
-  return rc;
-}
-
 // The fixed indexes a listing returns, or {code with the top bit} when it
 // fails.
 template <typename... Values>

@@ -23,15 +23,6 @@ using namespace sr_test;
 constexpr int32_t Rows = 40;
 constexpr int32_t Start_Count = 100;
 
-int32_t list_rows(sr_opaque_handle_t table, uint32_t *p_total, uint32_t **pp_rows,
-                  const char *p_criteria, ...) {
-  va_list ap;
-  va_start(ap, p_criteria);
-  const int32_t rc = sr_get_selected_rows_v_1(table, p_criteria, ap, 0, p_total, pp_rows);
-  va_end(ap);
-  return rc;
-}
-
 // The sum of "count" over every row of a result table, or -1.
 int64_t sum_of_counts(sr_opaque_handle_t result) {
   int64_t sum = 0;
@@ -81,7 +72,7 @@ TEST_F(SelectThreads, SelectionsAndListingsSeeWholeCommittedStatesWhileAWriterCo
     while (writing.load()) {
       uint32_t total = 0;
       uint32_t *p_rows = nullptr;
-      if (list_rows(table_, &total, &p_rows, nullptr) != 0 || total != Rows) {
+      if (list_rows(table_, 0, &total, &p_rows, nullptr) != 0 || total != Rows) {
         ++wrong;
       }
       std::free(p_rows);
@@ -121,7 +112,7 @@ TEST_F(SelectThreads, AForkedChildSelectsAndLists) {
     const bool selected =
         sr_select_1(table_, nullptr, 0, &result, "count == $i", Start_Count) == 0 &&
         sum_of_counts(result) == int64_t{Rows} * Start_Count;
-    const bool listed = list_rows(table_, &total, &p_rows, "name == $s", "7") == 0 && total == 1;
+    const bool listed = list_rows(table_, 0, &total, &p_rows, "name == $s", "7") == 0 && total == 1;
     // A change is still refused in the child.
     const bool refused = add_named(table_, "new", 1) == SR_E_INTERNAL;
     ::_exit(selected && listed && refused ? 0 : 1);

@@ -358,6 +358,98 @@ QV_SR_EXPORT int32_t sr_get_table_metadata_1(sr_opaque_handle_t table_handle, in
  * the caller's error. */
 QV_SR_EXPORT int32_t sr_free_table_metadata_1(sr_table_metadata_t *p_metadata);
 
+/* ---- Schema changes ------------------------------------------------------ */
+
+/*
+ * Adding, deleting and renaming columns and changing a default rebuild the
+ * table while handles stay open: a new image with the new columns and every
+ * committed row is built, made durable, and then takes the place of the old
+ * one, so that every handle on the table sees the new schema when the call
+ * returns and a failure leaves the table (and its file) exactly as it was.
+ * A persistent table's file is written anew beside the old one and renamed
+ * over it; another process reading it sees the old table or the new one.
+ * The table must be open for writing (SR_E_ACCESS) and fully committed:
+ * nothing pending, nothing applied and not committed (SR_E_UNCOMMITTED).
+ * Readers of the table wait while it is rebuilt. Afterwards the rows lie in
+ * their packed order, so fixed row indexes taken before may name other rows;
+ * the change counter is one higher (for a persistent table, as the commit of
+ * the new file sets it). Invisible columns are kept through every change but
+ * cannot be named by one. Each call also returns SR_E_INVALID_HANDLE for a
+ * null handle, SR_E_NO_MEMORY, SR_E_INTERNAL in a forked child, and for a
+ * persistent table the codes of writing its file (SR_E_SYSTEM_CALL,
+ * SR_E_FILESYSTEM_FULL, SR_E_ACCESS).
+ */
+
+/*
+ * Adds `array_count` columns behind the existing ones; every row takes
+ * their default values. The new definitions are checked as at creation.
+ * Returns 0; SR_E_NULL_POINTER; SR_E_NO_COLUMNS for a count of 0;
+ * SR_E_INVALID_COLUMN; SR_E_DUPLICATE_COLUMN (a name the table has, or one
+ * given twice); SR_E_DUPLICATE_KEY (a second key column); SR_E_LIBRARY_CALL
+ * (a default cannot be encoded); and the codes above.
+ */
+QV_SR_EXPORT int32_t sr_add_columns_1(sr_opaque_handle_t table_handle, sr_column_t *columns,
+                                      uint32_t array_count);
+
+/*
+ * Deletes the named columns and their values. The key column cannot be
+ * deleted, nor an invisible one; at least the key remains. Returns 0;
+ * SR_E_NULL_POINTER for a null array; SR_E_NO_COLUMNS for a count of 0;
+ * SR_E_INVALID_COLUMN for an unknown, key or invisible column or more names
+ * than the table has columns besides its key; and the codes above.
+ */
+QV_SR_EXPORT int32_t sr_delete_columns_1(sr_opaque_handle_t table_handle,
+                                         const char *const *column_names, uint32_t array_count);
+
+/*
+ * Renames the visible column `column_name` to `new_name`. Returns 0;
+ * SR_E_NULL_POINTER; SR_E_INVALID_COLUMN (no such visible column, or a new
+ * name that is not valid); SR_E_DUPLICATE_COLUMN when the table has a
+ * column of that name already; and the codes above.
+ */
+QV_SR_EXPORT int32_t sr_change_column_name_1(sr_opaque_handle_t table_handle,
+                                             const char *column_name, const char *new_name);
+
+/*
+ * Gives the visible column `column_name` the default `new_value` (copied;
+ * for a variable-length type a pointer to the caller's value). Rows already
+ * in the table keep their values; rows added later take the new default.
+ * Returns 0; SR_E_NULL_POINTER; SR_E_INVALID_COLUMN; SR_E_LIBRARY_CALL (the
+ * value cannot be encoded); and the codes above.
+ */
+QV_SR_EXPORT int32_t sr_change_default_value_1(sr_opaque_handle_t table_handle,
+                                               const char *column_name, qv_value_t new_value);
+
+/*
+ * Replaces the default value of any column (invisible ones too) in this
+ * process's memory only: no row changes, nothing is written, and no open
+ * mode is required. Other trees and processes keep the stored default; the
+ * overlay lasts while the table stays open here, except that a later
+ * rewrite of a persistent table's file (a large apply, or a schema change)
+ * writes the column definitions as they then are. A variable-length default
+ * is encoded in the room of the old one: SR_E_NO_ROWS when it needs more
+ * (an equal or shorter one fits). Returns 0; SR_E_INVALID_HANDLE;
+ * SR_E_NULL_POINTER for a null name; SR_E_INVALID_COLUMN for no such column;
+ * SR_E_NO_ROWS; SR_E_LIBRARY_CALL; SR_E_NO_MEMORY; SR_E_INTERNAL in a forked
+ * child.
+ */
+QV_SR_EXPORT int32_t sr_overlay_memory_default_value_1(sr_opaque_handle_t table_handle,
+                                                       const char *p_column_name,
+                                                       qv_value_t new_default_value);
+
+/*
+ * Replaces the qualifier of a column in memory only, as the default
+ * overlay does: both the column's present qualifier and `new_qualifier`
+ * must have the base SR_STANDARD, so only the flags SR_PROTECTED,
+ * SR_INVISIBLE and SR_SET_TO_DEFAULT_WHEN_UNSPECIFIED change. Returns 0;
+ * SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_INVALID_COLUMN (no such
+ * column, a key or system column, or a base other than SR_STANDARD);
+ * SR_E_INTERNAL in a forked child.
+ */
+QV_SR_EXPORT int32_t sr_overlay_memory_column_qualifier_1(sr_opaque_handle_t table_handle,
+                                                          const char *p_column_name,
+                                                          sr_qualifier_t new_qualifier);
+
 /* ---- Mount points ------------------------------------------------------ */
 
 /*

@@ -101,6 +101,20 @@ int32_t choose_columns(const sr_i_table_t *p_table, const char *const *p_column_
   return 0;
 }
 
+// Whether the chosen columns are all of the table's in order, so that rows
+// are copied as they are.
+bool copies_whole_rows(const sr_i_table_t *p_table, std::span<const uint32_t> columns) {
+  if (columns.size() != p_table->total_columns) {
+    return false;
+  }
+  for (uint32_t column = 0; column < columns.size(); ++column) {
+    if (columns[column] != column) {
+      return false;
+    }
+  }
+  return true;
+}
+
 // The record's data length, without the pool's header.
 uint32_t record_data_length(const void *p_record) {
   return sr_i_rb_record_header(const_cast<void *>(p_record))->record_length -
@@ -115,7 +129,7 @@ struct table_closer {
 // An empty result table shaped like the source, reduced to `columns`: pool
 // room for every copy at once, the metadata record, a row index for every
 // row that could match, the source's kind of key hash table.
-int32_t make_result_table(const sr_i_table_t *p_table, const std::vector<uint32_t> &columns,
+int32_t make_result_table(const sr_i_table_t *p_table, std::span<const uint32_t> columns,
                           sr_i_table_t *p_new_table) {
   p_new_table->mode = Sr_Mode_Writable;
   p_new_table->implicitly_controlled = 0;
@@ -162,6 +176,10 @@ int32_t sr_i_copy_row(const sr_i_table_t *p_table, const void *p_from_record_dat
     sr_i_row_builder builder(p_new_table);
     const unsigned char *p_variable = sr_i_row_variable_part(p_table, p_from_record_data);
     for (uint32_t column = 0; column < p_new_table->total_columns; ++column) {
+      if (p_column_indices[column] == Sr_Default_Value_Column) {
+        builder.copy_default(column);
+        continue;
+      }
       const unsigned char *p_slot = sr_i_row_slot(p_from_record_data, p_column_indices[column]);
       if (sr_i_is_variable_length(p_new_table->p_columns[column].type)) {
         const qv_pmsg_value_anchor_t anchor = sr_i_slot_anchor(p_slot);
@@ -206,6 +224,11 @@ int32_t sr_i_select(sr_i_table_t *p_table, const char *const *p_column_names,
       columns.push_back(column);
     }
   }
+  return sr_i_select_columns(p_table, columns, p_selection_criteria, pp_select_table);
+}
+
+int32_t sr_i_select_columns(sr_i_table_t *p_table, std::span<const uint32_t> columns,
+                            const char *p_selection_criteria, sr_i_table_t **pp_select_table) {
   sr_i_table_t *p_new_table = sr_i_create_null_table();
   if (p_new_table == nullptr) {
     return SR_E_NO_MEMORY;
@@ -218,7 +241,7 @@ int32_t sr_i_select(sr_i_table_t *p_table, const char *const *p_column_names,
   if (const int32_t rc = criteria.compile(p_table, p_selection_criteria); rc != 0) {
     return rc;
   }
-  const uint32_t *p_column_indices = total_column_names != 0 ? columns.data() : nullptr;
+  const uint32_t *p_column_indices = copies_whole_rows(p_table, columns) ? nullptr : columns.data();
   const table_view view{p_table->uncommitted_updates_visible != 0};
   const auto copy_if_matching = [&](uint32_t, const sr_i_index_entry_t &, const void *p_record) {
     bool matches = false;

@@ -6,6 +6,7 @@
 // The caller's column array is never written: the key column is moved
 // first in a copy, so the caller finds its array as it gave it on every path.
 
+#include <algorithm>
 #include <cstdlib>
 #include <cstring>
 #include <vector>
@@ -33,7 +34,7 @@ struct table_closer {
 int32_t create_transient_table_common(sr_i_tree_t *p_tree, const char *p_name,
                                       const sr_column_t *p_columns, uint32_t total_columns,
                                       int32_t mode, sr_hash_table_t *p_rows_hash_table,
-                                      sr_i_table_t **pp_table) {
+                                      uint32_t expected_rows, sr_i_table_t **pp_table) {
   uint32_t key_position = 0;
   if (const int32_t rc = sr_i_validate_columns(p_columns, total_columns, key_position); rc != 0) {
     sr_i_hash_table_close(p_rows_hash_table);
@@ -55,7 +56,8 @@ int32_t create_transient_table_common(sr_i_tree_t *p_tree, const char *p_name,
   if (p_name != nullptr && (p_new_table->p_name = strdup(p_name)) == nullptr) {
     return sr_i_raise_no_memory();
   }
-  if (const int32_t rc = sr_i_establish_rows_index(p_new_table, Sr_Initial_Transient_Rows);
+  if (const int32_t rc = sr_i_establish_rows_index(
+          p_new_table, std::max(expected_rows, Sr_Initial_Transient_Rows));
       rc != 0) {
     return rc;
   }
@@ -84,10 +86,12 @@ int32_t create_transient_table_common(sr_i_tree_t *p_tree, const char *p_name,
 
 int32_t sr_i_create_transient_table(sr_i_tree_t *p_tree, const char *p_name, sr_column_t *p_columns,
                                     uint32_t total_columns, int32_t mode,
-                                    sr_hash_table_t *p_rows_hash_table, sr_i_table_t **pp_table) {
+                                    sr_hash_table_t *p_rows_hash_table, sr_i_table_t **pp_table,
+                                    uint32_t expected_rows) {
   sr_i_table_t *p_new_table = nullptr;
-  if (const int32_t rc = create_transient_table_common(p_tree, p_name, p_columns, total_columns,
-                                                       mode, p_rows_hash_table, &p_new_table);
+  if (const int32_t rc =
+          create_transient_table_common(p_tree, p_name, p_columns, total_columns, mode,
+                                        p_rows_hash_table, expected_rows, &p_new_table);
       rc != 0) {
     return rc;
   }

@@ -26,13 +26,16 @@ inline constexpr int32_t Sr_Highest_Create_Mode =
  * Makes a transient table named `p_name` (null for an unnamed table) with a
  * copy of the columns. The table takes `p_rows_hash_table` (closed on every
  * failure); without one, a resource-handle key gets the built-in hash. The
- * caller's column array is in its original order again on return.
+ * caller's column array is in its original order again on return. The row
+ * index starts with room for `expected_rows` (at least the usual first
+ * hundred), so a caller about to fill the table does not grow it row by row.
  * Returns 0 and the table in *pp_table, or 104, 105, 106, 107, 108, 11, 12
  * (raised).
  */
 int32_t sr_i_create_transient_table(struct sr_i_tree_struct_t *p_tree, const char *p_name,
                                     sr_column_t *p_columns, uint32_t total_columns, int32_t mode,
-                                    sr_hash_table_t *p_rows_hash_table, sr_i_table_t **pp_table);
+                                    sr_hash_table_t *p_rows_hash_table, sr_i_table_t **pp_table,
+                                    uint32_t expected_rows = Sr_Initial_Transient_Rows);
 
 /*
  * The dispatcher of the exported creation calls: checks the arguments,

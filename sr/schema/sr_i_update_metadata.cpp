@@ -1,0 +1,152 @@
+// sr_i_update_metadata.cpp - the rebuilt image of a table whose columns
+// grow, or one of whose columns is renamed or given a new default: a new
+// memory-only table made from the full column list as a caller would give
+// it (so the usual checks of a new table apply), filled with a copy of
+// every committed row in packed-index order.
+//
+// The row layout depends only on the column types, so a rename or a new
+// default copies each record as it is; added columns go behind the old
+// ones, and each copied row takes their defaults.
+
+#include <cstring>
+#include <memory>
+#include <vector>
+
+#include "frame/sr_i_errors.h"
+#include "queries/sr_i_select.h"
+#include "rows/sr_i_rows.h"
+#include "schema/sr_i_schema_changes.h"
+#include "schema/sr_i_table_metadata.h"
+#include "tables/sr_i_create_table.h"
+#include "tables/sr_i_hash_table.h"
+
+namespace {
+
+struct metadata_deleter {
+  void operator()(sr_table_metadata_t *p_metadata) const { sr_i_free_table_metadata(p_metadata); }
+};
+using metadata_ptr = std::unique_ptr<sr_table_metadata_t, metadata_deleter>;
+
+struct table_closer {
+  sr_i_table_t *p_table;
+  ~table_closer() { sr_i_close_table(p_table); }
+};
+
+// The visible column of that exact name among the described ones, or -1: an
+// invisible column cannot be renamed or given a new default.
+int32_t find_visible_column(const sr_table_metadata_t &metadata, const char *p_name) {
+  for (uint32_t column = 0; column < metadata.number_of_columns; ++column) {
+    const sr_column_t &definition = metadata.column_definitions[column];
+    if ((definition.qualifier & SR_INVISIBLE) == 0 && std::strcmp(definition.name, p_name) == 0) {
+      return static_cast<int32_t>(column);
+    }
+  }
+  return -1;
+}
+
+// An empty key hash table like the one of `p_table`, or null for none.
+int32_t open_hash_table_like(const sr_i_table_t *p_table, sr_hash_table_t **pp_hash_table) {
+  *pp_hash_table = nullptr;
+  const sr_hash_table_t *p_hash_table = p_table->p_rows_hash_table;
+  if (p_hash_table == nullptr) {
+    return 0;
+  }
+  return sr_i_hash_table_open(p_hash_table->total_hash_buckets, p_hash_table->p_hash_function,
+                              p_hash_table->p_compare_function, pp_hash_table);
+}
+
+// Pool room for every row of `p_table` copied with the added columns of
+// `p_new_table` (those past the old count) at their defaults.
+int32_t make_room_for_rows(const sr_i_table_t *p_table, sr_i_table_t *p_new_table) {
+  uint64_t added_per_row = 0;
+  for (uint32_t column = p_table->total_columns; column < p_new_table->total_columns; ++column) {
+    const sr_column_t &definition = p_new_table->p_columns[column];
+    added_per_row += Sr_Row_Slot_Length;
+    if (sr_i_is_variable_length(definition.type)) {
+      added_per_row += sr_i_slot_anchor(&definition.default_value).length;
+    }
+  }
+  const uint64_t room = p_table->record_buffer_pool.used_bytes +
+                        uint64_t{p_table->total_committed_rows} * added_per_row;
+  if (room > UINT32_MAX) {
+    return sr_i_raise_no_memory();
+  }
+  return room == 0
+             ? 0
+             : sr_i_rb_make_room(&p_new_table->record_buffer_pool, static_cast<uint32_t>(room));
+}
+
+// Copies every committed row of `p_table` into `p_new_table`, in packed
+// order, then makes the new table's packed index and hash elements.
+int32_t copy_rows(const sr_i_table_t *p_table, sr_i_table_t *p_new_table) {
+  std::vector<uint32_t> columns;
+  if (p_new_table->total_columns != p_table->total_columns) {
+    columns.reserve(p_new_table->total_columns);
+    for (uint32_t column = 0; column < p_table->total_columns; ++column) {
+      columns.push_back(column);
+    }
+    columns.resize(p_new_table->total_columns, Sr_Default_Value_Column);
+  }
+  const uint32_t *p_column_indices = columns.empty() ? nullptr : columns.data();
+  for (uint32_t packed = 0; packed < p_table->total_committed_rows; ++packed) {
+    const sr_i_index_entry_t &entry =
+        p_table->p_rows_fixed_index[p_table->p_rows_packed_index[packed]];
+    if (const int32_t rc = sr_i_copy_row(p_table, entry.p_committed, p_new_table, p_column_indices);
+        rc != 0) {
+      return rc;
+    }
+  }
+  p_new_table->total_committed_rows = p_new_table->total_applied_rows;
+  return sr_i_establish_secondary_row_access(p_new_table);
+}
+
+}  // namespace
+
+int32_t sr_i_update_metadata(sr_i_table_t *p_table, const sr_column_t *p_new_columns,
+                             uint32_t total_new_columns, const char *p_old_column_name,
+                             const char *p_new_column_name, const qv_value_t *p_new_value,
+                             sr_i_table_t **pp_result_table) {
+  if (const int32_t rc = sr_i_check_rebuildable(p_table); rc != 0) {
+    return rc;
+  }
+  sr_table_metadata_t *p_described = nullptr;
+  if (const int32_t rc = sr_i_get_table_metadata(p_table, -1, &p_described); rc != 0) {
+    return rc;
+  }
+  const metadata_ptr metadata(p_described);
+  std::vector<sr_column_t> columns(metadata->column_definitions,
+                                   metadata->column_definitions + metadata->number_of_columns);
+  columns.insert(columns.end(), p_new_columns, p_new_columns + total_new_columns);
+  if (p_old_column_name != nullptr) {
+    const int32_t column = find_visible_column(*metadata, p_old_column_name);
+    if (column < 0) {
+      return sr_i_raise(SR_E_INVALID_COLUMN);
+    }
+    if (p_new_column_name != nullptr) {
+      columns[column].name = const_cast<char *>(p_new_column_name);
+    } else {
+      columns[column].default_value = *p_new_value;
+    }
+  }
+  sr_hash_table_t *p_hash_table = nullptr;
+  if (const int32_t rc = open_hash_table_like(p_table, &p_hash_table); rc != 0) {
+    return rc;
+  }
+  sr_i_table_t *p_new_table = nullptr;
+  if (const int32_t rc = sr_i_create_transient_table(
+          p_table->p_tree, p_table->p_name, columns.data(), static_cast<uint32_t>(columns.size()),
+          SR_MODE_WRITE, p_hash_table, &p_new_table, p_table->total_committed_rows);
+      rc != 0) {
+    return rc;
+  }
+  table_closer closer{p_new_table};
+  if (const int32_t rc = make_room_for_rows(p_table, p_new_table); rc != 0) {
+    return rc;
+  }
+  if (const int32_t rc = copy_rows(p_table, p_new_table); rc != 0) {
+    return rc;
+  }
+  *pp_result_table = p_new_table;
+  closer.p_table = nullptr;
+  return 0;
+}

@@ -1,0 +1,21 @@
+// sr_x_overlay_memory_default_value.cpp - sr_overlay_memory_default_value_1:
+// a column's default changed in memory only.
+
+#include "frame/sr_i_frame.h"
+#include "schema/sr_i_schema_changes.h"
+
+namespace {
+
+constexpr sr_i_entry_point_t Overlay_Memory_Default_Value{85, true};
+
+}  // namespace
+
+extern "C" int32_t sr_overlay_memory_default_value_1(sr_opaque_handle_t table_handle,
+                                                     const char *p_column_name,
+                                                     qv_value_t new_default_value) {
+  return sr_i_run_entry_point(Overlay_Memory_Default_Value, [&]() -> int32_t {
+    return sr_i_overlay_column(table_handle, p_column_name, [&](sr_i_table_t *p_table) {
+      return sr_i_overlay_memory_default_value(p_table, p_column_name, new_default_value);
+    });
+  });
+}

@@ -56,9 +56,18 @@ constexpr int Crash_Points_Per_Table = 50;
 constexpr const char *Table_Path = "/disk/crash/t";
 constexpr const char *Table_File = "crash,t";
 
-// Payloads of 40 to about 900 bytes and 12 to 60 rows keep the file past
-// the size at which rewrites start, and the pipe messages short.
-constexpr uint32_t Payload_Spread = 860;
+// What a child writes. Row changes: payloads of 40 to about 900 bytes and
+// 12 to 60 rows keep the file past the size at which rewrites start, and
+// the pipe messages short. Schema changes: a table of a few thousand short
+// rows, its columns changed again and again, rows changed in between.
+struct writer_kind {
+  bool schema_changes;
+  uint32_t payload_spread;
+  size_t fewest_rows;
+  size_t most_rows;
+};
+constexpr writer_kind Row_Writer{false, 860, 12, 60};
+constexpr writer_kind Schema_Writer{true, 60, 2000, 3000};
 
 // The child: random transactions for ever, each reported to the parent. It
 // writes lines "P <kind> <state>" before a commit may begin and
@@ -67,8 +76,12 @@ constexpr uint32_t Payload_Spread = 860;
 // commit that replaced the file says rewritten.
 class child_writer {
  public:
-  child_writer(std::string directory, uint32_t seed, int pipe_fd)
-      : directory_(std::move(directory)), rng_(seed), pipe_fd_(pipe_fd) {}
+  child_writer(std::string directory, uint32_t seed, int pipe_fd, writer_kind kind)
+      : directory_(std::move(directory)),
+        rng_(seed),
+        kind_(kind),
+        changes_{rng_, kind.payload_spread, kind.fewest_rows, kind.most_rows},
+        pipe_fd_(pipe_fd) {}
 
   [[noreturn]] void run() {
     if ((tree_ = mounted_tree(directory_)) == nullptr) {
@@ -87,8 +100,12 @@ class child_writer {
           say(std::string("P ") + p_what + " " + describe(next));
         };
         // Implicit deletions by packed index: the row's place among the live rows.
-        no_problem(implicit ? changes_.implicit_change(table_, committed_, true, announce)
-                            : changes_.explicit_transaction(table_, committed_, 8, announce));
+        if (kind_.schema_changes && rng_() % 2 == 0) {
+          no_problem(changes_.schema_change(table_, committed_, announce));
+        } else {
+          no_problem(implicit ? changes_.implicit_change(table_, committed_, true, announce)
+                              : changes_.explicit_transaction(table_, committed_, 8, announce));
+        }
         if (p_kind != nullptr) {
           confirm(p_kind);
         }
@@ -137,14 +154,25 @@ class child_writer {
   void open_or_create() {
     const int32_t rc = open_table(tree_, Table_Path, Open_Implicit, &table_);
     if (rc == SR_E_NO_TABLE) {
-      committed_ = {true, 1, {}};
+      committed_ = {true, 1, {}, {}};
       say("P create " + describe(committed_));
-      check(create_table(tree_, Table_Path, rng_() % 2 ? 0 : 4, &table_),
+      check(create_table(tree_, Table_Path,
+                         kind_.schema_changes ? 4
+                         : rng_() % 2         ? 0
+                                              : 4,
+                         &table_),
             "sr_create_hashed_key_table_1");
       confirm("create");
+      if (kind_.schema_changes) {
+        no_problem(changes_.fill(table_, committed_, static_cast<uint32_t>(kind_.fewest_rows),
+                                 [&](const char *p_kind, const table_state &next) {
+                                   say(std::string("P ") + p_kind + " " + describe(next));
+                                 }));
+        confirm("fill");
+      }
     } else {
       check(rc, "sr_open_hashed_key_table_1");
-      no_problem(read_rows(table_, committed_, Payload_Spread));
+      no_problem(read_rows(table_, committed_, kind_.payload_spread));
       file_inode_ = file_inode();
     }
     for (const auto &[id, version] : committed_.rows) {
@@ -154,7 +182,8 @@ class child_writer {
 
   std::string directory_;
   std::mt19937 rng_;
-  random_changes changes_{rng_, Payload_Spread, 12, 60};
+  writer_kind kind_;
+  random_changes changes_;
   int pipe_fd_;
   sr_opaque_handle_t tree_ = nullptr;
   sr_opaque_handle_t table_ = nullptr;
@@ -201,7 +230,7 @@ class Crash : public ::testing::Test {
 
   // Runs one child with `seed`, kills it once it has sent `messages` lines
   // and `delay` microseconds more have passed, and collects its report.
-  child_report kill_a_writer(uint32_t seed, int messages, useconds_t delay) {
+  child_report kill_a_writer(writer_kind kind, uint32_t seed, int messages, useconds_t delay) {
     int ends[2];
     child_report report;
     if (pipe(ends) != 0) {
@@ -215,7 +244,7 @@ class Crash : public ::testing::Test {
       // thread and holds no registry lock at the fork, so the guard that
       // keeps forked children from changing tables can be lifted.
       In_Child_Process.store(0);
-      child_writer(directory_, seed, ends[1]).run();
+      child_writer(directory_, seed, ends[1], kind).run();
     }
     close(ends[1]);
     std::string pending;
@@ -265,75 +294,88 @@ class Crash : public ::testing::Test {
     return kept;
   }
 
+  // Kills `crash_points` writers of `kind`, one after another on one table
+  // file, and checks after each what a new reader finds.
+  void kill_writers(writer_kind kind, int crash_points) {
+    uint32_t seed = std::random_device{}();
+    if (const char *p_seed = std::getenv("SR_CRASH_SEED")) {
+      seed = static_cast<uint32_t>(std::strtoul(p_seed, nullptr, 10));
+    }
+    std::mt19937 rng(seed);
+    table_state known;  // absent
+    int in_flight = 0;
+    int new_state_found = 0;
+    int commits = 0;
+    int rewrites = 0;
+    std::map<std::string, int> in_flight_kinds;
+    int point = 0;
+    for (; point < crash_points; ++point) {
+      if (point % Crash_Points_Per_Table == 0) {
+        std::filesystem::remove(directory_ + "/" + Table_File);
+        known = table_state{};
+      }
+      // On a new table the first message announces its creation: killed soon
+      // after it, the child is often still creating.
+      const bool new_table = point % Crash_Points_Per_Table == 0;
+      const int messages = new_table ? 1 : static_cast<int>(rng() % 30);
+      const auto delay = static_cast<useconds_t>(rng() % (new_table ? 1000 : 3000));
+      const uint32_t child_seed = seed + static_cast<uint32_t>(point);
+      const child_report report = kill_a_writer(kind, child_seed, messages, delay);
+      ASSERT_EQ(report.error, "") << "seed " << seed << ", crash point " << point;
+      commits += report.commits;
+      rewrites += report.rewrites;
+      if (report.committed) {
+        known = *report.committed;
+      }
+      table_state found;
+      const std::string problem = read_table(directory_, Table_Path, found, kind.payload_spread);
+      const bool read = problem.empty();
+      const bool old_state = read && found == known;
+      const bool new_state = read && report.announced && found == *report.announced;
+      if (report.announced) {
+        ++in_flight;
+        ++in_flight_kinds[report.announced_kind];
+      }
+      if (!old_state && !new_state) {
+        ADD_FAILURE() << "seed " << seed << " (SR_CRASH_SEED), crash point " << point
+                      << ", child seed " << child_seed << ", killed after " << messages
+                      << " messages + " << delay
+                      << " us\n  found:     " << (read ? describe(found) : problem)
+                      << "\n  committed: " << describe(known) << "\n  announced: "
+                      << (report.announced
+                              ? report.announced_kind + " " + describe(*report.announced)
+                              : "none")
+                      << "\n  files kept in " << keep_files(point);
+        break;
+      }
+      if (new_state && !old_state) {
+        ++new_state_found;
+        known = found;
+      }
+    }
+    std::cout << "crash points tried: " << point << " (seed " << seed
+              << "); a commit was in flight at " << in_flight << " of them (";
+    for (const auto &[kind, count] : in_flight_kinds) {
+      std::cout << kind << " " << count << ", ";
+    }
+    std::cout << "), the new state had reached the file at " << new_state_found
+              << "; commits reported " << commits << ", of which rewrote the file " << rewrites
+              << "\n";
+    RecordProperty("crash_points", point);
+    RecordProperty("commits_in_flight", in_flight);
+  }
+
   std::string directory_;
 };
 
 TEST_F(Crash, AKilledWriterLeavesTheLastCommittedStateOrTheOneInFlight) {
-  uint32_t seed = std::random_device{}();
-  if (const char *p_seed = std::getenv("SR_CRASH_SEED")) {
-    seed = static_cast<uint32_t>(std::strtoul(p_seed, nullptr, 10));
-  }
-  std::mt19937 rng(seed);
-  table_state known;  // absent
-  int in_flight = 0;
-  int new_state_found = 0;
-  int commits = 0;
-  int rewrites = 0;
-  std::map<std::string, int> in_flight_kinds;
-  int point = 0;
-  for (; point < Crash_Points; ++point) {
-    if (point % Crash_Points_Per_Table == 0) {
-      std::filesystem::remove(directory_ + "/" + Table_File);
-      known = table_state{};
-    }
-    // On a new table the first message announces its creation: killed soon
-    // after it, the child is often still creating.
-    const bool new_table = point % Crash_Points_Per_Table == 0;
-    const int messages = new_table ? 1 : static_cast<int>(rng() % 30);
-    const auto delay = static_cast<useconds_t>(rng() % (new_table ? 1000 : 3000));
-    const uint32_t child_seed = seed + static_cast<uint32_t>(point);
-    const child_report report = kill_a_writer(child_seed, messages, delay);
-    ASSERT_EQ(report.error, "") << "seed " << seed << ", crash point " << point;
-    commits += report.commits;
-    rewrites += report.rewrites;
-    if (report.committed) {
-      known = *report.committed;
-    }
-    table_state found;
-    const std::string problem = read_table(directory_, Table_Path, found, Payload_Spread);
-    const bool read = problem.empty();
-    const bool old_state = read && found == known;
-    const bool new_state = read && report.announced && found == *report.announced;
-    if (report.announced) {
-      ++in_flight;
-      ++in_flight_kinds[report.announced_kind];
-    }
-    if (!old_state && !new_state) {
-      ADD_FAILURE() << "seed " << seed << " (SR_CRASH_SEED), crash point " << point
-                    << ", child seed " << child_seed << ", killed after " << messages
-                    << " messages + " << delay
-                    << " us\n  found:     " << (read ? describe(found) : problem)
-                    << "\n  committed: " << describe(known) << "\n  announced: "
-                    << (report.announced ? report.announced_kind + " " + describe(*report.announced)
-                                         : "none")
-                    << "\n  files kept in " << keep_files(point);
-      break;
-    }
-    if (new_state && !old_state) {
-      ++new_state_found;
-      known = found;
-    }
-  }
-  std::cout << "crash points tried: " << point << " (seed " << seed
-            << "); a commit was in flight at " << in_flight << " of them (";
-  for (const auto &[kind, count] : in_flight_kinds) {
-    std::cout << kind << " " << count << ", ";
-  }
-  std::cout << "), the new state had reached the file at " << new_state_found
-            << "; commits reported " << commits << ", of which rewrote the file " << rewrites
-            << "\n";
-  RecordProperty("crash_points", point);
-  RecordProperty("commits_in_flight", in_flight);
+  kill_writers(Row_Writer, Crash_Points);
+}
+
+// A schema change rewrites the whole file: killed anywhere in it, the table
+// has the old columns with all its rows or the new ones with all of them.
+TEST_F(Crash, AKilledSchemaChangeLeavesTheOldTableOrTheNewOne) {
+  kill_writers(Schema_Writer, Crash_Points * 2 / 3);
 }
 
 }  // namespace

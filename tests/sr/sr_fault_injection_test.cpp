@@ -1,5 +1,6 @@
 // Every file-system call of creating, opening, applying, committing and
-// aborting a persistent table, made to fail one at a time. A counting proxy
+// aborting a persistent table, and of changing its schema, made to fail one
+// at a time. A counting proxy
 // stands in the file-system door; each scripted step runs once to count its
 // calls of each kind, then once per call and errno with exactly that call
 // failing: ENOSPC, EIO, or EINTR on the call and on every retry of it. Each
@@ -225,6 +226,8 @@ rows_t applied_rows() {
 rows_t rows_in(sr_opaque_handle_t table, uint32_t uncommitted) {
   return sr_test::rows_in<std::string>(table, "name", uncommitted);
 }
+
+std::string table_image(sr_opaque_handle_t table);
 
 // ---- The fixture ------------------------------------------------------
 
@@ -473,6 +476,17 @@ class FaultInjection : public ::testing::Test {
 
   std::string table_file() const { return mount_directory_ + "/t"; }
 
+  // The table as another program finds it in the file.
+  std::string image_on_disk() const {
+    sr_opaque_handle_t tree = mounted_tree(mount_directory_);
+    sr_opaque_handle_t table = nullptr;
+    const int32_t rc = sr_open_table_1(tree, "/disk/t", 1, &table);
+    std::string image =
+        rc == 0 ? table_image(table) : "<the file does not open: " + std::to_string(rc) + ">";
+    EXPECT_EQ(sr_close_tree_1(tree), 0);
+    return image;
+  }
+
   // The committed rows another program finds in the file.
   rows_t rows_on_disk() const {
     sr_opaque_handle_t tree = mounted_tree(mount_directory_);
@@ -502,6 +516,149 @@ TEST_F(FaultInjection, ApplyFailuresKeepTheCommittedFileAndThePendingChanges) {
 
 TEST_F(FaultInjection, CommitAndAbortFailuresLeaveACommittedState) {
   fail_every_call_of({Committing, Aborting}, "commit and abort");
+}
+
+// ---- Schema changes ---------------------------------------------------
+
+// A table as text: each column's name and default, then each row's values
+// in packed order (the columns here are strings and int32s).
+std::string table_image(sr_opaque_handle_t table) {
+  sr_table_metadata_t *p_metadata = nullptr;
+  if (const int32_t rc = sr_get_table_metadata_1(table, -1, &p_metadata); rc != 0) {
+    return "<metadata " + std::to_string(rc) + ">";
+  }
+  std::string image;
+  std::vector<const char *> names;
+  for (uint32_t column = 0; column < p_metadata->number_of_columns; ++column) {
+    const sr_column_t &definition = p_metadata->column_definitions[column];
+    names.push_back(definition.name);
+    image += std::string(definition.name) + "=" +
+             (definition.type == QV_INT32 ? std::to_string(definition.default_value.val_int32)
+                                          : std::string(definition.default_value.ptr_char)) +
+             " ";
+  }
+  for (int32_t at = 0;; ++at) {
+    std::vector<qv_value_t> values(names.size());
+    std::vector<qv_value_t *> pointers;
+    for (qv_value_t &value : values) {
+      pointers.push_back(&value);
+    }
+    const int32_t rc = sr_get_fields_by_index_1(table, at, names.data(), pointers.data(),
+                                                static_cast<uint32_t>(names.size()));
+    if (rc != 0) {
+      image += rc == SR_E_NO_ROW_FOR_INDEX ? "" : "<row " + std::to_string(rc) + ">";
+      break;
+    }
+    image += "|";
+    for (uint32_t column = 0; column < names.size(); ++column) {
+      if (p_metadata->column_definitions[column].type == QV_INT32) {
+        image += " " + std::to_string(values[column].val_int32);
+      } else {
+        image += " " + std::string(values[column].ptr_char);
+        std::free(values[column].ptr_char);
+      }
+    }
+  }
+  sr_free_table_metadata_1(p_metadata);
+  return image;
+}
+
+struct schema_change_t {
+  const char *p_name;
+  int32_t (*change)(sr_opaque_handle_t table);
+};
+
+const schema_change_t Schema_Changes[] = {
+    {"add a column",
+     [](sr_opaque_handle_t table) {
+       sr_column_t port = column("port", QV_INT32);
+       port.default_value.val_int32 = 80;
+       return sr_add_columns_1(table, &port, 1);
+     }},
+    {"delete a column",
+     [](sr_opaque_handle_t table) {
+       const char *count = "count";
+       return sr_delete_columns_1(table, &count, 1);
+     }},
+    {"rename a column",
+     [](sr_opaque_handle_t table) { return sr_change_column_name_1(table, "count", "total"); }},
+    {"change a default",
+     [](sr_opaque_handle_t table) {
+       return sr_change_default_value_1(table, "count", int32_value(5));
+     }},
+};
+
+// A failed schema change leaves the table in memory and its file as they
+// were and can be retried, unless the call that failed was the flush of the
+// directory after the new file took the old one's name: then both hold the
+// new table, and the code says the rename may not be durable.
+TEST_F(FaultInjection, SchemaChangeFailuresLeaveTheTableAndItsFileAsTheyWere) {
+  const step_t schema_step{"schema change", Committing, true, {}};
+  int injected = 0;
+  for (const schema_change_t &change : Schema_Changes) {
+    // A first run counts the calls and gives the images before and after.
+    std::filesystem::remove_all(mount_directory_);
+    std::filesystem::create_directory(mount_directory_);
+    ASSERT_NE(tree_ = mounted_tree(mount_directory_), nullptr);
+    sr_opaque_handle_t table = nullptr;
+    ASSERT_NO_FATAL_FAILURE(create_committed(&table));
+    const std::string old_image = table_image(table);
+    Injector = injector_t{};
+    ASSERT_EQ(change.change(table), 0) << change.p_name;
+    int counts[Total_Kinds];
+    std::copy(std::begin(Injector.counts), std::end(Injector.counts), counts);
+    const std::string new_image = table_image(table);
+    ASSERT_NE(new_image, old_image);
+    EXPECT_EQ(sr_close_tree_1(tree_), 0);
+    for (const call_kind kind : {Open, Lock, Writev, Fsync, Rename}) {
+      EXPECT_GT(counts[kind], 0) << change.p_name << " made no " << Call_Names[kind] << " call";
+    }
+
+    for (int kind = 0; kind < Total_Kinds; ++kind) {
+      for (int index = 1; index <= counts[kind]; ++index) {
+        for (const int error : {ENOSPC, EIO, EINTR}) {
+          const fault_t fault{static_cast<call_kind>(kind), index, error, recovery_t::retry};
+          SCOPED_TRACE(std::string(change.p_name) + ": " + Call_Names[kind] + " #" +
+                       std::to_string(index) + " fails with errno " + std::to_string(error));
+          ++injected;
+          std::filesystem::remove_all(mount_directory_);
+          std::filesystem::create_directory(mount_directory_);
+          ASSERT_NE(tree_ = mounted_tree(mount_directory_), nullptr);
+          ASSERT_NO_FATAL_FAILURE(create_committed(&table));
+          cu_set_no_error_1();
+          Injector = injector_t{.target = fault.kind, .index = index, .error = error};
+          const int32_t rc = change.change(table);
+          Injector.target = Injector.interrupted = Total_Kinds;
+          ASSERT_GT(Injector.failures, 0) << "the call did not fail";
+          ASSERT_EQ(rc, expected_code(schema_step, fault.kind, error));
+          if (rc != 0) {
+            expect_message(rc, fault);
+          }
+          const std::string image = table_image(table);
+          const bool renamed = image == new_image;
+          if (renamed && rc != 0) {
+            EXPECT_TRUE(fault.kind == Open || fault.kind == Fsync)
+                << "only a failed flush of the directory may follow the rename";
+          }
+          if (!renamed) {
+            EXPECT_EQ(image, old_image) << "the table in memory changed";
+            EXPECT_EQ(image_on_disk(), old_image) << "the file changed";
+            EXPECT_FALSE(std::filesystem::exists(table_file() + ".rewrite"));
+            ASSERT_EQ(change.change(table), 0) << "the change cannot be retried";
+          }
+          EXPECT_EQ(table_image(table), new_image);
+          EXPECT_EQ(image_on_disk(), new_image);
+          // The rebuilt table takes a further transaction into its new file.
+          ASSERT_EQ(add_fields(table, {{"name", string_value("late")}}), 0);
+          ASSERT_EQ(sr_apply_1(table, 0), 0);
+          ASSERT_EQ(sr_commit_1(table), 0);
+          EXPECT_EQ(image_on_disk(), table_image(table));
+          EXPECT_EQ(sr_close_tree_1(tree_), 0);
+        }
+      }
+    }
+  }
+  std::printf("[ injected ] schema changes: %d calls x errnos\n", injected);
 }
 
 // A read-only table turning writable is read again from its file, and finds

@@ -336,13 +336,13 @@ struct commit_window {
 
 // The scripted run: creation, then phases of single changes through an
 // implicitly controlled handle and of multi-row transactions through an
-// explicitly controlled one. The same seed gives the same calls in the same
-// order on every run. Returns the commits of the run; `problem` is set when
-// a call failed.
+// explicitly controlled one, with a schema change every sixth step. The same seed gives the same
+// calls in the same order on every run. Returns the commits of the run; `problem` is set when a
+// call failed.
 std::vector<commit_window> run_script(const std::string &directory, std::string &problem) {
   std::mt19937 rng(script_seed());
   random_changes changes{rng, Payload_Spread, 12, 50};
-  table_state state{true, 1, {}};
+  table_state state{true, 1, {}, {}};
   sr_opaque_handle_t tree = mounted_tree(directory);
   sr_opaque_handle_t table = nullptr;
   const uint64_t first_call = P_Platter->calls;
@@ -366,8 +366,12 @@ std::vector<commit_window> run_script(const std::string &directory, std::string 
     const auto note_first_call = [&](const char *, const table_state &) {
       first = P_Platter->calls;
     };
-    problem = implicit ? changes.implicit_change(table, state, false, note_first_call)
-                       : changes.explicit_transaction(table, state, 6, note_first_call);
+    if (step % 6 == 5) {
+      problem = changes.schema_change(table, state, note_first_call);
+    } else {
+      problem = implicit ? changes.implicit_change(table, state, false, note_first_call)
+                         : changes.explicit_transaction(table, state, 6, note_first_call);
+    }
     if (first != UINT64_MAX) {
       windows.push_back({first, P_Platter->calls, state});
     }

@@ -2,7 +2,8 @@
 // are serialised by the lock on the table file: each one waits in its open
 // until the other has closed the table, and then reads what the other
 // committed, so no update is lost. A reader takes no lock and, while a
-// writer appends and rewrites, only ever finds committed states.
+// writer appends, rewrites or changes the schema, only ever finds committed
+// states.
 
 #include <gtest/gtest.h>
 #include <signal.h>
@@ -14,9 +15,11 @@
 #include <cstdlib>
 #include <filesystem>
 #include <iostream>
+#include <random>
 #include <set>
 #include <string>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "frame/sr_i_frame.h"
@@ -265,6 +268,107 @@ TEST_F(Processes, AReaderSeesOnlyCommittedStatesWhileAWriterWorks) {
   EXPECT_TRUE(found == state_after(Transactions)) << describe(found);
   std::cout << "reads: " << reads << ", distinct committed states seen: " << states_seen.size()
             << " of " << Transactions + 1 << "\n";
+}
+
+// The columns added behind Id, Version and Payload after `k` schema
+// changes: change j adds "C<j>" (default j) when j % 4 is 1, renames the
+// newest column to "R<j>" when 2, gives the oldest the default j when 3,
+// and deletes the oldest when 0.
+using added_columns = std::vector<std::pair<std::string, int32_t>>;
+added_columns columns_after(int k) {
+  added_columns columns;
+  for (int j = 1; j <= k; ++j) {
+    switch (j % 4) {
+      case 1:
+        columns.emplace_back("C" + std::to_string(j), j);
+        break;
+      case 2:
+        columns.back().first = "R" + std::to_string(j);
+        break;
+      case 3:
+        columns.front().second = j;
+        break;
+      default:
+        columns.erase(columns.begin());
+    }
+  }
+  return columns;
+}
+
+// Makes schema change j of a table whose columns are `before`.
+int32_t change_schema(sr_opaque_handle_t table, int j, const added_columns &before) {
+  switch (j % 4) {
+    case 1: {
+      const std::string name = "C" + std::to_string(j);
+      sr_column_t added = sr_test::column(name.c_str(), QV_INT32);
+      added.default_value.val_int32 = j;
+      return sr_add_columns_1(table, &added, 1);
+    }
+    case 2:
+      return sr_change_column_name_1(table, before.back().first.c_str(),
+                                     ("R" + std::to_string(j)).c_str());
+    case 3:
+      return sr_change_default_value_1(table, before.front().first.c_str(), int32_value(j));
+    default: {
+      const char *p_name = before.front().first.c_str();
+      return sr_delete_columns_1(table, &p_name, 1);
+    }
+  }
+}
+
+// Each schema change writes a new file and renames it over the old one: a
+// reader opening the table meanwhile finds the old table or the new one,
+// all of its rows with all of their columns.
+TEST_F(Processes, AReaderSeesTheOldOrTheNewSchemaWhileAWriterChangesIt) {
+  constexpr int Changes = 60;
+  constexpr uint32_t Payload_Spread = 100;
+  constexpr uint64_t Filled_Counter = 2;
+  create_table(4);
+  {
+    sr_opaque_handle_t tree = mounted_tree();
+    sr_opaque_handle_t table = nullptr;
+    ASSERT_EQ(open_table(tree, Table_Path, Open_Explicit, &table), 0);
+    std::mt19937 rng(1);
+    random_changes changes{rng, Payload_Spread, 0, 0};
+    table_state filled{true, 1, {}, {}};
+    ASSERT_EQ(changes.fill(table, filled, 500), "");
+    ASSERT_EQ(filled.counter, Filled_Counter);
+    ASSERT_EQ(sr_close_tree_1(tree), 0);
+  }
+  table_state expected;
+  ASSERT_EQ(read_table(expected, Payload_Spread), "");
+  const pid_t writer = start_process([this] {
+    sr_opaque_handle_t tree = mounted_tree();
+    sr_opaque_handle_t table = nullptr;
+    if (tree == nullptr || open_table(tree, Table_Path, Open_Explicit, &table) != 0) {
+      return 2;
+    }
+    for (int j = 1; j <= Changes; ++j) {
+      if (change_schema(table, j, columns_after(j - 1)) != 0) {
+        return 3;
+      }
+    }
+    return sr_close_tree_1(tree) == 0 ? 0 : 4;
+  });
+
+  int reads = 0, status = 0;
+  std::set<uint64_t> states_seen;
+  table_state found;
+  for (pid_t ended = 0; ended == 0; ++reads) {
+    ended = waitpid(writer, &status, WNOHANG);
+    ASSERT_EQ(read_table(found, Payload_Spread), "") << "read " << reads;
+    const auto k = static_cast<int>(found.counter - Filled_Counter);
+    expected.counter = found.counter;
+    expected.columns = columns_after(k);
+    ASSERT_TRUE(k >= 0 && k <= Changes && found == expected)
+        << "read " << reads << " found a table never committed: " << describe(found);
+    states_seen.insert(found.counter);
+  }
+  ASSERT_TRUE(WIFEXITED(status)) << status;
+  EXPECT_EQ(WEXITSTATUS(status), 0) << "the writer failed";
+  EXPECT_EQ(found.counter, Filled_Counter + Changes);
+  std::cout << "reads: " << reads << ", distinct schemas seen: " << states_seen.size() << " of "
+            << Changes + 1 << "\n";
 }
 
 }  // namespace

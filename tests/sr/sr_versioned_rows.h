@@ -7,6 +7,8 @@
 #ifndef SR_VERSIONED_ROWS_H
 #define SR_VERSIONED_ROWS_H
 
+#include <algorithm>
+#include <cstddef>
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
@@ -16,6 +18,8 @@
 #include <set>
 #include <sstream>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "qv_sr.h"
 #include "rows/sr_i_transaction.h"
@@ -83,17 +87,19 @@ inline int32_t set_row(sr_opaque_handle_t table, int32_t id, int32_t version, ui
                                 2);
 }
 
-// A committed state: whether the table exists, its change counter and each
-// row's Version by Id.
+// A committed state: whether the table exists, its change counter, each
+// row's Version by Id, and the int32 columns that schema changes added
+// behind the first three, in order, with their defaults.
 struct table_state {
   bool exists = false;
   uint64_t counter = 0;
   std::map<int32_t, int32_t> rows;
+  std::vector<std::pair<std::string, int32_t>> columns;
   bool operator==(const table_state &) const = default;
 };
 
-// A state as text, "no table" or "counter 3: 1v2 5v1" (Id v Version), and
-// the state such a text describes.
+// A state as text, "no table" or "counter 3: 1v2 5v1 | C1=7 C4=0" (Id v
+// Version, then the added columns), and the state such a text describes.
 inline std::string describe(const table_state &state) {
   if (!state.exists) {
     return "no table";
@@ -101,6 +107,10 @@ inline std::string describe(const table_state &state) {
   std::string text = "counter " + std::to_string(state.counter) + ":";
   for (const auto &[id, version] : state.rows) {
     text += " " + std::to_string(id) + "v" + std::to_string(version);
+  }
+  text += " |";
+  for (const auto &[name, default_value] : state.columns) {
+    text += " " + name + "=" + std::to_string(default_value);
   }
   return text;
 }
@@ -114,6 +124,12 @@ inline table_state parse_state(const std::string &text) {
   for (int32_t id, version; in >> id >> separator >> version;) {
     state.rows[id] = version;
   }
+  in.clear();
+  in >> separator;  // the "|"
+  for (std::string column; in >> column;) {
+    const size_t equals = column.find('=');
+    state.columns.emplace_back(column.substr(0, equals), std::atoi(column.c_str() + equals + 1));
+  }
   return state;
 }
 
@@ -121,19 +137,35 @@ inline table_state parse_state(const std::string &text) {
 // what went wrong (a failed read, a row this test does not write).
 inline std::string read_rows(sr_opaque_handle_t table, table_state &state, uint32_t spread) {
   sr_table_metadata_t *p_metadata = nullptr;
-  if (const int32_t rc = sr_get_table_metadata_1(table, 0, &p_metadata); rc != 0) {
+  if (const int32_t rc = sr_get_table_metadata_1(table, -1, &p_metadata); rc != 0) {
     return "sr_get_table_metadata_1 gave " + std::to_string(rc);
   }
   state.exists = true;
   state.counter = p_metadata->table_change_counter;
   state.rows.clear();
+  state.columns.clear();
   const uint32_t total_rows = p_metadata->number_of_rows;
+  for (uint32_t column = 3; column < p_metadata->number_of_columns; ++column) {
+    const sr_column_t &definition = p_metadata->column_definitions[column];
+    state.columns.emplace_back(definition.name, definition.default_value.val_int32);
+  }
   sr_free_table_metadata_1(p_metadata);
   for (uint32_t at = 0; at < total_rows; ++at) {
+    // Every column of every row is read: a row short of a column the
+    // table lists would fail here.
     sr_test::field_list row{{"Id", {}}, {"Version", {}}, {"Payload", {}}};
+    for (const auto &[name, default_value] : state.columns) {
+      row.names.push_back(name.c_str());
+      row.values.emplace_back();
+    }
+    row.pointers.clear();
+    for (qv_value_t &value : row.values) {
+      row.pointers.push_back(&value);
+    }
     const qv_value_t &id = row.values[0], &version = row.values[1], &text = row.values[2];
-    if (const int32_t rc = sr_get_fields_by_index_1(table, static_cast<int32_t>(at),
-                                                    row.names.data(), row.pointers.data(), 3);
+    if (const int32_t rc =
+            sr_get_fields_by_index_1(table, static_cast<int32_t>(at), row.names.data(),
+                                     row.pointers.data(), static_cast<uint32_t>(row.names.size()));
         rc != 0) {
       return "row " + std::to_string(at) + " gave " + std::to_string(rc);
     }
@@ -249,6 +281,76 @@ class random_changes {
     return "";
   }
 
+  // One schema change of a committed table: an int32 column added, or one
+  // of the added columns deleted, renamed or given a new default. `state`
+  // becomes the new committed state.
+  std::string schema_change(sr_opaque_handle_t table, table_state &state,
+                            const listener &announce = {}) {
+    table_state next = state;
+    ++next.counter;
+    auto &columns = next.columns;
+    const int kind = columns.empty() ? 0 : static_cast<int>(rng_() % 4);
+    const size_t at = columns.empty() ? 0 : rng_() % columns.size();
+    const int32_t default_value = static_cast<int32_t>(rng_() % 1000);
+    const std::string old_name = columns.empty() ? "" : columns[at].first;
+    if (kind == 0) {
+      columns.emplace_back(fresh_column_name(columns), default_value);
+    } else if (kind == 1) {
+      columns.erase(columns.begin() + static_cast<std::ptrdiff_t>(at));
+    } else if (kind == 2) {
+      columns[at].first = fresh_column_name(columns);
+    } else {
+      columns[at].second = default_value;
+    }
+    const char *const kinds[] = {"add-column", "delete-column", "rename-column", "new-default"};
+    if (announce) {
+      announce(kinds[kind], next);
+    }
+    int32_t rc;
+    if (kind == 0) {
+      sr_column_t added = sr_test::column(columns.back().first.c_str(), QV_INT32);
+      added.default_value.val_int32 = default_value;
+      rc = sr_add_columns_1(table, &added, 1);
+    } else if (kind == 1) {
+      const char *p_name = old_name.c_str();
+      rc = sr_delete_columns_1(table, &p_name, 1);
+    } else if (kind == 2) {
+      rc = sr_change_column_name_1(table, old_name.c_str(), columns[at].first.c_str());
+    } else {
+      rc = sr_change_default_value_1(table, old_name.c_str(), int32_value(default_value));
+    }
+    if (rc != 0) {
+      return std::string(kinds[kind]) + " gave " + std::to_string(rc);
+    }
+    state = next;
+    return "";
+  }
+
+  // Adds `total` new rows in one transaction of an explicitly controlled
+  // handle, as a program loading a table does.
+  std::string fill(sr_opaque_handle_t table, table_state &state, uint32_t total,
+                   const listener &announce = {}) {
+    table_state next = state;
+    ++next.counter;
+    const int32_t first_id = next_id;
+    for (uint32_t added = 0; added < total; ++added) {
+      next.rows[next_id++] = 1;
+    }
+    if (announce) {
+      announce("fill", next);
+    }
+    for (int32_t id = first_id; id < next_id; ++id) {
+      if (const int32_t rc = add_row(table, id, 1, spread_); rc != 0) {
+        return "adding a row gave " + std::to_string(rc);
+      }
+    }
+    if (const int32_t rc = sr_apply_1(table, 0); rc != 0 || sr_commit_1(table) != 0) {
+      return "the fill's apply or commit failed";
+    }
+    state = next;
+    return "";
+  }
+
  private:
   // A new row, a new version of any row, or any row deleted, as `next`
   // records it; the row count stays within its bounds.
@@ -288,6 +390,16 @@ class random_changes {
         return by_index ? sr_delete_row_by_index_1(table, static_cast<uint32_t>(at))
                         : sr_delete_rows_1(table, "Id == $i", id.val_int32);
     }
+  }
+
+  // "C" and a number above every added column's.
+  static std::string fresh_column_name(
+      const std::vector<std::pair<std::string, int32_t>> &columns) {
+    int highest = 0;
+    for (const auto &[name, default_value] : columns) {
+      highest = std::max(highest, std::atoi(name.c_str() + 1));
+    }
+    return "C" + std::to_string(highest + 1);
   }
 
   std::mt19937 &rng_;

@@ -176,10 +176,6 @@ int32_t sr_i_copy_row(const sr_i_table_t *p_table, const void *p_from_record_dat
     sr_i_row_builder builder(p_new_table);
     const unsigned char *p_variable = sr_i_row_variable_part(p_table, p_from_record_data);
     for (uint32_t column = 0; column < p_new_table->total_columns; ++column) {
-      if (p_column_indices[column] == Sr_Default_Value_Column) {
-        builder.copy_default(column);
-        continue;
-      }
       const unsigned char *p_slot = sr_i_row_slot(p_from_record_data, p_column_indices[column]);
       if (sr_i_is_variable_length(p_new_table->p_columns[column].type)) {
         const qv_pmsg_value_anchor_t anchor = sr_i_slot_anchor(p_slot);

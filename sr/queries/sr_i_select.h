@@ -35,16 +35,11 @@ int32_t sr_i_select(sr_i_table_t *p_table, const char *const *p_column_names,
 int32_t sr_i_select_columns(sr_i_table_t *p_table, std::span<const uint32_t> source_columns,
                             const char *p_selection_criteria, sr_i_table_t **pp_select_table);
 
-/* In a column list of sr_i_copy_row: the new table's default value, for a
- * column the source does not have. */
-inline constexpr uint32_t Sr_Default_Value_Column = UINT32_MAX;
-
 /*
  * Copies the row record `p_from_record_data` of `p_table` into `p_new_table`
  * as a committed row: whole when `p_column_indices` is null, otherwise the
- * source columns it lists (or Sr_Default_Value_Column), one per column of
- * the new table. The new table's index must have a free entry. Returns 0,
- * 12 or 15 (raised).
+ * source columns it lists, one per column of the new table. The new
+ * table's index must have a free entry. Returns 0, 12 or 15 (raised).
  */
 int32_t sr_i_copy_row(const sr_i_table_t *p_table, const void *p_from_record_data,
                       sr_i_table_t *p_new_table, const uint32_t *p_column_indices);

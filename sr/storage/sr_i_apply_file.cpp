@@ -13,8 +13,10 @@
 
 #include <fcntl.h>
 
+#include <algorithm>
 #include <cstdlib>
 #include <cstring>
+#include <memory>
 #include <new>
 #include <utility>
 #include <vector>
@@ -29,6 +31,9 @@
 namespace {
 
 constexpr int Gathered_Records = 16;
+// A gathered write stays well below the 2 GiB one call can take.
+constexpr size_t Largest_Piece = size_t{64} << 20;
+constexpr size_t Staging_Bytes = size_t{1} << 20;
 constexpr uint32_t Large_File_Bytes = 16384;
 constexpr uint32_t Least_Live_Percentage = 50;
 
@@ -38,14 +43,50 @@ uint32_t memory_record_length(void *p_record) {
   return sr_i_rb_record_header(p_record)->record_length;
 }
 
-// Collects records and writes them sixteen to a gathered write.
+// Collects records and writes them sixteen pieces to a gathered write. A
+// record that lies right behind the one before in memory extends that
+// piece. Rows are put in their disk form into the writer's staging buffer,
+// back to back, so a rewrite of a large table takes a call per megabyte,
+// and the buffer, written out whenever it is full, is all the memory the
+// write needs whatever the table's size.
 class record_writer {
  public:
   record_writer(int fd, const std::string &path) : fd_(fd), p_path_(path.c_str()) {}
 
+  // Room for the disk form of a record of `length` bytes, which the caller
+  // fills and then adds. 0 or 12, or the code of writing out what the
+  // buffer held.
+  int32_t stage(uint32_t length, unsigned char **pp_bytes) {
+    if (staged_ + length > staging_capacity_) {
+      if (const int32_t rc = finish(); rc != 0) {
+        return rc;
+      }
+      staged_ = 0;
+      if (length > staging_capacity_ || staging_ == nullptr) {
+        const size_t capacity = std::max<size_t>(length, Staging_Bytes);
+        staging_.reset(new (std::nothrow) unsigned char[capacity]);
+        staging_capacity_ = staging_ != nullptr ? capacity : 0;
+        if (staging_ == nullptr) {
+          return sr_i_raise_no_memory();
+        }
+      }
+    }
+    *pp_bytes = staging_.get() + staged_;
+    staged_ += length;
+    return 0;
+  }
+
   int32_t add(const void *p_bytes, uint32_t length) {
-    batch_[count_] = {const_cast<void *>(p_bytes), length};
     batch_bytes_ += length;
+    if (count_ > 0) {
+      iovec &last = batch_[count_ - 1];
+      if (static_cast<const unsigned char *>(last.iov_base) + last.iov_len == p_bytes &&
+          last.iov_len + length <= Largest_Piece) {
+        last.iov_len += length;
+        return 0;
+      }
+    }
+    batch_[count_] = {const_cast<void *>(p_bytes), length};
     return ++count_ == Gathered_Records ? flush_batch() : 0;
   }
 
@@ -63,6 +104,10 @@ class record_writer {
 
   int fd_;
   const char *p_path_;
+  // Not cleared: every staged byte is written before it is read.
+  std::unique_ptr<unsigned char[]> staging_;
+  size_t staging_capacity_ = 0;
+  size_t staged_ = 0;
   iovec batch_[Gathered_Records] = {};
   int count_ = 0;
   uint32_t batch_bytes_ = 0;
@@ -113,36 +158,30 @@ int32_t append(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_r
   if (const int32_t rc = sr_i_seek(file.fd, start); rc != 0) {
     return rc;
   }
-  size_t row_bytes = 0;
-  for (auto *p_change = p_table->p_rows_change_list; p_change; p_change = p_change->p_next) {
-    if (p_change->p_index_entry->p_applied != nullptr) {
-      row_bytes += memory_record_length(p_change->p_index_entry->p_applied);
-    }
-  }
-  std::vector<unsigned char> rows;
   std::vector<uint32_t> deletion;
   try {
-    rows.resize(row_bytes);
     deletion.assign(4 + p_table->applied_deletions, 0);
   } catch (const std::bad_alloc &) {
     return sr_i_raise_no_memory();
   }
   record_writer writer(file.fd, file.path);
   uint32_t offset = start;
-  size_t at = 0;
   for (auto *p_change = p_table->p_rows_change_list; p_change; p_change = p_change->p_next) {
     sr_i_index_entry_t *p_entry = p_change->p_index_entry;
     if (p_entry->p_applied == nullptr) {
       continue;
     }
     const uint32_t disk_length = memory_record_length(p_entry->p_applied) - Sr_Memory_Record_Extra;
-    put_row_record(&rows[at], p_entry->p_applied, nullptr);
-    p_entry->applied_file_offset = offset;
-    sr_i_rb_record_header(p_entry->p_applied)->disk_table_offset = offset;
-    if (const int32_t rc = writer.add(&rows[at], disk_length); rc != 0) {
+    unsigned char *p_disk = nullptr;
+    if (const int32_t rc = writer.stage(disk_length, &p_disk); rc != 0) {
       return rc;
     }
-    at += disk_length;
+    put_row_record(p_disk, p_entry->p_applied, nullptr);
+    p_entry->applied_file_offset = offset;
+    sr_i_rb_record_header(p_entry->p_applied)->disk_table_offset = offset;
+    if (const int32_t rc = writer.add(p_disk, disk_length); rc != 0) {
+      return rc;
+    }
     offset += disk_length;
   }
   // Rows added and deleted within the transaction never reached the file.
@@ -193,28 +232,13 @@ int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned cha
     return rc;
   }
   const uint32_t live_rows = p_table->total_applied_rows - p_table->applied_deletions;
-  size_t row_bytes = 0;
-  uint32_t seen = 0;
-  for (uint32_t position = 0; position < p_table->maximum_rows && seen < live_rows; ++position) {
-    if (void *p_record = p_table->p_rows_fixed_index[position].p_applied) {
-      row_bytes += memory_record_length(p_record);
-      ++seen;
-    }
-  }
-  std::vector<unsigned char> rows;
-  try {
-    rows.resize(row_bytes);
-  } catch (const std::bad_alloc &) {
-    return sr_i_raise_no_memory();
-  }
   record_writer writer(file.rewrite_fd, file.rewrite_path);
   if (const int32_t rc = writer.add(metadata.data(), static_cast<uint32_t>(metadata.size()));
       rc != 0) {
     return rc;
   }
   auto offset = static_cast<uint32_t>(metadata.size());
-  size_t at = 0;
-  seen = 0;
+  uint32_t seen = 0;
   const uint32_t no_earlier_version = 0;
   for (uint32_t position = 0; position < p_table->maximum_rows && seen < live_rows; ++position) {
     sr_i_index_entry_t &entry = p_table->p_rows_fixed_index[position];
@@ -223,13 +247,16 @@ int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned cha
     }
     ++seen;
     const uint32_t disk_length = memory_record_length(entry.p_applied) - Sr_Memory_Record_Extra;
-    put_row_record(&rows[at], entry.p_applied, &no_earlier_version);
-    entry.applied_file_offset = offset;
-    sr_i_rb_record_header(entry.p_applied)->disk_table_offset = offset;
-    if (const int32_t rc = writer.add(&rows[at], disk_length); rc != 0) {
+    unsigned char *p_disk = nullptr;
+    if (const int32_t rc = writer.stage(disk_length, &p_disk); rc != 0) {
       return rc;
     }
-    at += disk_length;
+    put_row_record(p_disk, entry.p_applied, &no_earlier_version);
+    entry.applied_file_offset = offset;
+    sr_i_rb_record_header(entry.p_applied)->disk_table_offset = offset;
+    if (const int32_t rc = writer.add(p_disk, disk_length); rc != 0) {
+      return rc;
+    }
     offset += disk_length;
   }
   if (const int32_t rc = finish_with_commit_record(writer, offset, commit_record, file.rewrite_fd,

@@ -146,13 +146,10 @@ int32_t make_result_table(const sr_i_table_t *p_table, std::span<const uint32_t>
       rc != 0) {
     return rc;
   }
-  if (const sr_hash_table_t *p_hash_table = p_table->p_rows_hash_table; p_hash_table != nullptr) {
-    if (const int32_t rc =
-            sr_i_hash_table_open(p_hash_table->total_hash_buckets, p_hash_table->p_hash_function,
-                                 p_hash_table->p_compare_function, &p_new_table->p_rows_hash_table);
-        rc != 0) {
-      return rc;
-    }
+  if (const int32_t rc =
+          sr_i_hash_table_open_like(p_table->p_rows_hash_table, &p_new_table->p_rows_hash_table);
+      rc != 0) {
+    return rc;
   }
   return sr_i_open_key_hash_and_metadata(p_new_table);
 }

@@ -45,17 +45,6 @@ int32_t find_visible_column(const sr_table_metadata_t &metadata, const char *p_n
   return -1;
 }
 
-// An empty key hash table like the one of `p_table`, or null for none.
-int32_t open_hash_table_like(const sr_i_table_t *p_table, sr_hash_table_t **pp_hash_table) {
-  *pp_hash_table = nullptr;
-  const sr_hash_table_t *p_hash_table = p_table->p_rows_hash_table;
-  if (p_hash_table == nullptr) {
-    return 0;
-  }
-  return sr_i_hash_table_open(p_hash_table->total_hash_buckets, p_hash_table->p_hash_function,
-                              p_hash_table->p_compare_function, pp_hash_table);
-}
-
 // Pool room for every row of `p_table` copied with the added columns of
 // `p_new_table` (those past the old count) at their defaults.
 int32_t make_room_for_rows(const sr_i_table_t *p_table, sr_i_table_t *p_new_table) {
@@ -206,7 +195,8 @@ int32_t sr_i_update_metadata(sr_i_table_t *p_table, const sr_column_t *p_new_col
     }
   }
   sr_hash_table_t *p_hash_table = nullptr;
-  if (const int32_t rc = open_hash_table_like(p_table, &p_hash_table); rc != 0) {
+  if (const int32_t rc = sr_i_hash_table_open_like(p_table->p_rows_hash_table, &p_hash_table);
+      rc != 0) {
     return rc;
   }
   sr_i_table_t *p_new_table = nullptr;

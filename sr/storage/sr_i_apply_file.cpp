@@ -9,7 +9,8 @@
 // overwritten with 0 (so the reader goes on to the new one), or the rewrite
 // file is renamed onto the table file. A crash at any moment leaves the
 // file at the old committed state or at the new one. Abort cuts the
-// appended tail off again, or removes the rewrite file.
+// appended tail off again, or removes the rewrite file. The writer of the
+// rewrite file also makes the file of a copy of a table.
 
 #include <fcntl.h>
 
@@ -223,16 +224,21 @@ void discard_rewrite_file(sr_i_table_file_t &file) {
   file.rewrite_length = 0;
 }
 
-// Writes the live rows into the rewrite file.
-int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_record) {
-  sr_i_table_file_t &file = *p_table->p_file;
+// Writes the metadata record, every live row of the applied view and the
+// commit record as a complete table file to `fd`, and flushes it; the
+// file's length goes to `*p_length` and the commit record's place to
+// `*p_commit_record`. With `record_offsets` each row remembers where it now
+// lies, as the table's own rewrite needs; a copy leaves the table as it is.
+int32_t write_image(const sr_i_table_t *p_table, int fd, const std::string &path,
+                    const std::vector<unsigned char> &commit_record, bool record_offsets,
+                    uint32_t *p_length, sr_i_record_place_t *p_commit_record) {
   std::vector<unsigned char> metadata;
   if (const int32_t rc = sr_i_convert_metadata_memory_record_to_disk_record(p_table, metadata);
       rc != 0) {
     return rc;
   }
   const uint32_t live_rows = p_table->total_applied_rows - p_table->applied_deletions;
-  record_writer writer(file.rewrite_fd, file.rewrite_path);
+  record_writer writer(fd, path);
   if (const int32_t rc = writer.add(metadata.data(), static_cast<uint32_t>(metadata.size()));
       rc != 0) {
     return rc;
@@ -252,21 +258,29 @@ int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned cha
       return rc;
     }
     put_row_record(p_disk, entry.p_applied, &no_earlier_version);
-    entry.applied_file_offset = offset;
-    sr_i_rb_record_header(entry.p_applied)->disk_table_offset = offset;
+    if (record_offsets) {
+      entry.applied_file_offset = offset;
+      sr_i_rb_record_header(entry.p_applied)->disk_table_offset = offset;
+    }
     if (const int32_t rc = writer.add(p_disk, disk_length); rc != 0) {
       return rc;
     }
     offset += disk_length;
   }
-  if (const int32_t rc = finish_with_commit_record(writer, offset, commit_record, file.rewrite_fd,
-                                                   file.rewrite_path);
+  if (const int32_t rc = finish_with_commit_record(writer, offset, commit_record, fd, path);
       rc != 0) {
     return rc;
   }
-  file.applied_commit_record = {offset, static_cast<uint32_t>(commit_record.size())};
-  file.rewrite_length = writer.written();
+  *p_commit_record = {offset, static_cast<uint32_t>(commit_record.size())};
+  *p_length = writer.written();
   return 0;
+}
+
+// Writes the live rows into the rewrite file.
+int32_t write_rewrite_file(sr_i_table_t *p_table, const std::vector<unsigned char> &commit_record) {
+  sr_i_table_file_t &file = *p_table->p_file;
+  return write_image(p_table, file.rewrite_fd, file.rewrite_path, commit_record, true,
+                     &file.rewrite_length, &file.applied_commit_record);
 }
 
 // Writes a complete new file beside the table file.
@@ -385,4 +399,16 @@ void sr_i_abort_file(sr_i_table_t *p_table, uint32_t applied) {
     sr_i_flush_file(file.fd, file.path.c_str());
   }
   file.applied_commit_record = file.commit_record;
+}
+
+int32_t sr_i_write_table_file(const sr_i_table_t *p_table, int fd, const std::string &path) {
+  std::vector<unsigned char> commit_record;
+  if (const int32_t rc = sr_i_create_commit_record(p_table->p_application_metadata,
+                                                   p_table->change_counter, commit_record);
+      rc != 0) {
+    return rc;
+  }
+  uint32_t length = 0;
+  sr_i_record_place_t commit_record_place;
+  return write_image(p_table, fd, path, commit_record, false, &length, &commit_record_place);
 }

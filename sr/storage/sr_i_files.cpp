@@ -291,9 +291,16 @@ int32_t sr_i_rename_durably(const char *p_from, const char *p_to, bool *p_rename
     *p_renamed = renamed;
   }
   if (!renamed) {
-    return raise_failure("rename", errno, p_to);
+    return errno == ENOENT ? sr_i_raise(SR_E_NO_TABLE) : raise_failure("rename", errno, p_to);
   }
   return sr_i_flush_directory(directory_of(p_to).c_str());
+}
+
+int32_t sr_i_remove_file_durably(const char *p_path) {
+  if (Sr_File_System.unlink(p_path) != 0) {
+    return errno == ENOENT ? sr_i_raise(SR_E_NO_TABLE) : raise_failure("unlink", errno, p_path);
+  }
+  return sr_i_flush_directory(directory_of(p_path).c_str());
 }
 
 int32_t sr_i_flush_directory(const char *p_directory) {

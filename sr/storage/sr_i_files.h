@@ -96,11 +96,16 @@ int32_t sr_i_is_same_file(int fd, const char *p_path, bool *p_same);
 /*
  * Renames `p_from` onto `p_to` and flushes the directory of `p_to`, so that
  * the new name survives a power loss: until the directory is flushed the
- * file system may still hold the old entry. 0, 206, 16 or 10; when the
- * rename succeeded and only the flush failed, `*p_renamed` (if given) is
- * true, since the file is in place for every reader now.
+ * file system may still hold the old entry. 0, 200 when `p_from` does not
+ * exist, 206, 16 or 10; when the rename succeeded and only the flush
+ * failed, `*p_renamed` (if given) is true, since the file is in place for
+ * every reader now.
  */
 int32_t sr_i_rename_durably(const char *p_from, const char *p_to, bool *p_renamed = nullptr);
+
+/* Removes the file `p_path` and flushes its directory, so that the removal
+ * survives a power loss. 0, 200 when there is no such file, 206, 16 or 10. */
+int32_t sr_i_remove_file_durably(const char *p_path);
 
 /* Flushes the directory `p_directory`: the names created, renamed or
  * removed in it become durable. 0, 206, 16 or 10. */

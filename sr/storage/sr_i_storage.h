@@ -16,6 +16,7 @@
 
 #include <cstdint>
 #include <span>
+#include <string>
 #include <vector>
 
 #include "qv_sr.h"
@@ -104,5 +105,13 @@ int32_t sr_i_commit_file(sr_i_table_t *p_table, uint32_t applied, bool *p_commit
 /* Throws away what the apply wrote: the appended tail cut off, or the
  * rewrite file removed. */
 void sr_i_abort_file(sr_i_table_t *p_table, uint32_t applied);
+
+/*
+ * Writes `p_table` (the rows of its applied view, its application metadata
+ * and change counter) as a complete table file to the empty file `path`,
+ * open as `fd`, and flushes it. The table is not changed. 0 or a raised
+ * code (10, 12, 16, 206).
+ */
+int32_t sr_i_write_table_file(const sr_i_table_t *p_table, int fd, const std::string &path);
 
 #endif /* SR_I_STORAGE_H */

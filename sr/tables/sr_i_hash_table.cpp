@@ -74,6 +74,16 @@ int32_t sr_i_hash_table_open(uint32_t total_hash_buckets, sr_hash_function_t p_h
   return 0;
 }
 
+int32_t sr_i_hash_table_open_like(const sr_hash_table_t *p_hash_table,
+                                  sr_hash_table_t **p_p_hash_table) {
+  *p_p_hash_table = nullptr;
+  if (p_hash_table == nullptr) {
+    return 0;
+  }
+  return sr_i_hash_table_open(p_hash_table->total_hash_buckets, p_hash_table->p_hash_function,
+                              p_hash_table->p_compare_function, p_p_hash_table);
+}
+
 int32_t sr_i_hash_table_close(sr_hash_table_t *p_hash_table) {
   if (p_hash_table == nullptr) {
     return 0;

@@ -57,6 +57,12 @@ int32_t sr_i_hash_table_open(uint32_t total_hash_buckets, sr_hash_function_t p_h
                              sr_hash_keys_compare_function_t p_compare_function,
                              sr_hash_table_t **p_p_hash_table);
 
+/* An empty hash table with the bucket count and functions of
+ * `p_hash_table`, or null in `*p_p_hash_table` for a null one: what a new
+ * image of a table keyed the same way starts from. 0, 12 or 15 (raised). */
+int32_t sr_i_hash_table_open_like(const sr_hash_table_t *p_hash_table,
+                                  sr_hash_table_t **p_p_hash_table);
+
 /* Frees every element, the buckets and the table; a null table is accepted.
  * Returns 0. Row records the elements point into are not touched. */
 int32_t sr_i_hash_table_close(sr_hash_table_t *p_hash_table);

@@ -758,6 +758,77 @@ QV_SR_EXPORT int32_t sr_commit_1(sr_opaque_handle_t table_handle);
 /* Throws away every pending and applied change. Returns 0. */
 QV_SR_EXPORT int32_t sr_abort_1(sr_opaque_handle_t table_handle);
 
+/* ---- Copying, moving and deleting tables ----------------------------------- */
+
+/*
+ * Copies a table to the path `p_target_table_name`, in memory or below a
+ * mount point, whichever kind of table the source is. The copy holds the
+ * source's rows as uncommitted-updates readers see them (pending changes
+ * included), its columns, key hash functions, application metadata and
+ * change counter; the source is not changed. A target that exists is
+ * replaced only with `overwrite` non-zero (SR_E_TABLE_EXISTS otherwise; an
+ * empty target file counts as no table).
+ *
+ * A persistent target is written as "<file>.rewrite", flushed, and renamed
+ * over the target file, the directory flushed: readers in any process find
+ * the old table or the new one, and a copy reported done survives a power
+ * cut. Copies into one mount directory are serialised across processes by
+ * the directory's ",Lock" file, and a writer of the target (another process
+ * with the table open for writing) is waited for. A target open in this
+ * tree is read again from its new file: its handles see the new table and
+ * their later changes go to the new file; it must have nothing pending or
+ * applied (SR_E_UNCOMMITTED). A transient target open in this tree is
+ * replaced; its handles keep the old table, detached from the tree.
+ *
+ * Copying a table onto its own path does nothing with `overwrite`, and
+ * gives SR_E_TABLE_EXISTS without it. Returns 0; SR_E_INVALID_HANDLE;
+ * SR_E_INVALID_PATH; SR_E_TABLE_EXISTS; SR_E_UNCOMMITTED; SR_E_NO_MEMORY;
+ * SR_E_INTERNAL in a forked child; for files, SR_E_NO_TABLE (the source
+ * file is missing), SR_E_ACCESS, SR_E_FILESYSTEM_FULL, SR_E_SYSTEM_CALL. On
+ * failure the target and the source are as they were.
+ */
+QV_SR_EXPORT int32_t sr_copy_table_by_handle_1(sr_opaque_handle_t table_handle,
+                                               const char *p_target_table_name, int32_t overwrite);
+
+/*
+ * As sr_copy_table_by_handle_1, the source named by `p_source_table_name`
+ * in the tree: an open table, or below a mount point a table file no one
+ * has open here (copied byte for byte). SR_E_NO_TABLE when there is no such
+ * table.
+ */
+QV_SR_EXPORT int32_t sr_copy_table_by_name_1(sr_opaque_handle_t tree_handle,
+                                             const char *p_source_table_name,
+                                             const char *p_target_table_name, int32_t overwrite);
+
+/*
+ * Moves a table to `p_target_table_name`: as a copy, after which the source
+ * is gone from its path (and its file from the disk). A table moved into
+ * memory is the same table object under its new name, rows and handles
+ * included, and no longer refers to any file. Handles on a table moved to
+ * disk keep working on the detached table in memory. A table file no one
+ * has open moves to another path below a mount point by one rename (both
+ * paths on one filesystem). Returns as sr_copy_table_by_handle_1.
+ */
+QV_SR_EXPORT int32_t sr_move_table_by_handle_1(sr_opaque_handle_t table_handle,
+                                               const char *p_target_table_name, int32_t overwrite);
+
+/* As sr_move_table_by_handle_1, the source named by path, as for
+ * sr_copy_table_by_name_1. */
+QV_SR_EXPORT int32_t sr_move_table_by_name_1(sr_opaque_handle_t tree_handle,
+                                             const char *p_source_table_name,
+                                             const char *p_target_table_name, int32_t overwrite);
+
+/*
+ * Deletes the table at `p_registry_path`: the path is free at once. Handles
+ * still open on it keep working on the table, now outside the tree, until
+ * they are closed. Below a mount point its file (and any side file) is
+ * removed whether or not the table is open, durably. Returns 0;
+ * SR_E_INVALID_HANDLE; SR_E_INVALID_PATH; SR_E_NO_TABLE when there is no
+ * such table (or file); SR_E_ACCESS, SR_E_FILESYSTEM_FULL, SR_E_SYSTEM_CALL
+ * when the file cannot be removed; SR_E_INTERNAL in a forked child.
+ */
+QV_SR_EXPORT int32_t sr_delete_table_1(sr_opaque_handle_t tree_handle, const char *p_registry_path);
+
 /* ---- Maintenance ---------------------------------------------------------- */
 
 /*

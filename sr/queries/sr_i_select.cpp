@@ -217,11 +217,13 @@ int32_t sr_i_select(sr_i_table_t *p_table, const char *const *p_column_names,
       columns.push_back(column);
     }
   }
-  return sr_i_select_columns(p_table, columns, p_selection_criteria, pp_select_table);
+  return sr_i_select_columns(p_table, columns, p_selection_criteria,
+                             p_table->uncommitted_updates_visible, pp_select_table);
 }
 
 int32_t sr_i_select_columns(sr_i_table_t *p_table, std::span<const uint32_t> columns,
-                            const char *p_selection_criteria, sr_i_table_t **pp_select_table) {
+                            const char *p_selection_criteria, uint32_t uncommitted_updates_visible,
+                            sr_i_table_t **pp_select_table) {
   sr_i_table_t *p_new_table = sr_i_create_null_table();
   if (p_new_table == nullptr) {
     return SR_E_NO_MEMORY;
@@ -235,7 +237,7 @@ int32_t sr_i_select_columns(sr_i_table_t *p_table, std::span<const uint32_t> col
     return rc;
   }
   const uint32_t *p_column_indices = copies_whole_rows(p_table, columns) ? nullptr : columns.data();
-  const table_view view{p_table->uncommitted_updates_visible != 0};
+  const table_view view{uncommitted_updates_visible != 0};
   const auto copy_if_matching = [&](uint32_t, const sr_i_index_entry_t &, const void *p_record) {
     bool matches = false;
     int32_t copy_rc = criteria.matches(p_table, p_record, &matches);

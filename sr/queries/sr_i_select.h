@@ -29,11 +29,14 @@ int32_t sr_i_select(sr_i_table_t *p_table, const char *const *p_column_names,
 
 /*
  * sr_i_select with the source columns given by position (`source_columns`,
- * the key's 0 first; a position may come twice): what deleting columns
- * keeps is a selection of the columns left, invisible ones included.
+ * the key's 0 first; a position may come twice), in the applied view when
+ * `uncommitted_updates_visible` is set, else the committed one: what
+ * deleting columns keeps is a selection of the columns left, invisible
+ * ones included, and a copy of a table in memory is a selection of all.
  */
 int32_t sr_i_select_columns(sr_i_table_t *p_table, std::span<const uint32_t> source_columns,
-                            const char *p_selection_criteria, sr_i_table_t **pp_select_table);
+                            const char *p_selection_criteria, uint32_t uncommitted_updates_visible,
+                            sr_i_table_t **pp_select_table);
 
 /*
  * Copies the row record `p_from_record_data` of `p_table` into `p_new_table`

@@ -39,5 +39,5 @@ int32_t sr_i_delete_columns(sr_i_table_t *p_table, const char *const *p_column_n
       kept.push_back(column);
     }
   }
-  return sr_i_select_columns(p_table, kept, nullptr, pp_result_table);
+  return sr_i_select_columns(p_table, kept, nullptr, 0, pp_result_table);
 }

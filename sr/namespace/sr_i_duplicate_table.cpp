@@ -1,0 +1,389 @@
+// sr_i_duplicate_table.cpp - the engine of copying and moving tables: a
+// source (an open table, or a table file no one has open here) carried to a
+// target path in memory or on disk.
+//
+// A persistent target gets a complete new file, written beside it and
+// renamed over it under the target locks, so that its readers find the old
+// table or the new one; a target open in this tree is then read again from
+// the new file into its own object, so its handles go on with the new
+// content. A transient target is a table object entered in the tree: the
+// source object itself when it moves (its handles move with it), a copy
+// when it is kept, or the source file loaded into memory. The source is
+// removed only once the target is complete.
+
+#include <fcntl.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <utility>
+#include <vector>
+
+#include "frame/sr_i_errors.h"
+#include "frame/sr_i_paths.h"
+#include "namespace/sr_i_namespace.h"
+#include "queries/sr_i_select.h"
+#include "schema/sr_i_application_metadata.h"
+#include "schema/sr_i_schema_changes.h"
+#include "storage/sr_i_files.h"
+#include "storage/sr_i_storage.h"
+#include "storage/sr_i_table_file.h"
+#include "tables/sr_i_hash_table.h"
+
+namespace {
+
+// A file copy moves this much per read and write.
+constexpr uint32_t Copy_Block_Bytes = 1u << 20;
+
+// A registry path resolved in the tree: its key, and the block size of its
+// mount point (0 for a transient path).
+struct resolved_path {
+  std::string key;
+  uint32_t block_size = 0;
+  bool persistent() const { return block_size != 0; }
+};
+
+int32_t resolve(const sr_i_tree_t *p_tree, const char *p_registry_path, resolved_path &path) {
+  return sr_i_resolve_path(p_tree, p_registry_path, path.key, path.block_size);
+}
+
+sr_i_table_t *open_table_at(const sr_i_tree_t *p_tree, const std::string &key) {
+  const auto found = p_tree->tables.find(key);
+  return found != p_tree->tables.end() ? found->second : nullptr;
+}
+
+struct table_closer {
+  sr_i_table_t *p_table;
+  ~table_closer() { sr_i_close_table(p_table); }
+  sr_i_table_t *release() { return std::exchange(p_table, nullptr); }
+};
+
+std::string directory_of(const std::string &file) {
+  return file.substr(0, file.rfind('/') + 1);
+}
+
+bool has_changes_on_the_way(const sr_i_table_t *p_table) {
+  return p_table->ready_for_commit != Sr_Nothing_Applied ||
+         p_table->p_rows_change_list != nullptr || p_table->p_delete_rows_change_list != nullptr;
+}
+
+// Copies the file `source_file` into `fd` a block at a time.
+int32_t copy_file_contents(const std::string &source_file, int fd, const std::string &path) {
+  int source_fd = -1;
+  if (const int32_t rc = sr_i_open_file(source_file.c_str(), O_RDONLY, &source_fd); rc != 0) {
+    return rc;
+  }
+  std::unique_ptr<unsigned char[]> block(new (std::nothrow) unsigned char[Copy_Block_Bytes]);
+  int32_t rc = block == nullptr ? sr_i_raise_no_memory() : 0;
+  for (uint32_t got = Copy_Block_Bytes; rc == 0 && got == Copy_Block_Bytes;) {
+    rc = sr_i_read(source_fd, block.get(), Copy_Block_Bytes, &got);
+    if (rc == 0 && got > 0) {
+      rc = sr_i_write(fd, path.c_str(), block.get(), got);
+    }
+  }
+  sr_i_close_file(source_fd);
+  return rc;
+}
+
+// Makes `target_file` the file `write(fd, path)` writes: into the target's
+// rewrite file, flushed, renamed over the target and the directory flushed.
+// On failure the rewrite file is removed and the target is as it was.
+template <typename Write>
+int32_t publish_file(const std::string &target_file, Write &&write) {
+  const std::string rewrite_path = target_file + ".rewrite";
+  int fd = -1;
+  // Truncated: a crash may have left an older rewrite file behind.
+  int32_t rc = sr_i_open_file(rewrite_path.c_str(), O_RDWR | O_CREAT | O_TRUNC, &fd);
+  if (rc == 0) {
+    rc = write(fd, rewrite_path);
+  }
+  if (rc == 0) {
+    rc = sr_i_flush_file(fd, rewrite_path.c_str());
+  }
+  sr_i_close_file(fd);
+  bool renamed = false;
+  if (rc == 0) {
+    rc = sr_i_rename_durably(rewrite_path.c_str(), target_file.c_str(), &renamed);
+  }
+  if (!renamed) {
+    sr_i_discard_file(rewrite_path.c_str());
+  }
+  return rc;
+}
+
+// The open mode that loads a table again as it is open now.
+int32_t open_mode_of(const sr_i_table_t *p_table) {
+  if ((p_table->mode & Sr_Mode_Writable) == 0) {
+    return SR_MODE_READ;
+  }
+  return p_table->implicitly_controlled != 0 ? SR_MODE_WRITE : SR_MODE_WRITE_EXPLICIT;
+}
+
+// Reads an open persistent target again from its new file into its own
+// object, under the object's write lock: its rows, columns, counters,
+// application metadata and file; its handles, name and mode stay.
+int32_t refresh_open_target(sr_i_tree_t *p_tree, sr_i_table_t *p_target) {
+  sr_i_write_guard target_lock(&p_target->lock);
+  if (target_lock.result() != 0) {
+    return target_lock.result();
+  }
+  sr_hash_table_t *p_hash_table = nullptr;
+  if (const int32_t rc = sr_i_hash_table_open_like(p_target->p_rows_hash_table, &p_hash_table);
+      rc != 0) {
+    return rc;
+  }
+  sr_i_table_t *p_fresh = nullptr;
+  if (const int32_t rc = sr_i_open_persistent_table(
+          p_tree, p_target->p_persistent_table_registry_path, p_target->p_name,
+          open_mode_of(p_target), p_target->block_size, p_hash_table, &p_fresh);
+      rc != 0) {
+    return rc;
+  }
+  sr_i_swap_after_metadata_update(p_target, p_fresh);
+  std::swap(p_target->p_application_metadata, p_fresh->p_application_metadata);
+  sr_i_close_table(p_fresh);
+  return 0;
+}
+
+// A table with nothing left of a file: what a table loaded from a file or
+// moved off the disk becomes, so that its later commits stay in memory.
+void forget_file(sr_i_table_t *p_table) {
+  sr_i_close_table_file(std::exchange(p_table->p_file, nullptr));
+  std::free(std::exchange(p_table->p_persistent_table_registry_path, nullptr));
+  p_table->block_size = 0;
+}
+
+// Gives a table the name `key`: 0 or 12.
+int32_t rename_object(sr_i_table_t *p_table, const std::string &key) {
+  char *p_name = strdup(key.c_str());
+  if (p_name == nullptr) {
+    return sr_i_raise_no_memory();
+  }
+  std::free(std::exchange(p_table->p_name, p_name));
+  return 0;
+}
+
+// A committed copy of the applied view of an open table, named `key`, with
+// the source's application metadata and change counter, not yet in the
+// tree and held by no handle.
+int32_t copy_in_memory(sr_i_table_t *p_source, const std::string &key, sr_i_table_t **pp_copy) {
+  std::vector<uint32_t> columns(p_source->total_columns);
+  for (uint32_t column = 0; column < p_source->total_columns; ++column) {
+    columns[column] = column;
+  }
+  sr_i_table_t *p_copy = nullptr;
+  if (const int32_t rc = sr_i_select_columns(p_source, columns, nullptr, 1, &p_copy); rc != 0) {
+    return rc;
+  }
+  table_closer closer{p_copy};
+  sr_i_application_metadata_t *p_metadata = nullptr;
+  if (const int32_t rc =
+          sr_i_duplicate_application_metadata_buffer(p_source->p_application_metadata, &p_metadata);
+      rc != 0) {
+    return rc;
+  }
+  sr_i_free_application_metadata(std::exchange(p_copy->p_application_metadata, p_metadata));
+  if (const int32_t rc = rename_object(p_copy, key); rc != 0) {
+    return rc;
+  }
+  p_copy->change_counter = p_copy->applied_change_counter = p_source->change_counter;
+  p_copy->implicitly_controlled = 1;
+  p_copy->references = 0;
+  *pp_copy = closer.release();
+  return 0;
+}
+
+// The table file `source_file` loaded into memory as a table named `key`
+// that no longer refers to the file, not yet in the tree.
+int32_t load_into_memory(sr_i_tree_t *p_tree, const std::string &source_file,
+                         const std::string &key, sr_i_table_t **pp_loaded) {
+  sr_i_table_t *p_loaded = nullptr;
+  if (const int32_t rc =
+          sr_i_open_persistent_table(p_tree, nullptr, source_file.c_str(), SR_MODE_READ,
+                                     Sr_Mount_Block_Size, nullptr, &p_loaded);
+      rc != 0) {
+    return rc;
+  }
+  table_closer closer{p_loaded};
+  forget_file(p_loaded);
+  if (const int32_t rc = rename_object(p_loaded, key); rc != 0) {
+    return rc;
+  }
+  p_loaded->mode = Sr_Mode_Writable;
+  p_loaded->references = 0;
+  *pp_loaded = closer.release();
+  return 0;
+}
+
+// One copy or move, with the tree's write lock held.
+class duplication {
+ public:
+  duplication(sr_i_tree_t *p_tree, bool remove_source, bool overwrite)
+      : p_tree_(p_tree), remove_source_(remove_source), overwrite_(overwrite) {}
+
+  int32_t run(sr_i_table_t *p_source, const char *p_source_path, const char *p_target_path) {
+    if (const int32_t rc = find_source(p_source, p_source_path); rc != 0) {
+      return rc;
+    }
+    if (const int32_t rc = resolve(p_tree_, p_target_path, target_); rc != 0) {
+      return rc;
+    }
+    p_open_target_ = open_table_at(p_tree_, target_.key);
+    if (p_source_ != nullptr ? p_open_target_ == p_source_ : source_file_ == target_.key) {
+      // A table onto its own path: there is nothing to carry.
+      return overwrite_ ? 0 : sr_i_raise(SR_E_TABLE_EXISTS);
+    }
+    int32_t rc = 0;
+    bool source_done = false;  // the source was moved along with the target
+    {
+      // A source that moves is renamed or taken apart: no reader of it may
+      // be inside meanwhile.
+      std::unique_ptr<sr_i_write_guard> write_lock;
+      std::unique_ptr<sr_i_read_guard> read_lock;
+      if (p_source_ != nullptr && remove_source_) {
+        write_lock = std::make_unique<sr_i_write_guard>(&p_source_->lock);
+        rc = write_lock->result();
+      } else if (p_source_ != nullptr) {
+        read_lock = std::make_unique<sr_i_read_guard>(&p_source_->lock);
+        rc = read_lock->result();
+      }
+      if (rc == 0) {
+        rc = target_.persistent() ? to_disk() : to_memory(source_done);
+      }
+    }
+    if (rc == 0 && remove_source_ && !source_done && p_source_ != nullptr) {
+      // The target is complete: a failure to remove the source leaves both.
+      if (p_source_->p_file != nullptr) {
+        sr_i_remove_table_files(p_source_->p_file->path);
+      }
+      sr_i_detach_table(p_tree_, p_source_);
+    }
+    return rc;
+  }
+
+ private:
+  int32_t find_source(sr_i_table_t *p_source, const char *p_source_path) {
+    if (p_source != nullptr) {
+      p_source_ = p_source;
+      return 0;
+    }
+    resolved_path source;
+    if (const int32_t rc = resolve(p_tree_, p_source_path, source); rc != 0) {
+      return rc;
+    }
+    p_source_ = open_table_at(p_tree_, source.key);
+    if (p_source_ == nullptr && !source.persistent()) {
+      return sr_i_raise(SR_E_NO_TABLE);
+    }
+    if (p_source_ == nullptr) {
+      source_file_ = std::move(source.key);
+    }
+    return 0;
+  }
+
+  int32_t to_disk() {
+    if (p_open_target_ != nullptr && has_changes_on_the_way(p_open_target_)) {
+      return sr_i_raise(SR_E_UNCOMMITTED);
+    }
+    {
+      sr_i_target_lock locks;
+      if (const int32_t rc = locks.lock(target_.key, p_open_target_); rc != 0) {
+        return rc;
+      }
+      if (locks.target_length() != 0 && !overwrite_) {
+        return sr_i_raise(SR_E_TABLE_EXISTS);
+      }
+      if (const int32_t rc = write_target_file(); rc != 0) {
+        return rc;
+      }
+    }
+    // The file locks are given up first: the table reads its new file with
+    // the writer's lock of its own.
+    return p_open_target_ != nullptr ? refresh_open_target(p_tree_, p_open_target_) : 0;
+  }
+
+  int32_t write_target_file() {
+    if (p_source_ != nullptr) {
+      return publish_file(target_.key, [&](int fd, const std::string &path) {
+        return sr_i_write_table_file(p_source_, fd, path);
+      });
+    }
+    if (remove_source_) {
+      // Between table files a move is one rename.
+      if (const int32_t rc = sr_i_rename_durably(source_file_.c_str(), target_.key.c_str());
+          rc != 0) {
+        return rc;
+      }
+      sr_i_discard_file((source_file_ + ".rewrite").c_str());
+      // The source's name is gone from its directory too, if that is
+      // another one.
+      const std::string source_directory = directory_of(source_file_);
+      return source_directory == directory_of(target_.key)
+                 ? 0
+                 : sr_i_flush_directory(source_directory.c_str());
+    }
+    return publish_file(target_.key, [&](int fd, const std::string &path) {
+      return copy_file_contents(source_file_, fd, path);
+    });
+  }
+
+  int32_t to_memory(bool &source_done) {
+    if (p_open_target_ != nullptr && !overwrite_) {
+      return sr_i_raise(SR_E_TABLE_EXISTS);
+    }
+    sr_i_table_t *p_new = nullptr;
+    if (p_source_ != nullptr && remove_source_) {
+      if (p_source_->p_file != nullptr) {
+        if (const int32_t rc = sr_i_remove_table_files(p_source_->p_file->path); rc != 0) {
+          return rc;
+        }
+      }
+      if (const int32_t rc = rename_object(p_source_, target_.key); rc != 0) {
+        return rc;
+      }
+      // Out of the tree under its old name, in again under the new one.
+      sr_i_take_out_of_tree(p_tree_, p_source_);
+      forget_file(p_source_);
+      p_new = p_source_;
+      source_done = true;
+    } else if (p_source_ != nullptr) {
+      if (const int32_t rc = copy_in_memory(p_source_, target_.key, &p_new); rc != 0) {
+        return rc;
+      }
+    } else {
+      if (const int32_t rc = load_into_memory(p_tree_, source_file_, target_.key, &p_new);
+          rc != 0) {
+        return rc;
+      }
+      if (remove_source_) {
+        if (const int32_t rc = sr_i_remove_table_files(source_file_); rc != 0) {
+          sr_i_close_table(p_new);
+          return rc;
+        }
+      }
+    }
+    if (p_open_target_ != nullptr) {
+      sr_i_detach_table(p_tree_, p_open_target_);
+    }
+    return sr_i_enter_named_table(p_tree_, target_.key, p_new);
+  }
+
+  sr_i_tree_t *p_tree_;
+  bool remove_source_;
+  bool overwrite_;
+  sr_i_table_t *p_source_ = nullptr;
+  std::string source_file_; /* a source no one has open here */
+  resolved_path target_;
+  sr_i_table_t *p_open_target_ = nullptr;
+};
+
+}  // namespace
+
+int32_t sr_i_duplicate_table(sr_i_tree_t *p_tree, sr_i_table_t *p_source, const char *p_source_path,
+                             const char *p_target_path, bool remove_source, bool overwrite) {
+  sr_i_write_guard tree_lock(&p_tree->lock);
+  if (tree_lock.result() != 0) {
+    return tree_lock.result();
+  }
+  return duplication(p_tree, remove_source, overwrite).run(p_source, p_source_path, p_target_path);
+}

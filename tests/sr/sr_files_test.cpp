@@ -281,7 +281,7 @@ TEST_F(Files, TheLockBelongsToTheDescriptorThatTookIt) {
 // they are followed by.
 std::vector<std::string> Namespace_Calls;
 
-TEST_F(Files, RenamesAndNewDirectoriesAreFlushedIntoTheirDirectory) {
+TEST_F(Files, RenamesRemovalsAndNewDirectoriesAreFlushedIntoTheirDirectory) {
   Namespace_Calls.clear();
   Sr_File_System.open = [](const char *p_path, int flags, mode_t mode) {
     if ((flags & O_DIRECTORY) != 0) {
@@ -301,6 +301,10 @@ TEST_F(Files, RenamesAndNewDirectoriesAreFlushedIntoTheirDirectory) {
     Namespace_Calls.push_back("mkdir");
     return Sr_Default_File_System.mkdir(p_path, mode);
   };
+  Sr_File_System.unlink = [](const char *p_path) {
+    Namespace_Calls.push_back("unlink");
+    return Sr_Default_File_System.unlink(p_path);
+  };
   const std::string directory_name = directory_.filename().string();
 
   bool renamed = false;
@@ -316,11 +320,20 @@ TEST_F(Files, RenamesAndNewDirectoriesAreFlushedIntoTheirDirectory) {
   EXPECT_EQ(Namespace_Calls,
             (std::vector<std::string>{"mkdir", "open " + directory_name, "fsync", "mkdir"}));
 
-  // A rename that fails leaves the name as it was and says so.
+  // A rename that fails leaves the name as it was and says so; a missing
+  // file is no table.
   renamed = true;
   EXPECT_EQ(sr_i_rename_durably(path("absent").c_str(), path("moved").c_str(), &renamed),
-            SR_E_SYSTEM_CALL);
+            SR_E_NO_TABLE);
   EXPECT_FALSE(renamed);
+
+  // A removal is flushed into its directory too; a missing file is no table.
+  sr_test::write_file(path("doomed"), "x");
+  Namespace_Calls.clear();
+  ASSERT_EQ(sr_i_remove_file_durably(path("doomed").c_str()), 0);
+  EXPECT_EQ(Namespace_Calls,
+            (std::vector<std::string>{"unlink", "open " + directory_name, "fsync"}));
+  EXPECT_EQ(sr_i_remove_file_durably(path("doomed").c_str()), SR_E_NO_TABLE);
 }
 
 }  // namespace

@@ -93,14 +93,14 @@ int32_t convert_rows(const sr_i_packed_buffer_view &view, uint32_t table, uint32
   qv_pmsg_value_anchor_t anchor;
   std::memcpy(&anchor, view.table_slot(table, SR_I_PACKED_ROWS), sizeof anchor);
   unsigned char *p_body = view.p_indirect + anchor.offset;
-  if (anchor.length < 4 || sr_i_load_u32(p_body) != total_rows ||
-      uint64_t{Sr_Packed_Slot_Bytes} * total_rows > anchor.length - 4) {
+  uint32_t total_in_array = 0;
+  if (!sr_i_packed_rows_count(p_body, anchor.length, total_in_array) ||
+      total_in_array != total_rows) {
     return sr_i_raise(SR_E_TABLE_UNREADABLE);
   }
   for (uint32_t row = 0; row < total_rows; ++row) {
     qv_pmsg_value_anchor_t element;
-    std::memcpy(&element, p_body + 4 + Sr_Packed_Slot_Bytes * row, sizeof element);
-    if (!sr_i_packed_span_inside(element.offset, element.length, anchor.length)) {
+    if (!sr_i_packed_row_anchor(p_body, anchor.length, total_rows, row, element)) {
       return sr_i_raise(SR_E_TABLE_UNREADABLE);
     }
     if (const int32_t rc = convert_row(p_body + element.offset, element.length, types); rc != 0) {

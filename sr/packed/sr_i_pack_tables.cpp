@@ -17,6 +17,7 @@
 #include "packed/sr_i_packed_buffer.h"
 #include "packed/sr_i_packed_columns.h"
 #include "rows/sr_i_rows.h"
+#include "storage/sr_i_prefault.h"
 
 namespace {
 
@@ -258,14 +259,19 @@ int32_t sr_i_pack_tables(uint32_t total_tables, const sr_opaque_handle_t *p_tabl
     return sr_i_raise_no_memory();  // more than a buffer's 32-bit length can say
   }
   const auto length = static_cast<uint32_t>(fixed_part + indirect_length);
-  auto *p_buffer = static_cast<unsigned char *>(std::calloc(1, length));
+  // Every byte is written below, so the buffer is not cleared first; a
+  // large one has its pages mapped in one call.
+  auto *p_buffer = static_cast<unsigned char *>(std::malloc(length));
   if (p_buffer == nullptr) {
     return sr_i_raise_no_memory();
   }
   sr_i_decoded<unsigned char> buffer(p_buffer);
+  sr_i_prefault(p_buffer, length);
   const qv_pmsg_header_t header{length, QV_PMSG_VERSION, QV_PMSG_ARCH_LOCAL,
                                 Sr_Packed_Protocol_Type, 0};
   std::memcpy(p_buffer, &header, sizeof header);
+  std::memset(p_buffer + Sr_Packed_Header_Bytes, 0,
+              Sr_Packed_Empty_Buffer_Bytes - Sr_Packed_Header_Bytes);
   const uint32_t buffer_slots[] = {0, 1, length, total_tables};
   for (uint32_t slot = 0; slot < 4; ++slot) {
     sr_i_store_u32(p_buffer + Sr_Packed_Header_Bytes + slot * Sr_Packed_Slot_Bytes,
@@ -298,6 +304,9 @@ int32_t sr_i_pack_tables(uint32_t total_tables, const sr_opaque_handle_t *p_tabl
       return rc;
     }
     write_rows(plan, view.table_slot(table, SR_I_PACKED_ROWS), view.p_indirect, offset);
+  }
+  if (offset != view.indirect_length) {
+    return sr_i_raise_internal();  // the codec encoded other sizes than it measured
   }
   *pp_buffer = buffer.release();
   return 0;

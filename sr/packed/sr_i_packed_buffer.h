@@ -74,6 +74,28 @@ inline bool sr_i_packed_span_inside(uint64_t offset, uint64_t length, uint64_t e
   return offset <= extent && length <= extent - offset;
 }
 
+/*
+ * The body of a table's rows array (a pointer array of binaries): a count,
+ * one anchor per row counting from the body's start, then the row records.
+ * True when the count's anchors fit in the body and, for a row, when its
+ * anchor lies in the body behind them; `anchor` then holds it.
+ */
+inline bool sr_i_packed_rows_count(const unsigned char *p_body, uint32_t length,
+                                   uint32_t &total_rows) {
+  if (length < 4) {
+    return false;
+  }
+  total_rows = sr_i_load_u32(p_body);
+  return uint64_t{Sr_Packed_Slot_Bytes} * total_rows <= length - 4;
+}
+inline bool sr_i_packed_row_anchor(const unsigned char *p_body, uint32_t length,
+                                   uint32_t total_rows, uint32_t row,
+                                   qv_pmsg_value_anchor_t &anchor) {
+  std::memcpy(&anchor, p_body + 4 + Sr_Packed_Slot_Bytes * row, sizeof anchor);
+  return anchor.offset >= 4 + uint64_t{Sr_Packed_Slot_Bytes} * total_rows &&
+         sr_i_packed_span_inside(anchor.offset, anchor.length, length);
+}
+
 /* A buffer whose header and buffer slots hold together, read in this
  * machine's byte order. */
 struct sr_i_packed_buffer_view {

@@ -35,6 +35,10 @@ bool is_structured(qv_data_type_t type) {
   return type == QV_SD_PTR || type == QV_SD_PTR_ARRAY;
 }
 
+// The bits a qualifier may have: a base in the low four, and the modifiers.
+constexpr uint32_t Qualifier_Bits =
+    15u | SR_PROTECTED | SR_INVISIBLE | SR_SET_TO_DEFAULT_WHEN_UNSPECIFIED;
+
 bool is_key(uint32_t qualifier) {
   const uint32_t base = qualifier & 15u;
   return base == SR_PRIMARY_KEY || base == SR_PRIMARY_KEY_NOCHECK;
@@ -116,8 +120,18 @@ bool column_holds_together(const qv_structured_data_t *p_column) {
       return false;
     }
   }
+  if ((p_elements[QUALIFIER].value.val_uint32 & ~Qualifier_Bits) != 0) {
+    return false;
+  }
   const uint32_t type = p_elements[TYPE].value.val_uint32;
   const uint32_t total_fields = p_elements[FIELD_TYPES].value.ptr_array->element_count;
+  const qv_array_t *p_field_types = p_elements[FIELD_TYPES].value.ptr_array;
+  for (uint32_t field = 0; field < total_fields; ++field) {
+    const uint32_t field_type = p_field_types->elements[field].val_uint32;
+    if (field_type < QV_INT32 || field_type > QV_SD_PTR_ARRAY) {
+      return false;
+    }
+  }
   return type == static_cast<uint32_t>(p_elements[DEFAULT_VALUE].data_type) &&
          total_fields == p_elements[FIELD_NAMES].value.ptr_array->element_count &&
          (total_fields == 0 || is_structured(static_cast<qv_data_type_t>(type)));

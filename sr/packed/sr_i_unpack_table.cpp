@@ -1,25 +1,27 @@
 // sr_i_unpack_table.cpp - one table of a packed buffer made a read-only
-// transient table: its fixed metadata, column definitions and rows decoded
-// within the buffer's bounds, each row record checked as it enters, the
-// row index and key hash table pointed straight at the decoded records,
-// and the table entered in the tree under its packed name.
+// transient table: its fixed metadata and column definitions decoded within
+// the buffer's bounds, its rows array copied whole, each row record checked
+// as it enters, the row index and key hash table pointed straight at the
+// records in that copy, and the table entered in the tree under its packed
+// name.
 //
-// Decoding the rows array is the one copy the rows go through: it gives the
-// table one block of its own, so the caller may free the buffer at once.
-// Rows are not re-encoded, and only a key that is compared or hashed where
-// it lies is looked at inside its body. A reader of any other value
+// The copy of the rows array is the one copy the rows go through: the
+// table gets one block of its own, so the caller may free the buffer at
+// once. Rows are not re-encoded, and only a key that is compared or hashed
+// where it lies is looked at inside its body; a reader of any other value
 // decodes it through the codec, which checks its body then.
 
 #include "packed/sr_i_unpack_table.h"
 
+#include <cstdlib>
 #include <string>
 
 #include "frame/sr_i_errors.h"
 #include "frame/sr_i_paths.h"
 #include "packed/sr_i_packed_buffer.h"
 #include "packed/sr_i_packed_columns.h"
-#include "rows/sr_i_row_operations.h"
 #include "rows/sr_i_rows.h"
+#include "storage/sr_i_prefault.h"
 #include "tables/sr_i_columns.h"
 #include "tables/sr_i_create_table.h"
 
@@ -34,13 +36,14 @@ struct table_closer {
 // its length word says its length, it holds the header word and every
 // slot, each anchor lies in its variable part, and a key body that is
 // compared in place is a whole string or handle.
-bool row_holds_together(const sr_i_table_t *p_table, const qv_binary_t *p_element) {
+bool row_holds_together(const sr_i_table_t *p_table, const unsigned char *p_element,
+                        uint32_t length) {
   const uint64_t fixed_length = uint64_t{Sr_Record_Header_Length} + sr_i_row_fixed_length(p_table);
-  if (p_element->length < fixed_length || sr_i_load_u32(p_element->data) != p_element->length) {
+  if (length < fixed_length || sr_i_load_u32(p_element) != length) {
     return false;
   }
-  const unsigned char *p_record = p_element->data + Sr_Record_Header_Length;
-  const uint64_t variable_length = p_element->length - fixed_length;
+  const unsigned char *p_record = p_element + Sr_Record_Header_Length;
+  const uint64_t variable_length = length - fixed_length;
   for (uint32_t column = 0; column < p_table->total_columns; ++column) {
     if (!sr_i_is_variable_length(p_table->p_columns[column].type)) {
       continue;
@@ -60,43 +63,51 @@ bool row_holds_together(const sr_i_table_t *p_table, const qv_binary_t *p_elemen
                                  : key.length == sizeof(qv_resource_handle_t);
 }
 
-// Without a hash table a checked key is compared with the rows before it,
-// which needs it as a client value.
-bool key_compared_by_scan(const sr_i_table_t *p_table) {
-  return p_table->p_rows_hash_table == nullptr &&
-         (p_table->p_columns[0].qualifier & 15u) == SR_PRIMARY_KEY;
-}
-
-// Enters one record: an index entry (and hash element) by the raw add,
-// then its place in the packed index, committed at once.
-int32_t add_packed_row(sr_i_table_t *p_table, void *p_record) {
-  qv_value_t key{};
-  sr_i_decoded<void> decoded_key;
-  if (key_compared_by_scan(p_table)) {
-    const qv_data_type_t key_type = p_table->p_columns[0].type;
+// A table without a key hash table checks a key under SR_PRIMARY_KEY by
+// comparing it with the rows before it, as adding rows does: each row's key
+// is decoded and compared with the keys of the rows in front of it.
+int32_t check_keys_by_scan(const sr_i_table_t *p_table) {
+  const qv_data_type_t key_type = p_table->p_columns[0].type;
+  for (uint32_t row = 1; row < p_table->total_committed_rows; ++row) {
+    const void *p_record = p_table->p_rows_fixed_index[row].p_committed;
     qv_pmsg_value_t slot;
     std::memcpy(&slot, sr_i_row_slot(p_record, 0), sizeof slot);
+    qv_value_t key{};
     if (const int32_t rc = qv_pmsg_build_conv_packed_client_value_1(
             nullptr, 0, key_type, &key, &slot, sr_i_row_variable_part(p_table, p_record),
             QV_PMSG_LENGTH_UNBOUNDED);
         rc != 0) {
       return sr_i_raise_library_call("qv_pmsg_build_conv_packed_client_value", rc);
     }
-    if (sr_i_is_variable_length(key_type)) {
-      decoded_key.reset(key.ptr_char);
+    const sr_i_decoded<void> decoded(sr_i_is_variable_length(key_type) ? key.ptr_char : nullptr);
+    for (uint32_t earlier = 0; earlier < row; ++earlier) {
+      const void *p_earlier = p_table->p_rows_fixed_index[earlier].p_committed;
+      if (sr_i_compare_values(&key, sr_i_row_slot(p_earlier, 0), key_type,
+                              sr_i_row_variable_part(p_table, p_earlier)) == 0) {
+        return sr_i_raise(SR_E_DUPLICATE_KEY);
+      }
     }
   }
-  sr_i_index_entry_t *p_entry = nullptr;
-  sr_hash_table_element_t *p_revived = nullptr;
-  if (const int32_t rc = sr_i_add_row_raw(p_table, p_record, &key, &p_entry, &p_revived, nullptr);
-      rc != 0) {
+  return 0;
+}
+
+// Copies the body of a table's rows array into a block of its own, its
+// pages mapped at once when it is large.
+int32_t copy_rows_array(const sr_i_packed_buffer_view &view, uint32_t table,
+                        sr_i_decoded<unsigned char> &copy, uint32_t &length) {
+  const unsigned char *p_slot = view.table_slot(table, SR_I_PACKED_ROWS);
+  if (const int32_t rc = sr_i_check_packed_anchor(view, p_slot); rc != 0) {
     return rc;
   }
-  p_entry->p_committed = p_record;
-  p_entry->packed_index = p_table->total_applied_rows;
-  p_table->p_rows_packed_index[p_table->total_applied_rows++] =
-      sr_i_fixed_position(p_table, p_entry);
-  ++p_table->total_committed_rows;
+  qv_pmsg_value_anchor_t anchor;
+  std::memcpy(&anchor, p_slot, sizeof anchor);
+  copy.reset(static_cast<unsigned char *>(std::malloc(anchor.length > 0 ? anchor.length : 1)));
+  if (copy == nullptr) {
+    return sr_i_raise_no_memory();
+  }
+  sr_i_prefault(copy.get(), anchor.length);
+  std::memcpy(copy.get(), view.p_indirect + anchor.offset, anchor.length);
+  length = anchor.length;
   return 0;
 }
 
@@ -116,9 +127,14 @@ int32_t open_hash_table(uint32_t total_hash_buckets, sr_hash_function_t hash_fun
 
 int32_t sr_i_create_read_only_transient_table_from_packed_rows(
     sr_i_tree_t *p_tree, const char *p_name, sr_column_t *p_columns, uint32_t total_columns,
-    sr_hash_table_t *p_rows_hash_table, qv_array_t *p_packed_rows_array, sr_i_table_t **pp_table) {
-  sr_i_decoded<qv_array_t> rows(p_packed_rows_array);
-  const uint32_t total_rows = p_packed_rows_array->element_count;
+    sr_hash_table_t *p_rows_hash_table, void *p_packed_rows_array, uint32_t length,
+    sr_i_table_t **pp_table) {
+  sr_i_decoded<unsigned char> rows(static_cast<unsigned char *>(p_packed_rows_array));
+  uint32_t total_rows = 0;
+  if (!sr_i_packed_rows_count(rows.get(), length, total_rows)) {
+    sr_i_hash_table_close(p_rows_hash_table);
+    return sr_i_raise(SR_E_TABLE_UNREADABLE);
+  }
   sr_i_table_t *p_new_table = nullptr;
   if (const int32_t rc =
           sr_i_create_transient_table_object(p_tree, p_name, p_columns, total_columns, SR_MODE_READ,
@@ -127,15 +143,29 @@ int32_t sr_i_create_read_only_transient_table_from_packed_rows(
     return rc;
   }
   table_closer closer{p_new_table};
+  // Each row takes the next index entry as it comes, committed at once; the
+  // packed index and the key hash table are then made in one pass, as after
+  // a load.
   for (uint32_t row = 0; row < total_rows; ++row) {
-    qv_binary_t *p_element = p_packed_rows_array->elements[row].ptr_binary;
-    if (!row_holds_together(p_new_table, p_element)) {
+    qv_pmsg_value_anchor_t anchor;
+    if (!sr_i_packed_row_anchor(rows.get(), length, total_rows, row, anchor) ||
+        !row_holds_together(p_new_table, rows.get() + anchor.offset, anchor.length)) {
       return sr_i_raise(SR_E_TABLE_UNREADABLE);
     }
-    if (const int32_t rc = add_packed_row(p_new_table, p_element->data + Sr_Record_Header_Length);
-        rc != 0) {
+    sr_i_index_entry_t *p_entry = sr_i_rows_free_chain_remove(p_new_table);
+    p_entry->p_applied = rows.get() + anchor.offset + Sr_Record_Header_Length;
+    p_entry->p_committed = p_entry->p_applied;
+  }
+  p_new_table->total_applied_rows = total_rows;
+  p_new_table->total_committed_rows = total_rows;
+  if (p_new_table->p_rows_hash_table == nullptr &&
+      (p_new_table->p_columns[0].qualifier & 15u) == SR_PRIMARY_KEY) {
+    if (const int32_t rc = check_keys_by_scan(p_new_table); rc != 0) {
       return rc;
     }
+  }
+  if (const int32_t rc = sr_i_establish_secondary_row_access(p_new_table); rc != 0) {
+    return rc;
   }
   p_new_table->p_packed_rows_array = rows.release();
   p_new_table->mode = Sr_Mode_Read_Only;
@@ -174,12 +204,15 @@ int32_t sr_i_unpack_table(const void *p_buffer, uint32_t total_hash_buckets,
     return rc;
   }
   const sr_i_decoded<char> name(decoded.ptr_char);
-  if (const int32_t rc = sr_i_decode_packed_value(view, table_index, SR_I_PACKED_ROWS, &decoded);
-      rc != 0) {
+  sr_i_decoded<unsigned char> rows;
+  uint32_t rows_length = 0;
+  if (const int32_t rc = copy_rows_array(view, table_index, rows, rows_length); rc != 0) {
     return rc;
   }
-  sr_i_decoded<qv_array_t> rows(decoded.ptr_array);
-  if (columns.size() != fixed.total_columns || rows->element_count != fixed.total_rows) {
+  uint32_t total_rows = 0;
+  if (columns.size() != fixed.total_columns ||
+      !sr_i_packed_rows_count(rows.get(), rows_length, total_rows) ||
+      total_rows != fixed.total_rows) {
     return sr_i_raise(SR_E_TABLE_UNREADABLE);
   }
   // A table whose rows live outside a pool has no file: a name that would
@@ -207,7 +240,7 @@ int32_t sr_i_unpack_table(const void *p_buffer, uint32_t total_hash_buckets,
   sr_i_table_t *p_table = nullptr;
   if (const int32_t rc = sr_i_create_read_only_transient_table_from_packed_rows(
           p_tree, named ? key.c_str() : nullptr, columns.data(), columns.size(), p_hash_table,
-          rows.release(), &p_table);
+          rows.release(), rows_length, &p_table);
       rc != 0) {
     return rc;
   }

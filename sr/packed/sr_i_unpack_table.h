@@ -15,20 +15,22 @@
 
 /*
  * Makes a read-only transient table of `p_tree` named `p_name` (null for an
- * unnamed table) whose rows are the elements of `p_packed_rows_array`, a
- * decoded QV_BINARY_PTR_ARRAY of pool records (header, then row record),
- * in this machine's byte order. Each record is checked before it enters:
- * its length word, every anchor inside its variable part, and a key body a
- * hash or comparison reads in place. The index points into the array, which
- * the table keeps and frees when it is closed. Every row is committed. The
- * table takes `p_rows_hash_table` and the array, and frees both on failure.
- * The table is not entered in the tree. Returns 0 and the table in
- * *pp_table, 14 (a record that does not hold together), 108, 11, 12 and the
- * codes of table creation (raised).
+ * unnamed table) whose rows are the records of `p_packed_rows_array`: a
+ * malloc'ed copy, `length` bytes, of the body of a packed rows array
+ * (sr_i_packed_buffer.h) in this machine's byte order. Each record is
+ * checked before it enters: its anchor in the array, its length word,
+ * every anchor inside its variable part, and a key body a hash or
+ * comparison reads in place. The index points into the array, which the
+ * table keeps and frees when it is freed. Every row is committed. The table
+ * takes `p_rows_hash_table` and the array, and frees both on failure; it is
+ * not entered in the tree. Returns 0 and the table in *pp_table, 14 (a
+ * record that does not hold together), 108, 11, 12 and the codes of table
+ * creation (raised).
  */
 int32_t sr_i_create_read_only_transient_table_from_packed_rows(
     sr_i_tree_t *p_tree, const char *p_name, sr_column_t *p_columns, uint32_t total_columns,
-    sr_hash_table_t *p_rows_hash_table, qv_array_t *p_packed_rows_array, sr_i_table_t **pp_table);
+    sr_hash_table_t *p_rows_hash_table, void *p_packed_rows_array, uint32_t length,
+    sr_i_table_t **pp_table);
 
 /*
  * Unpacks table `table_index` of a buffer in this machine's byte order into

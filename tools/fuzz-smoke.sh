@@ -22,11 +22,18 @@ for target in "${targets[@]}"; do
   name=$(basename "$target")
   corpus="build-fuzz/corpus/$name"
   mkdir -p "$corpus"
-  # Seeds live in fuzz/corpus/<library> for the targets fuzz_<library>_*.
+  # Seeds live in fuzz/corpus/<library> for the targets fuzz_<library>_*,
+  # or in fuzz/corpus/<library>_<input> for a target fuzz_<library>_<input>
+  # whose input differs from its library's other targets.
   library=${name#fuzz_}
+  own=$library
   library=${library%%_*}
   seeds=()
-  [ -d "fuzz/corpus/$library" ] && seeds=("fuzz/corpus/$library")
+  if [ -d "fuzz/corpus/$own" ]; then
+    seeds=("fuzz/corpus/$own")
+  elif [ -d "fuzz/corpus/$library" ]; then
+    seeds=("fuzz/corpus/$library")
+  fi
   echo "fuzz-smoke: $name for ${seconds}s"
   "$target" -max_total_time="$seconds" -timeout=10 -rss_limit_mb=2048 -print_final_stats=1 \
     "$corpus" "${seeds[@]}" 2>&1 | tail -n 5

@@ -61,6 +61,11 @@ BEGIN {
   call[103] = "sr_set_fields_by_key_1"
   call[105] = "sr_unmount_local_tree_1"
   call[107] = "sr_get_fixed_row_index_for_key_1"
+  call[109] = "sr_pack_tables_1"
+  call[111] = "sr_unpack_table_1"
+  call[113] = "sr_get_total_packed_tables_1"
+  call[115] = "sr_get_packed_table_name_1"
+  call[117] = "sr_convert_packed_table_buffer_1"
   # Return codes (qv_sr.h).
   code[10] = "SR_E_SYSTEM_CALL"
   code[11] = "SR_E_LIBRARY_CALL"

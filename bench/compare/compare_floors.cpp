@@ -1,19 +1,22 @@
 // compare_floors.cpp - the floors of the comparison: the bare work with no
 // database around it. A std::unordered_map for reads by key and for memory
 // per row, the I/O of one committed change and nothing else, and one read()
-// of a file the size of a table for open and scan. They show how far each
-// library is from what the machine itself costs.
+// of a file the size of a table for open and scan, and for shipping a table
+// a copy of its packed bytes and our own read of it in place. They show how
+// far each library is from what the machine itself costs.
 
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cstdlib>
 #include <cstring>
 #include <string>
 #include <unordered_map>
 #include <utility>
 #include <vector>
 
+#include "compare_ours.h"
 #include "compare_workloads.h"
 
 namespace compare {
@@ -22,6 +25,7 @@ namespace {
 constexpr const char *Map_System = "unordered_map";
 constexpr const char *Protocol_System = "protocol-io";
 constexpr const char *Read_File_System = "read-file";
+constexpr const char *Copy_And_Read_System = "memcpy+read";
 
 // The size of one change record, and where in it the word that marks it
 // committed lies.
@@ -176,6 +180,34 @@ void read_file(benchmark::State &state) {
   state.SetItemsProcessed(state.iterations() * rows);
 }
 
+// What shipping a table costs at least: the packed bytes copied once, as a
+// transfer would, and our own read of every value of a table already in
+// memory, with no packing and no unpacking.
+void copy_and_read(benchmark::State &state) {
+  const auto rows = static_cast<uint32_t>(state.range(0));
+  sr_opaque_handle_t table = loaded_transient_table(rows);
+  const uint32_t committed_view = 0, all_rows = 0;
+  void *p_buffer = nullptr;
+  if (!check(state,
+             table != nullptr && sr_pack_tables_1(1, &table, &committed_view, &all_rows, nullptr,
+                                                  &p_buffer) == 0,
+             "pack the table")) {
+    return;
+  }
+  uint32_t length;
+  std::memcpy(&length, p_buffer, sizeof length);
+  std::vector<unsigned char> copy(length);
+  for (auto _ : state) {
+    std::memcpy(copy.data(), p_buffer, length);
+    benchmark::ClobberMemory();
+    if (!check(state, read_every_value(table, rows), "read every value")) {
+      break;
+    }
+  }
+  std::free(p_buffer);
+  state.SetItemsProcessed(state.iterations() * rows);
+}
+
 }  // namespace
 
 void register_floors() {
@@ -185,6 +217,8 @@ void register_floors() {
   add(W4_Durable_Add, Protocol_System, &protocol_io, durable_rows)->UseRealTime();
   add(W6_Open_And_Scan, Read_File_System, &read_file)->UseRealTime();
   add(W7_Memory, Map_System, &map_memory)->Iterations(1)->UseRealTime();
+  add(W10_Ship_Table, Copy_And_Read_System, &copy_and_read, Ship_Row_Counts)
+      ->Unit(benchmark::kMillisecond);
 }
 
 }  // namespace compare

@@ -1,6 +1,7 @@
 // compare_ours.h - what the rest of the comparison borrows from our side: the
 // loaded tables of the read workloads, so that the record floor walks the
-// very records our selection reads.
+// very records our selection reads, and our read of a whole table, which
+// the shipping floor does after its copy.
 #ifndef COMPARE_OURS_H
 #define COMPARE_OURS_H
 
@@ -18,6 +19,11 @@ inline constexpr uint32_t Note_Column = 4;
 // workloads share, loaded on first use and kept for the whole run; null when
 // it could not be loaded.
 sr_opaque_handle_t loaded_transient_table(int64_t rows);
+
+// Reads every column of every row of `table` by packed index, as a program
+// reading a whole table does (strings copied out and freed). False when a
+// read fails or `rows` rows are not there.
+bool read_every_value(sr_opaque_handle_t table, uint32_t rows);
 
 }  // namespace compare
 

@@ -66,6 +66,12 @@ inline config_row make_row(uint32_t i) {
 //     string comparison with an integer range (see selection_criteria).
 //  w9 selection copy: the rows the integer criteria pick copied into a new
 //     table in memory; one item is one row scanned, not one row copied.
+//  w10 ship a table: every row of a table held in memory made one buffer
+//     (ours: sr_pack_tables_1; SQLite: sqlite3_serialize), the buffer made
+//     a table of another handle (ours: sr_unpack_table_1 into a new tree;
+//     SQLite: sqlite3_deserialize into a new connection), and every column
+//     of every row read there; one item is one row. w10_unpack times the
+//     unpacking alone.
 inline constexpr const char *W1_Read_By_Key = "w1_read_by_key";
 inline constexpr const char *W2_Read_By_Packed_Index = "w2_read_by_packed_index";
 inline constexpr const char *W2_Read_By_Fixed_Index = "w2_read_by_fixed_index";
@@ -78,6 +84,8 @@ inline constexpr const char *W7_Memory = "w7_memory";
 inline constexpr const char *W8_Select_Integer = "w8_selection_scan_integer";
 inline constexpr const char *W8_Select_Mixed = "w8_selection_scan_mixed";
 inline constexpr const char *W9_Selection_Copy = "w9_selection_copy";
+inline constexpr const char *W10_Ship_Table = "w10_ship_table";
+inline constexpr const char *W10_Unpack = "w10_unpack";
 
 // Rows of the tables the durable workloads change, and changes per batch.
 inline constexpr uint32_t Durable_Table_Rows = 1000;
@@ -89,6 +97,9 @@ inline const std::vector<int64_t> Row_Counts = {1000, 100000, 1000000};
 // The table sizes of the selection scan and of the selection copy.
 inline const std::vector<int64_t> Selection_Scan_Row_Counts = {100000, 1000000};
 inline const std::vector<int64_t> Selection_Copy_Row_Counts = {1000000};
+
+// The table size of the shipping workload.
+inline const std::vector<int64_t> Ship_Row_Counts = {100000};
 
 // The values of the selection criteria for a table of `rows` rows, the same
 // in every system; each picks about a tenth of the rows.

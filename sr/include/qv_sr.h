@@ -829,6 +829,120 @@ QV_SR_EXPORT int32_t sr_move_table_by_name_1(sr_opaque_handle_t tree_handle,
  */
 QV_SR_EXPORT int32_t sr_delete_table_1(sr_opaque_handle_t tree_handle, const char *p_registry_path);
 
+/* ---- Packed tables --------------------------------------------------------
+ *
+ * Several open tables travel to another process, or another machine, in one
+ * packed buffer: sr_pack_tables_1 makes it; the receiver converts it to its
+ * own byte order once (sr_convert_packed_table_buffer_1), may look at its
+ * tables (sr_get_total_packed_tables_1, sr_get_packed_table_name_1) and
+ * unpacks each into a read-only table of a tree (sr_unpack_table_1). The
+ * bytes are described in docs/packed-buffer-format.md.
+ *
+ * Ownership. The buffer is one malloc'ed block that belongs to the caller
+ * from sr_pack_tables_1 on; release it with free(). Nothing the library
+ * keeps points into it: a table name read from it points into it, and an
+ * unpacked table has a copy of its rows, so the buffer may be freed as soon
+ * as the tables wanted are unpacked.
+ *
+ * Validation. A buffer comes from outside the process and is not trusted.
+ * Its first 4 bytes state its length, and the caller must hand over at
+ * least that many readable (and, to convert, writable) bytes; everything
+ * else is checked against that length before it is followed: the header,
+ * the table count and every length, count, offset and anchor that a call
+ * uses. A buffer that does not hold together is refused with
+ * SR_E_TABLE_UNREADABLE (14, "2605-014 The table is unreadable."), never
+ * read or written outside its stated length. The calls other than the
+ * conversion also refuse a buffer that is not in this machine's byte order
+ * with that code.
+ */
+
+/*
+ * Packs `total_tables` open tables into a new buffer, stored in *p_p_buffer
+ * (the caller frees it). For table i: p_table_handles[i] is its handle;
+ * p_uncommitted_updates_visible[i] not 0 packs its applied view (so does the
+ * table's own setting), else its committed view; p_total_row_fixed_indices[i]
+ * of 0 packs every row of that view in packed-index order, and a count n
+ * packs exactly the rows at the next n fixed indexes of p_row_fixed_indices,
+ * which holds the chosen indexes of all tables one after another (it may be
+ * null when every count is 0). Each table carries its name (a persistent
+ * table its registry path; an unnamed table ""), its row and column counts,
+ * change counter, column definitions with qualifiers, properties,
+ * structured-data definitions and defaults, and its rows as stored.
+ * The read locks of all the tables are taken in array order (a table given
+ * twice once) and released in the same order; threads that pack
+ * overlapping sets must give them in one order. Zero tables give a buffer
+ * of 40 bytes. Returns 0; SR_E_NULL_POINTER; SR_E_INVALID_HANDLE for a null
+ * handle; SR_E_NO_ROW_FOR_INDEX for a chosen fixed index outside a table;
+ * SR_E_ROW_DELETED for a chosen row the view does not show;
+ * SR_E_LIBRARY_CALL; SR_E_NO_MEMORY (also for more than 4 GiB). No buffer
+ * on failure. It may be called in a forked child.
+ */
+QV_SR_EXPORT int32_t sr_pack_tables_1(uint32_t total_tables,
+                                      const sr_opaque_handle_t *p_table_handles,
+                                      const uint32_t *p_uncommitted_updates_visible,
+                                      const uint32_t *p_total_row_fixed_indices,
+                                      const uint32_t *p_row_fixed_indices, void **p_p_buffer);
+
+/*
+ * Stores the number of tables of a buffer in this machine's byte order.
+ * Returns 0; SR_E_NULL_POINTER; SR_E_TABLE_UNREADABLE.
+ */
+QV_SR_EXPORT int32_t sr_get_total_packed_tables_1(const void *p_buffer,
+                                                  uint32_t *p_total_packed_tables);
+
+/*
+ * Stores in *p_table_name the name table `table_index` (from 0) was packed
+ * under: a NUL-terminated string inside the buffer (no copy; valid while
+ * the buffer is). The buffer must be in this machine's byte order.
+ * Returns 0; SR_E_NULL_POINTER; SR_E_NO_ROW_FOR_INDEX when the index is not
+ * below the table count; SR_E_TABLE_UNREADABLE.
+ */
+QV_SR_EXPORT int32_t sr_get_packed_table_name_1(const void *p_buffer, uint32_t table_index,
+                                                const char **p_table_name);
+
+/*
+ * Converts a buffer written on a machine of the other byte order to this
+ * machine's, in place. With `header_already_converted` 0 the header tells
+ * whether anything needs converting, and is marked converted, so a second
+ * call (and a call on a buffer packed here) does nothing and returns 0.
+ * Otherwise the caller has taken the header over itself and
+ * `do_conversion` not 0 asks for the rest to be converted. Returns 0;
+ * SR_E_NULL_POINTER; SR_E_TABLE_UNREADABLE when the buffer does not hold
+ * together (it may then be partly converted: discard it);
+ * SR_E_LIBRARY_CALL. It takes no lock.
+ */
+QV_SR_EXPORT int32_t sr_convert_packed_table_buffer_1(void *p_buffer,
+                                                      uint32_t header_already_converted,
+                                                      int32_t do_conversion);
+
+/*
+ * Makes table `table_index` of a buffer in this machine's byte order a
+ * transient table of the tree and stores its handle in *p_table. It is
+ * named as it was packed (a name "" makes an unnamed table, which
+ * sr_close_table_1 frees) and holds the packed rows and columns, every row
+ * committed, with the packed change counter. It is read only for good:
+ * every change, and opening it for writing, returns SR_E_ACCESS. It keeps
+ * its own copy of the rows, in one block that goes when the table is freed
+ * (like any named transient table it stays in the tree after its last
+ * handle is closed, until the tree is closed); it can be packed again.
+ * Key hashing: with a non-null `hash_function` the table gets a key hash
+ * table of `total_hash_buckets` buckets hashed by it and compared by
+ * `compare_function` (both must be given: SR_E_NULL_POINTER); with a null
+ * one a resource-handle key gets the built-in hash and any other key none.
+ * Returns 0; SR_E_INVALID_HANDLE; SR_E_NULL_POINTER; SR_E_NO_ROW_FOR_INDEX
+ * when the index is not below the table count; SR_E_TABLE_UNREADABLE;
+ * SR_E_INVALID_PATH when the name is not a path or lies below a mount point
+ * of the tree (an unpacked table has no file); SR_E_TABLE_EXISTS;
+ * SR_E_DUPLICATE_KEY when two rows hold one key under SR_PRIMARY_KEY; the
+ * codes of sr_create_table_1 for column definitions it would refuse;
+ * SR_E_LIBRARY_CALL; SR_E_NO_MEMORY; SR_E_INTERNAL in a forked child.
+ */
+QV_SR_EXPORT int32_t sr_unpack_table_1(const void *p_buffer, uint32_t total_hash_buckets,
+                                       sr_hash_function_t hash_function,
+                                       sr_hash_keys_compare_function_t compare_function,
+                                       sr_opaque_handle_t tree_handle, uint32_t table_index,
+                                       sr_opaque_handle_t *p_table);
+
 /* ---- Maintenance ---------------------------------------------------------- */
 
 /*

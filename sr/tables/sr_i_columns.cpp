@@ -80,6 +80,23 @@ char *put_string(unsigned char *&p_cursor, const char *p_text) {
 
 }  // namespace
 
+std::vector<sr_sd_field_def_t> sr_i_structured_definition_fields(const sr_sd_def_t *p_packed) {
+  const auto *p_cursor = reinterpret_cast<const unsigned char *>(p_packed);
+  uint32_t total_fields;
+  std::memcpy(&total_fields, p_cursor, sizeof total_fields);
+  p_cursor += sizeof total_fields;
+  std::vector<sr_sd_field_def_t> fields(total_fields);
+  for (sr_sd_field_def_t &field : fields) {
+    uint32_t type;
+    std::memcpy(&type, p_cursor, sizeof type);
+    p_cursor += sizeof type;
+    field.type = static_cast<qv_data_type_t>(type);
+    field.name = reinterpret_cast<char *>(const_cast<unsigned char *>(p_cursor));
+    p_cursor += std::strlen(field.name) + 1;
+  }
+  return fields;
+}
+
 bool sr_i_valid_column_name(const char *p_name) {
   if (p_name == nullptr) {
     return false;

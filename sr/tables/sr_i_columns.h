@@ -19,6 +19,11 @@ inline bool sr_i_is_variable_length(qv_data_type_t type) {
   return number < QV_DATA_TYPE_LIMIT && (cu_dtc_table_1[number] & CU_DTC_POINTER) != 0;
 }
 
+/* The fields of a structured-data definition as the metadata record keeps
+ * it (a field count, then per field its type word and its NUL-terminated
+ * name); the names point into that form. */
+std::vector<sr_sd_field_def_t> sr_i_structured_definition_fields(const sr_sd_def_t *p_packed);
+
 /* A column name: 1 to 255 bytes, a letter, then letters, digits and "_". */
 bool sr_i_valid_column_name(const char *p_name);
 

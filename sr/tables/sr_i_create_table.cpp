@@ -30,11 +30,14 @@ struct table_closer {
   }
 };
 
-// Everything but the pool's first block.
-int32_t create_transient_table_common(sr_i_tree_t *p_tree, const char *p_name,
-                                      const sr_column_t *p_columns, uint32_t total_columns,
-                                      int32_t mode, sr_hash_table_t *p_rows_hash_table,
-                                      uint32_t expected_rows, sr_i_table_t **pp_table) {
+}  // namespace
+
+int32_t sr_i_create_transient_table_object(sr_i_tree_t *p_tree, const char *p_name,
+                                           const sr_column_t *p_columns, uint32_t total_columns,
+                                           int32_t mode, uint32_t initial_rows,
+                                           cu_iconv_t *p_default_conversion,
+                                           sr_hash_table_t *p_rows_hash_table,
+                                           sr_i_table_t **pp_table) {
   uint32_t key_position = 0;
   if (const int32_t rc = sr_i_validate_columns(p_columns, total_columns, key_position); rc != 0) {
     sr_i_hash_table_close(p_rows_hash_table);
@@ -56,17 +59,14 @@ int32_t create_transient_table_common(sr_i_tree_t *p_tree, const char *p_name,
   if (p_name != nullptr && (p_new_table->p_name = strdup(p_name)) == nullptr) {
     return sr_i_raise_no_memory();
   }
-  if (const int32_t rc = sr_i_establish_rows_index(
-          p_new_table, std::max(expected_rows, Sr_Initial_Transient_Rows));
-      rc != 0) {
+  if (const int32_t rc = sr_i_establish_rows_index(p_new_table, initial_rows); rc != 0) {
     return rc;
   }
   std::vector<unsigned char> packed_defaults;
   uint32_t total_variable_length_columns = 0;
-  cu_iconv_t *p_conversion = p_tree ? p_tree->p_to_table_string_conversion_handle : nullptr;
-  if (const int32_t rc =
-          sr_i_pack_variable_length_default_values(p_conversion, columns.data(), total_columns,
-                                                   packed_defaults, total_variable_length_columns);
+  if (const int32_t rc = sr_i_pack_variable_length_default_values(
+          p_default_conversion, columns.data(), total_columns, packed_defaults,
+          total_variable_length_columns);
       rc != 0) {
     return rc;
   }
@@ -82,16 +82,16 @@ int32_t create_transient_table_common(sr_i_tree_t *p_tree, const char *p_name,
   return 0;
 }
 
-}  // namespace
-
 int32_t sr_i_create_transient_table(sr_i_tree_t *p_tree, const char *p_name, sr_column_t *p_columns,
                                     uint32_t total_columns, int32_t mode,
                                     sr_hash_table_t *p_rows_hash_table, sr_i_table_t **pp_table,
                                     uint32_t expected_rows) {
   sr_i_table_t *p_new_table = nullptr;
-  if (const int32_t rc =
-          create_transient_table_common(p_tree, p_name, p_columns, total_columns, mode,
-                                        p_rows_hash_table, expected_rows, &p_new_table);
+  cu_iconv_t *p_conversion = p_tree ? p_tree->p_to_table_string_conversion_handle : nullptr;
+  if (const int32_t rc = sr_i_create_transient_table_object(
+          p_tree, p_name, p_columns, total_columns, mode,
+          std::max(expected_rows, Sr_Initial_Transient_Rows), p_conversion, p_rows_hash_table,
+          &p_new_table);
       rc != 0) {
     return rc;
   }

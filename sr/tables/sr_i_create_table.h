@@ -38,6 +38,21 @@ int32_t sr_i_create_transient_table(struct sr_i_tree_struct_t *p_tree, const cha
                                     uint32_t expected_rows = Sr_Initial_Transient_Rows);
 
 /*
+ * The common step of making a transient table, without the first pool
+ * block and without a mode: a row index of `initial_rows` positions, the
+ * column defaults encoded through `p_default_conversion` (null when they
+ * are in the stored form already). The table takes `p_rows_hash_table` as
+ * sr_i_create_transient_table does. Returns 0 and the table in *pp_table,
+ * or 104, 105, 106, 107, 108, 11, 12 (raised).
+ */
+int32_t sr_i_create_transient_table_object(struct sr_i_tree_struct_t *p_tree, const char *p_name,
+                                           const sr_column_t *p_columns, uint32_t total_columns,
+                                           int32_t mode, uint32_t initial_rows,
+                                           cu_iconv_t *p_default_conversion,
+                                           sr_hash_table_t *p_rows_hash_table,
+                                           sr_i_table_t **pp_table);
+
+/*
  * The dispatcher of the exported creation calls: checks the arguments,
  * resolves the path and makes a transient table entered into the tree, or
  * refuses. Takes ownership of `p_rows_hash_table`.

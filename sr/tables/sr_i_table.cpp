@@ -80,6 +80,9 @@ void sr_i_close_table(sr_i_table_t *p_table) {
   sr_i_close_table_file(p_table->p_file);
   std::free(p_table->p_persistent_table_registry_path);
   sr_i_free_application_metadata(p_table->p_application_metadata);
+  // The rows of a table unpacked from a packed buffer, which its index and
+  // hash elements pointed into.
+  std::free(p_table->p_packed_rows_array);
   std::free(p_table);
 }
 

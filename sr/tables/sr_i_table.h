@@ -109,6 +109,8 @@ typedef struct sr_i_table_struct_t {
    * part of a large index no row has reached yet is never touched. */
   sr_i_index_entry_t *p_rows_never_used;
   struct sr_i_application_metadata_struct_t *p_application_metadata;
+  /* A table unpacked from a packed buffer keeps its rows here, one block,
+   * instead of in the pool; null for every other table. */
   void *p_packed_rows_array;
   /* Where change entries come from: the newest block first in the chain,
    * whose last `unused_change_entries` entries were never handed out, and

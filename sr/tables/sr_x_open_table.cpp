@@ -115,6 +115,11 @@ int32_t do_open_table(sr_opaque_handle_t tree_handle, const char *p_registry_pat
   // The reference is counted once nothing can fail any more, so that a
   // refused opening leaves the count as it was.
   const bool writing = (mode & Open_For_Writing) != 0;
+  // Rows unpacked from a packed buffer live outside the pool, where no
+  // change may replace or free them: such a table is read only for good.
+  if (writing && p_table->p_packed_rows_array != nullptr) {
+    return sr_i_raise(SR_E_ACCESS);
+  }
   if (p_table->references == 0) {
     take_open_mode(p_table, mode);  // present in the tree but not open
   } else if (writing && p_table->mode == Sr_Mode_Writable) {

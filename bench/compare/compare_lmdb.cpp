@@ -11,6 +11,7 @@
 #include <algorithm>
 #include <cstring>
 #include <filesystem>
+#include <map>
 #include <memory>
 #include <string>
 #include <utility>
@@ -191,6 +192,65 @@ void read_by_key(benchmark::State &state) {
   state.SetItemsProcessed(state.iterations());
 }
 
+// Workload 11: a table file of `rows` rows for each size, loaded before
+// the threads start and kept for the whole run; the threads only look it
+// up. Null when it could not be loaded.
+struct loaded_file {
+  scratch_directory directory{"lmdb-threads"};
+  environment env;
+};
+
+std::map<int64_t, std::unique_ptr<loaded_file>> &loaded_files() {
+  static std::map<int64_t, std::unique_ptr<loaded_file>> files;
+  return files;
+}
+
+void load_shared_environment(const benchmark::State &state) {
+  std::unique_ptr<loaded_file> &file = loaded_files()[state.range(0)];
+  if (file == nullptr) {
+    auto loaded = std::make_unique<loaded_file>();
+    if (open_loaded(loaded->env, loaded->directory.file("table.mdb"),
+                    make_rows(0, static_cast<uint64_t>(state.range(0))))) {
+      file = std::move(loaded);
+    }
+  }
+}
+
+// Each thread has its own read transaction, reset and renewed around each
+// read as in w1.
+void concurrent_read_by_key(benchmark::State &state) {
+  const auto rows = static_cast<uint32_t>(state.range(0));
+  const loaded_file *p_file = loaded_files().at(rows).get();
+  if (!check(state, p_file != nullptr, "load")) {
+    return;
+  }
+  const environment *env = &p_file->env;
+  transaction reader(*env, MDB_RDONLY);
+  if (!check(state, reader.begun(), "begin read")) {
+    return;
+  }
+  mdb_txn_reset(reader.handle());
+  const std::vector<std::string> keys = lookup_keys(rows);
+  config_row row{};
+  size_t next = first_read_of_thread(state, rows);
+  for (auto _ : state) {
+    MDB_val key = key_of(keys[next].c_str());
+    MDB_val data;
+    const bool found = mdb_txn_renew(reader.handle()) == 0 &&
+                       mdb_get(reader.handle(), env->table(), &key, &data) == 0;
+    if (found) {
+      copy_out(key, data, row);
+    }
+    mdb_txn_reset(reader.handle());
+    if (!check(state, found, "get")) {
+      return;
+    }
+    benchmark::DoNotOptimize(row);
+    next = next + 1 == keys.size() ? 0 : next + 1;
+  }
+  state.SetItemsProcessed(state.iterations());
+}
+
 // Each run loads into a new, empty table file; making it and dropping it are
 // not part of the load, so the timer is paused for both.
 void bulk_load(benchmark::State &state) {
@@ -344,6 +404,7 @@ void register_lmdb() {
   add(W5_Durable_Batch, System, &durable_updates<Batch_Changes>, durable_rows)->UseRealTime();
   add(W6_Open_And_Scan, System, &open_and_scan)->UseRealTime();
   add(W7_Memory, System, &memory)->Iterations(1)->UseRealTime();
+  add_concurrent_reads(System, &concurrent_read_by_key, &load_shared_environment);
 }
 
 }  // namespace compare

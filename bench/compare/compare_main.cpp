@@ -19,6 +19,7 @@
 #include <map>
 #include <string>
 #include <system_error>
+#include <thread>
 #include <tuple>
 #include <vector>
 
@@ -66,6 +67,19 @@ benchmark::internal::Benchmark *add(const std::string &workload, const std::stri
   }
   // Rates count the time a caller waits, flushes to disk included.
   return p_benchmark->UseRealTime();
+}
+
+benchmark::internal::Benchmark *add_concurrent_reads(const std::string &system,
+                                                     void (*function)(benchmark::State &),
+                                                     void (*setup)(const benchmark::State &)) {
+  benchmark::internal::Benchmark *p_benchmark =
+      add(W11_Concurrent_Reads, system, function, Concurrent_Read_Row_Counts)->Setup(setup);
+  for (const int threads : {1, 2, 4}) {
+    if (threads <= 2 || std::thread::hardware_concurrency() >= static_cast<unsigned>(threads)) {
+      p_benchmark->Threads(threads);
+    }
+  }
+  return p_benchmark;
 }
 
 bool check(benchmark::State &state, bool ok, const char *what) {
@@ -116,6 +130,36 @@ class comparison_reporter : public benchmark::ConsoleReporter {
     }
   }
 
+  // Workload 11 once more, as reads per second of all threads together and
+  // their gain over one thread; for ours, also its share of the floor's rate.
+  void print_concurrent_reads() const {
+    if (concurrent_reads_.empty()) {
+      return;
+    }
+    std::printf("\n%s: reads per second, all threads together\n", W11_Concurrent_Reads);
+    std::printf("%8s  %-22s %7s %14s %14s %14s\n", "rows", "system", "threads", "reads/s",
+                "over 1 thread", "of the floor");
+    for (const auto &[key, rates] : concurrent_reads_) {
+      const auto &[rows, system] = key;
+      const auto one_thread = rates.find(1);
+      const auto floor = concurrent_reads_.find({rows, W11_Floor});
+      for (const auto &[threads, rate] : rates) {
+        std::string scaling = "-";
+        if (one_thread != rates.end()) {
+          scaling = format_ratio(rate / one_thread->second);
+        }
+        std::string of_floor = "-";
+        if (system == "ours" && floor != concurrent_reads_.end() &&
+            floor->second.contains(threads)) {
+          of_floor = format_ratio(rate / floor->second.at(threads));
+        }
+        std::printf("%8lld  %-22s %7lld %13.2fM %14s %14s\n", static_cast<long long>(rows),
+                    system.c_str(), static_cast<long long>(threads), rate / 1e6, scaling.c_str(),
+                    of_floor.c_str());
+      }
+    }
+  }
+
  private:
   void collect(const Run &run) {
     // "<workload>/<system>/<rows>", possibly followed by settings such as
@@ -127,7 +171,11 @@ class comparison_reporter : public benchmark::ConsoleReporter {
       return;
     }
     const size_t third = name.find('/', second + 1);
-    const std::string workload = name.substr(0, first);
+    // Runs by several threads are told apart by their thread count.
+    std::string workload = name.substr(0, first);
+    if (!run.run_name.threads.empty()) {
+      workload += "_t" + std::to_string(run.threads);
+    }
     const std::string system = name.substr(first + 1, second - first - 1);
     const std::string rows = name.substr(
         second + 1, third == std::string::npos ? std::string::npos : third - second - 1);
@@ -137,6 +185,9 @@ class comparison_reporter : public benchmark::ConsoleReporter {
       groups_[{workload, rows}][system] = {memory->second.value, true};
     } else if (rate != run.counters.end() && rate->second.value > 0) {
       groups_[{workload, rows}][system] = {1e9 / rate->second.value, false};
+      if (workload.starts_with(W11_Concurrent_Reads)) {
+        concurrent_reads_[{std::stoll(rows), system}][run.threads] = rate->second.value;
+      }
     }
   }
 
@@ -170,6 +221,8 @@ class comparison_reporter : public benchmark::ConsoleReporter {
     }
   };
   std::map<std::pair<std::string, std::string>, std::map<std::string, figure>, group_order> groups_;
+  // Workload 11's rates by rows and system, then by thread count.
+  std::map<std::pair<int64_t, std::string>, std::map<int64_t, double>> concurrent_reads_;
 };
 
 void print_settings() {
@@ -202,6 +255,7 @@ int main(int argc, char **argv) {
   compare::comparison_reporter reporter;
   benchmark::RunSpecifiedBenchmarks(&reporter);
   reporter.print_table();
+  reporter.print_concurrent_reads();
   compare::print_settings();
   benchmark::Shutdown();
   return 0;

@@ -152,14 +152,14 @@ struct read_row {
   }
 };
 
-void read_by_key(benchmark::State &state) {
+// Reads every column of rows of `table` by key, in the lookup order from
+// read `next` on, for as long as the benchmark runs.
+void read_keys(benchmark::State &state, sr_opaque_handle_t table, size_t next) {
   const auto rows = static_cast<uint32_t>(state.range(0));
-  sr_opaque_handle_t table = loaded_transient_table(rows);
   if (!check(state, table != nullptr, "load the table")) {
     return;
   }
   const std::vector<std::string> keys = lookup_keys(rows);
-  size_t next = 0;
   for (auto _ : state) {
     read_row row;
     qv_value_t key{};
@@ -173,6 +173,51 @@ void read_by_key(benchmark::State &state) {
     row.release();
   }
   state.SetItemsProcessed(state.iterations());
+}
+
+void read_by_key(benchmark::State &state) {
+  read_keys(state, loaded_transient_table(state.range(0)), 0);
+}
+
+// Workload 11: the threads share the table w1 reads, loaded before they
+// start; they only look it up here.
+std::map<int64_t, sr_opaque_handle_t> &shared_tables() {
+  static std::map<int64_t, sr_opaque_handle_t> tables;
+  return tables;
+}
+
+void load_shared_table(const benchmark::State &state) {
+  shared_tables()[state.range(0)] = loaded_transient_table(state.range(0));
+}
+
+void read_shared_table(benchmark::State &state) {
+  read_keys(state, shared_tables().at(state.range(0)),
+            first_read_of_thread(state, static_cast<size_t>(state.range(0))));
+}
+
+// Workload 11's floor: a table of `rows` rows for each thread, each in a
+// tree of its own so that the threads share nothing, made before they
+// start and kept for the whole run. Indexed by row count, then thread.
+std::map<int64_t, std::vector<sr_opaque_handle_t>> &private_copies() {
+  static std::map<int64_t, std::vector<sr_opaque_handle_t>> copies;
+  return copies;
+}
+
+void load_private_copies(const benchmark::State &state) {
+  static std::vector<std::unique_ptr<tree>> owners;
+  std::vector<sr_opaque_handle_t> &copies = private_copies()[state.range(0)];
+  while (copies.size() < static_cast<size_t>(state.threads())) {
+    owners.push_back(std::make_unique<tree>());
+    copies.push_back(owners.back()->ok()
+                         ? create_loaded_table(owners.back()->handle(), "/private", state.range(0))
+                         : nullptr);
+  }
+}
+
+void read_private_copy(benchmark::State &state) {
+  const std::vector<sr_opaque_handle_t> &copies = private_copies().at(state.range(0));
+  read_keys(state, copies.at(static_cast<size_t>(state.thread_index())),
+            first_read_of_thread(state, static_cast<size_t>(state.range(0))));
 }
 
 template <bool Fixed_Index>
@@ -561,6 +606,8 @@ void register_ours() {
       ->Unit(benchmark::kMillisecond);
   add(W10_Ship_Table, "ours", ship_table, Ship_Row_Counts)->Unit(benchmark::kMillisecond);
   add(W10_Unpack, "ours", unpack, Ship_Row_Counts)->Unit(benchmark::kMillisecond);
+  add_concurrent_reads("ours", read_shared_table, load_shared_table);
+  add_concurrent_reads(W11_Floor, read_private_copy, load_private_copies);
 }
 
 }  // namespace compare

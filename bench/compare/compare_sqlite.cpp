@@ -52,6 +52,8 @@ constexpr const char *Copy_Integer =
     "CREATE TEMP TABLE selected AS SELECT * FROM config WHERE count > ?1";
 constexpr const char *Count_Copied = "SELECT count(*) FROM selected";
 constexpr const char *Drop_Copy = "DROP TABLE selected";
+// 256 MiB of page cache for a connection, more than any table here takes.
+constexpr const char *Large_Page_Cache = "PRAGMA cache_size=-262144";
 
 // Where a database lives and how its commits reach the disk.
 struct storage {
@@ -219,6 +221,65 @@ void read_by_rowid(benchmark::State &state) {
       return;
     }
     benchmark::DoNotOptimize(row);
+  }
+  state.SetItemsProcessed(state.iterations());
+}
+
+// Workload 11: a WAL table file of `rows` rows for each size, loaded before
+// the threads start and kept for the whole run, with the connection that
+// loaded it left open so that the WAL stays as the readers found it. The
+// threads only look it up.
+struct wal_file {
+  scratch_directory directory{"sqlite-threads"};
+  std::string path = directory.file("table.db");
+  connection loader{path};
+};
+
+std::map<int64_t, std::unique_ptr<wal_file>> &wal_files() {
+  static std::map<int64_t, std::unique_ptr<wal_file>> files;
+  return files;
+}
+
+void load_wal_file(const benchmark::State &state) {
+  std::unique_ptr<wal_file> &file = wal_files()[state.range(0)];
+  if (file == nullptr) {
+    auto loaded = std::make_unique<wal_file>();
+    if (create_table(loaded->loader, Wal_File, Keyed_Table,
+                     make_rows(0, static_cast<uint64_t>(state.range(0))))) {
+      file = std::move(loaded);
+    }
+  }
+}
+
+// Each thread opens a connection of its own (without SQLite's mutex, as the
+// connection is used by that thread alone), with a page cache large enough
+// for the table, and prepares its SELECT; each read is its own autocommit
+// read transaction.
+void concurrent_read_by_key(benchmark::State &state) {
+  const auto rows = static_cast<uint32_t>(state.range(0));
+  const wal_file *p_file = wal_files().at(rows).get();
+  if (!check(state, p_file != nullptr, "load")) {
+    return;
+  }
+  connection db(p_file->path, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX);
+  if (!check(state, db.opened() && db.execute(Large_Page_Cache), "open")) {
+    return;
+  }
+  statement select(db, Select_By_Key);
+  if (!check(state, select.prepared(), "prepare select")) {
+    return;
+  }
+  const std::vector<std::string> keys = lookup_keys(rows);
+  config_row row{};
+  size_t next = first_read_of_thread(state, rows);
+  for (auto _ : state) {
+    const bool found =
+        bind_text(select.handle(), 1, keys[next].c_str()) && read_one(select.handle(), row);
+    if (!check(state, found, "select by key")) {
+      return;
+    }
+    benchmark::DoNotOptimize(row);
+    next = next + 1 == keys.size() ? 0 : next + 1;
   }
   state.SetItemsProcessed(state.iterations());
 }
@@ -569,6 +630,7 @@ void register_sqlite() {
       ->Unit(benchmark::kMillisecond);
   add(W10_Ship_Table, Memory.system, &ship_table, Ship_Row_Counts)
       ->Unit(benchmark::kMillisecond);
+  add_concurrent_reads(Wal_File.system, &concurrent_read_by_key, &load_wal_file);
 }
 
 }  // namespace compare

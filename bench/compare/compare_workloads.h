@@ -72,6 +72,13 @@ inline config_row make_row(uint32_t i) {
 //     SQLite: sqlite3_deserialize into a new connection), and every column
 //     of every row read there; one item is one row. w10_unpack times the
 //     unpacking alone.
+//  w11 concurrent reads: w1's read by key, by 1, 2 and (where the machine
+//     has four processors) 4 threads at once from one table held in memory
+//     (LMDB: one read transaction per thread, reset and renewed around each
+//     read; SQLite: one connection per thread to one WAL file). One item is
+//     one row read by any thread, so the rate is all threads' together. The
+//     floor ("private-copies") is the same threads each reading a table of
+//     its own through our interface, sharing nothing.
 inline constexpr const char *W1_Read_By_Key = "w1_read_by_key";
 inline constexpr const char *W2_Read_By_Packed_Index = "w2_read_by_packed_index";
 inline constexpr const char *W2_Read_By_Fixed_Index = "w2_read_by_fixed_index";
@@ -86,6 +93,9 @@ inline constexpr const char *W8_Select_Mixed = "w8_selection_scan_mixed";
 inline constexpr const char *W9_Selection_Copy = "w9_selection_copy";
 inline constexpr const char *W10_Ship_Table = "w10_ship_table";
 inline constexpr const char *W10_Unpack = "w10_unpack";
+inline constexpr const char *W11_Concurrent_Reads = "w11_concurrent_reads";
+// The system name of workload 11's floor.
+inline constexpr const char *W11_Floor = "private-copies";
 
 // Rows of the tables the durable workloads change, and changes per batch.
 inline constexpr uint32_t Durable_Table_Rows = 1000;
@@ -100,6 +110,8 @@ inline const std::vector<int64_t> Selection_Copy_Row_Counts = {1000000};
 
 // The table size of the shipping workload.
 inline const std::vector<int64_t> Ship_Row_Counts = {100000};
+// The table sizes of the concurrent reads.
+inline const std::vector<int64_t> Concurrent_Read_Row_Counts = {1000, 100000};
 
 // The values of the selection criteria for a table of `rows` rows, the same
 // in every system; each picks about a tenth of the rows.
@@ -189,6 +201,20 @@ uint64_t heap_bytes_in_use();
 benchmark::internal::Benchmark *add(const std::string &workload, const std::string &system,
                                     void (*function)(benchmark::State &),
                                     const std::vector<int64_t> &rows = Row_Counts);
+
+// Registers `function` as a workload 11 benchmark of `system`, run by each
+// thread count the machine has processors for; `setup` makes what the
+// threads share before they start.
+benchmark::internal::Benchmark *add_concurrent_reads(const std::string &system,
+                                                     void (*function)(benchmark::State &),
+                                                     void (*setup)(const benchmark::State &));
+
+// Where the reads of the calling thread start in the lookup order: the
+// threads spread evenly over it, so that they do not read the same rows in
+// step.
+inline size_t first_read_of_thread(const benchmark::State &state, size_t rows) {
+  return rows * static_cast<size_t>(state.thread_index()) / static_cast<size_t>(state.threads());
+}
 
 // Fails the running benchmark with `what` when `ok` is false. Returns `ok`.
 bool check(benchmark::State &state, bool ok, const char *what);

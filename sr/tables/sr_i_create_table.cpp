@@ -88,10 +88,10 @@ int32_t sr_i_create_transient_table(sr_i_tree_t *p_tree, const char *p_name, sr_
                                     uint32_t expected_rows) {
   sr_i_table_t *p_new_table = nullptr;
   cu_iconv_t *p_conversion = p_tree ? p_tree->p_to_table_string_conversion_handle : nullptr;
-  if (const int32_t rc = sr_i_create_transient_table_object(
-          p_tree, p_name, p_columns, total_columns, mode,
-          std::max(expected_rows, Sr_Initial_Transient_Rows), p_conversion, p_rows_hash_table,
-          &p_new_table);
+  if (const int32_t rc =
+          sr_i_create_transient_table_object(p_tree, p_name, p_columns, total_columns, mode,
+                                             std::max(expected_rows, Sr_Initial_Transient_Rows),
+                                             p_conversion, p_rows_hash_table, &p_new_table);
       rc != 0) {
     return rc;
   }

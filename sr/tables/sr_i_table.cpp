@@ -242,11 +242,12 @@ bool sr_i_record_contained_in_block(const sr_i_table_t *p_table, uint32_t offset
 
 void sr_i_swap_table_contents(sr_i_table_t *p_open, sr_i_table_t *p_other) {
   // Everything moves but what makes the open object what it is to its
-  // holders: its lock, its reference count and its place in the tree.
+  // holders: its lock, its reference count and its place in the tree. The
+  // lock is never copied (copying a table leaves it where it is), since
+  // readers count themselves in it without its mutex while this runs.
   sr_i_table_t kept = *p_open;
   *p_open = *p_other;
   *p_other = kept;
-  std::swap(p_open->lock, p_other->lock);
   std::swap(p_open->references, p_other->references);
   std::swap(p_open->p_tree, p_other->p_tree);
   std::swap(p_open->p_next, p_other->p_next);

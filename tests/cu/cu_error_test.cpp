@@ -70,6 +70,36 @@ TEST(ErrorInformation, EachThreadSeesOnlyItsOwnError) {
   EXPECT_EQ(mine.text, "main thread here\n");
 }
 
+// A thread's record goes with its other thread-local objects when it ends
+// (and the main thread's before static objects and atexit handlers), while
+// those may still call a library: from then on an error is reported by its
+// code alone, and nothing freed is touched.
+struct caller_at_thread_end {
+  int32_t *p_set_result = nullptr;
+  last_error *p_seen = nullptr;
+  ~caller_at_thread_end() {
+    *p_set_result = cu_set_error_1(12, 0, "", 1, 9, "late %1$s\n", "error");
+    *p_seen = read_last_error();
+    cu_set_no_error_1();
+  }
+};
+thread_local caller_at_thread_end Caller_At_Thread_End;
+
+TEST(ErrorInformation, CallsAfterTheThreadsRecordIsGoneReportByCodeAlone) {
+  int32_t set_result = 0;
+  last_error seen{-1, -1, "unset"};
+  std::thread ending([&] {
+    // Made before the record, so destroyed after it.
+    Caller_At_Thread_End.p_set_result = &set_result;
+    Caller_At_Thread_End.p_seen = &seen;
+    cu_set_error_1(101, 0, "", 1, 8, "while alive\n");
+  });
+  ending.join();
+  EXPECT_EQ(set_result, 12);
+  EXPECT_EQ(seen.code, 0);
+  EXPECT_EQ(seen.text, "");
+}
+
 // The catalog's text is preferred and may reorder the inserts; a faulty
 // translation, a message the catalog lacks or a missing catalog give the
 // default text.

@@ -66,6 +66,8 @@ BEGIN {
   call[113] = "sr_get_total_packed_tables_1"
   call[115] = "sr_get_packed_table_name_1"
   call[117] = "sr_convert_packed_table_buffer_1"
+  call[141] = "sr_i_dump_table"
+  call[143] = "sr_i_dump_tree"
   # Return codes (qv_sr.h).
   code[10] = "SR_E_SYSTEM_CALL"
   code[11] = "SR_E_LIBRARY_CALL"

@@ -943,6 +943,25 @@ QV_SR_EXPORT int32_t sr_unpack_table_1(const void *p_buffer, uint32_t total_hash
                                        sr_opaque_handle_t tree_handle, uint32_t table_index,
                                        sr_opaque_handle_t *p_table);
 
+/* ---- Diagnostic dumps ------------------------------------------------------ */
+
+/*
+ * Print a readable picture of internals to standard output, for people
+ * debugging a program or the library; the form is for reading and may
+ * change between versions. sr_i_dump_table shows a table: name, mode,
+ * counters and transaction state, column definitions, every used position
+ * of the row index with the row's state in the two views (committed,
+ * added, updated, deleted), its records, file offsets and hash bucket, the
+ * free index entries, the pending change lists, the record pool's blocks
+ * and free records, the key hash table's occupancy, and for a persistent
+ * table its file bookkeeping. It takes the table's read lock.
+ * sr_i_dump_tree shows a tree's mount points and every table in it, named
+ * and unnamed, under the tree's write lock and each table's read lock.
+ * Both return 0, or SR_E_INVALID_HANDLE for a null handle.
+ */
+QV_SR_EXPORT int32_t sr_i_dump_table(sr_opaque_handle_t table_handle);
+QV_SR_EXPORT int32_t sr_i_dump_tree(sr_opaque_handle_t tree_handle);
+
 /* ---- Maintenance ---------------------------------------------------------- */
 
 /*

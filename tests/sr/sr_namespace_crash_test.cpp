@@ -112,7 +112,9 @@ class NamespaceCrash : public ::testing::Test {
  protected:
   // On a disk: its flushes take long enough for the kills to land inside
   // the operations.
-  void SetUp() override { ASSERT_NE(directory_ = sr_test::new_directory("qv_ns_crash", false), ""); }
+  void SetUp() override {
+    ASSERT_NE(directory_ = sr_test::new_directory("qv_ns_crash", false), "");
+  }
   void TearDown() override {
     if (!HasFailure()) {
       std::filesystem::remove_all(directory_);
@@ -175,14 +177,11 @@ TEST_F(NamespaceCrash, AKilledCopyOrMoveLeavesEachTableWholeAtItsSourceOrItsTarg
     child_report report;
     const std::string problem = sr_killed_child::run_and_kill(
         messages, delay,
-        [&](int pipe_fd) {
-          move_tables(directory_, child_seed, 1 + 10000 * (point + 1), pipe_fd);
-        },
+        [&](int pipe_fd) { move_tables(directory_, child_seed, 1 + 10000 * (point + 1), pipe_fd); },
         [&](const std::string &line) { take_line(line, report); });
     const std::string where = "seed " + std::to_string(seed) + " (SR_CRASH_SEED), crash point " +
-                              std::to_string(point) + ", killed after " +
-                              std::to_string(messages) + " messages + " + std::to_string(delay) +
-                              " us";
+                              std::to_string(point) + ", killed after " + std::to_string(messages) +
+                              " messages + " + std::to_string(delay) + " us";
     ASSERT_EQ(report.error.empty() ? problem : report.error, "") << where;
     for (const operation &step : report.done) {
       known = after(known, step);
@@ -240,8 +239,7 @@ TEST_F(NamespaceCrash, AKilledCopyOrMoveLeavesEachTableWholeAtItsSourceOrItsTarg
   }
   std::cout << "in all " << total_in_flight << "; its outcome had reached the disk at "
             << new_outcomes << ", a moved table was at both paths at " << between
-            << "; side files found after kills: " << rewrite_files
-            << "; operations done: ";
+            << "; side files found after kills: " << rewrite_files << "; operations done: ";
   for (const auto &[kind, count] : done) {
     std::cout << kind << " " << count << ", ";
   }

@@ -60,6 +60,7 @@ struct operation {
   std::string source;
   std::string target;
   table_state carried;
+  bool operator==(const operation &) const = default;
 };
 
 // As one line, after a tag ("P", "C"), and back.
@@ -247,7 +248,8 @@ class random_operations {
     table_state seen;
     const std::string problem = sr_versioned::read_rows(open_target, seen, Payload_Spread);
     if (copied && problem_.empty() && !(problem.empty() && seen == files_[target])) {
-      problem_ = "the open target reads " + (problem.empty() ? sr_versioned::describe(seen) : problem);
+      problem_ =
+          "the open target reads " + (problem.empty() ? sr_versioned::describe(seen) : problem);
     }
     check(sr_close_table_1(open_target), "closing the target");
   }
@@ -286,9 +288,8 @@ class random_operations {
                "opening the table moved into memory")) {
       return;
     }
-    carry_out({"move-memory", "-", target, moved}, [&] {
-      return sr_move_table_by_handle_1(table, path_of(target).c_str(), 1);
-    });
+    carry_out({"move-memory", "-", target, moved},
+              [&] { return sr_move_table_by_handle_1(table, path_of(target).c_str(), 1); });
     check(sr_close_table_1(table), "closing the table moved to disk");
   }
 

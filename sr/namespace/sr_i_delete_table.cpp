@@ -45,10 +45,14 @@ int32_t sr_i_delete_table(sr_i_tree_t *p_tree, const char *p_registry_path) {
   return sr_i_remove_table_files(key);
 }
 
-int32_t sr_i_remove_table_files(const std::string &file) {
-  const int32_t rc = sr_i_remove_file_durably(file.c_str());
-  if (rc == 0) {
+int32_t sr_i_remove_table_files(const std::string &file, bool *p_removed) {
+  bool removed = false;
+  const int32_t rc = sr_i_remove_file_durably(file.c_str(), &removed);
+  if (removed) {
     sr_i_discard_file((file + ".rewrite").c_str());
+  }
+  if (p_removed != nullptr) {
+    *p_removed = removed;
   }
   return rc;
 }

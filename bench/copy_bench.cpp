@@ -84,8 +84,8 @@ sr_opaque_handle_t tree_with_table(const std::string &directory) {
     qv_value_t *pointers[3] = {&values[0], &values[1], &values[2]};
     made = sr_add_row_1(table, names, pointers, 3) == 0;
   }
-  made = made && sr_apply_1(table, 0) == 0 && sr_commit_1(table) == 0 &&
-         sr_close_table_1(table) == 0;
+  made =
+      made && sr_apply_1(table, 0) == 0 && sr_commit_1(table) == 0 && sr_close_table_1(table) == 0;
   if (!made) {
     sr_close_tree_1(tree);
     return nullptr;

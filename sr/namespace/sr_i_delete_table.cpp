@@ -10,16 +10,19 @@
 #include "storage/sr_i_files.h"
 
 void sr_i_take_out_of_tree(sr_i_tree_t *p_tree, sr_i_table_t *p_table) {
-  if (p_tree->unnamed_tables.erase(p_table) == 0) {
+  if (p_tree->unnamed_tables.erase(p_table) == 0 && p_tree->detached_tables.erase(p_table) == 0) {
     std::erase_if(p_tree->tables, [&](const auto &entry) { return entry.second == p_table; });
   }
 }
 
 void sr_i_detach_table(sr_i_tree_t *p_tree, sr_i_table_t *p_table) {
   sr_i_take_out_of_tree(p_tree, p_table);
-  // An unnamed table is freed by its last close whatever its count says.
+  // An unnamed table is freed by its last close whatever its count says;
+  // a named one held by handles is the tree's to free if they never are.
   if (p_table->references == 0) {
     sr_i_close_table(p_table);
+  } else if (p_table->p_name != nullptr) {
+    p_tree->detached_tables.insert(p_table);
   }
 }
 

@@ -69,7 +69,7 @@ int32_t sr_i_duplicate_table(sr_i_tree_t *p_tree, sr_i_table_t *p_source, const 
  */
 int32_t sr_i_delete_table(sr_i_tree_t *p_tree, const char *p_registry_path);
 
-/* Takes a table out of its tree's named tables or unnamed set, without
+/* Takes a table out of its tree's named, unnamed or detached tables, without
  * freeing it. The caller holds the tree's write lock. */
 void sr_i_take_out_of_tree(sr_i_tree_t *p_tree, sr_i_table_t *p_table);
 

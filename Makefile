@@ -38,9 +38,10 @@ BENCH_ARGS ?= --benchmark_min_time=0.2
 bench:
 	@tools/install-deps.sh bench
 	cmake --preset default
-	cmake --build build -j$(JOBS) --target compare_bench schema_bench
+	cmake --build build -j$(JOBS) --target compare_bench schema_bench copy_bench
 	build/bench/compare_bench $(BENCH_ARGS)
 	build/bench/schema_bench $(BENCH_ARGS)
+	build/bench/copy_bench $(BENCH_ARGS)
 
 fuzz-smoke: deps
 	tools/fuzz-smoke.sh

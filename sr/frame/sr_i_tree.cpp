@@ -98,6 +98,10 @@ int32_t sr_i_close_tree(sr_i_tree_t *p_tree) {
       sr_i_close_table(p_table);
     }
     p_tree->unnamed_tables.clear();
+    for (sr_i_table_t *p_table : p_tree->detached_tables) {
+      sr_i_close_table(p_table);
+    }
+    p_tree->detached_tables.clear();
     p_tree->mount_points.clear();
   }
   sr_i_rw_close(&p_tree->lock);

@@ -40,6 +40,9 @@ typedef struct sr_i_tree_struct_t {
   std::map<std::string, struct sr_i_table_struct_t *, std::less<>> tables;
   /* Tables without a name, by address. */
   std::set<struct sr_i_table_struct_t *> unnamed_tables;
+  /* Named tables deleted, moved away or replaced while handles still held
+   * them: freed by their last close, or with the tree. */
+  std::set<struct sr_i_table_struct_t *> detached_tables;
   /* Mount points by name. */
   std::map<std::string, sr_i_mount_point_t, std::less<>> mount_points;
   /* From the process's code set into the stored form, and back; fixed for

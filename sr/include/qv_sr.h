@@ -785,7 +785,11 @@ QV_SR_EXPORT int32_t sr_abort_1(sr_opaque_handle_t table_handle);
  * SR_E_INVALID_PATH; SR_E_TABLE_EXISTS; SR_E_UNCOMMITTED; SR_E_NO_MEMORY;
  * SR_E_INTERNAL in a forked child; for files, SR_E_NO_TABLE (the source
  * file is missing), SR_E_ACCESS, SR_E_FILESYSTEM_FULL, SR_E_SYSTEM_CALL. On
- * failure the target and the source are as they were.
+ * failure the target and the source are as they were, with one exception:
+ * when only the flush of the directory failed after the new file took the
+ * target's name (or a moved source file was removed), the copy or move is
+ * in place, an open target shows it, and the code says that it may not
+ * survive a power cut; a move through a handle then leaves its source too.
  */
 QV_SR_EXPORT int32_t sr_copy_table_by_handle_1(sr_opaque_handle_t table_handle,
                                                const char *p_target_table_name, int32_t overwrite);

@@ -10,16 +10,19 @@
 #include "storage/sr_i_files.h"
 
 void sr_i_take_out_of_tree(sr_i_tree_t *p_tree, sr_i_table_t *p_table) {
-  if (p_tree->unnamed_tables.erase(p_table) == 0) {
+  if (p_tree->unnamed_tables.erase(p_table) == 0 && p_tree->detached_tables.erase(p_table) == 0) {
     std::erase_if(p_tree->tables, [&](const auto &entry) { return entry.second == p_table; });
   }
 }
 
 void sr_i_detach_table(sr_i_tree_t *p_tree, sr_i_table_t *p_table) {
   sr_i_take_out_of_tree(p_tree, p_table);
-  // An unnamed table is freed by its last close whatever its count says.
+  // An unnamed table is freed by its last close whatever its count says;
+  // a named one held by handles is the tree's to free if they never are.
   if (p_table->references == 0) {
     sr_i_close_table(p_table);
+  } else if (p_table->p_name != nullptr) {
+    p_tree->detached_tables.insert(p_table);
   }
 }
 
@@ -45,10 +48,14 @@ int32_t sr_i_delete_table(sr_i_tree_t *p_tree, const char *p_registry_path) {
   return sr_i_remove_table_files(key);
 }
 
-int32_t sr_i_remove_table_files(const std::string &file) {
-  const int32_t rc = sr_i_remove_file_durably(file.c_str());
-  if (rc == 0) {
+int32_t sr_i_remove_table_files(const std::string &file, bool *p_removed) {
+  bool removed = false;
+  const int32_t rc = sr_i_remove_file_durably(file.c_str(), &removed);
+  if (removed) {
     sr_i_discard_file((file + ".rewrite").c_str());
+  }
+  if (p_removed != nullptr) {
+    *p_removed = removed;
   }
   return rc;
 }

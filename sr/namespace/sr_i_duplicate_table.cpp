@@ -85,11 +85,10 @@ int32_t copy_file_contents(const std::string &source_file, int fd, const std::st
   return rc;
 }
 
-// Makes `target_file` the file `write(fd, path)` writes: into the target's
-// rewrite file, flushed, renamed over the target and the directory flushed.
-// On failure the rewrite file is removed and the target is as it was.
+// Writes the rewrite file of `target_file` through `write(fd, path)` and
+// flushes it. On failure the rewrite file is removed.
 template <typename Write>
-int32_t publish_file(const std::string &target_file, Write &&write) {
+int32_t write_side_file(const std::string &target_file, Write &&write) {
   const std::string rewrite_path = target_file + ".rewrite";
   int fd = -1;
   // Truncated: a crash may have left an older rewrite file behind.
@@ -101,11 +100,7 @@ int32_t publish_file(const std::string &target_file, Write &&write) {
     rc = sr_i_flush_file(fd, rewrite_path.c_str());
   }
   sr_i_close_file(fd);
-  bool renamed = false;
-  if (rc == 0) {
-    rc = sr_i_rename_durably(rewrite_path.c_str(), target_file.c_str(), &renamed);
-  }
-  if (!renamed) {
+  if (rc != 0) {
     sr_i_discard_file(rewrite_path.c_str());
   }
   return rc;
@@ -119,29 +114,32 @@ int32_t open_mode_of(const sr_i_table_t *p_table) {
   return p_table->implicitly_controlled != 0 ? SR_MODE_WRITE : SR_MODE_WRITE_EXPLICIT;
 }
 
-// Reads an open persistent target again from its new file into its own
-// object, under the object's write lock: its rows, columns, counters,
-// application metadata and file; its handles, name and mode stay.
-int32_t refresh_open_target(sr_i_tree_t *p_tree, sr_i_table_t *p_target) {
+// The table file `file` read into a new object opened as `p_like` is, with
+// a key hash table like its own, not in the tree.
+int32_t open_like(sr_i_tree_t *p_tree, const sr_i_table_t *p_like, const std::string &file,
+                  sr_i_table_t **pp_fresh) {
+  sr_hash_table_t *p_hash_table = nullptr;
+  if (const int32_t rc = sr_i_hash_table_open_like(p_like->p_rows_hash_table, &p_hash_table);
+      rc != 0) {
+    return rc;
+  }
+  return sr_i_open_persistent_table(p_tree, p_like->p_persistent_table_registry_path, file.c_str(),
+                                    open_mode_of(p_like), p_like->block_size, p_hash_table,
+                                    pp_fresh);
+}
+
+// Gives an open persistent target the image of `p_fresh`, read from its new
+// file, under the target's write lock: its rows, columns, counters,
+// application metadata and file; its handles, name and mode stay. Closes
+// `p_fresh`, which takes the old image and descriptor with it.
+int32_t take_new_image(sr_i_table_t *p_target, sr_i_table_t *p_fresh) {
+  table_closer closer{p_fresh};
   sr_i_write_guard target_lock(&p_target->lock);
   if (target_lock.result() != 0) {
     return target_lock.result();
   }
-  sr_hash_table_t *p_hash_table = nullptr;
-  if (const int32_t rc = sr_i_hash_table_open_like(p_target->p_rows_hash_table, &p_hash_table);
-      rc != 0) {
-    return rc;
-  }
-  sr_i_table_t *p_fresh = nullptr;
-  if (const int32_t rc = sr_i_open_persistent_table(
-          p_tree, p_target->p_persistent_table_registry_path, p_target->p_name,
-          open_mode_of(p_target), p_target->block_size, p_hash_table, &p_fresh);
-      rc != 0) {
-    return rc;
-  }
   sr_i_swap_after_metadata_update(p_target, p_fresh);
   std::swap(p_target->p_application_metadata, p_fresh->p_application_metadata);
-  sr_i_close_table(p_fresh);
   return 0;
 }
 
@@ -285,46 +283,84 @@ class duplication {
     if (p_open_target_ != nullptr && has_changes_on_the_way(p_open_target_)) {
       return sr_i_raise(SR_E_UNCOMMITTED);
     }
+    sr_i_table_t *p_fresh = nullptr;
+    int32_t rc = 0;
     {
       sr_i_target_lock locks;
-      if (const int32_t rc = locks.lock(target_.key, p_open_target_); rc != 0) {
+      if ((rc = locks.lock(target_.key, p_open_target_)) != 0) {
         return rc;
       }
       if (locks.target_length() != 0 && !overwrite_) {
         return sr_i_raise(SR_E_TABLE_EXISTS);
       }
-      if (const int32_t rc = write_target_file(); rc != 0) {
-        return rc;
-      }
+      rc = write_target_file(&p_fresh);
     }
-    // The file locks are given up first: the table reads its new file with
-    // the writer's lock of its own.
-    return p_open_target_ != nullptr ? refresh_open_target(p_tree_, p_open_target_) : 0;
+    // The file locks are given up first: the fresh image holds the writer's
+    // lock of the new file on its own descriptor. Once renamed, the new file
+    // is the target's even if the flush of its directory failed: the open
+    // table follows it, and the failure is returned.
+    if (p_fresh != nullptr) {
+      const int32_t swapped = take_new_image(p_open_target_, p_fresh);
+      rc = rc != 0 ? rc : swapped;
+    }
+    return rc;
   }
 
-  int32_t write_target_file() {
-    if (p_source_ != nullptr) {
-      return publish_file(target_.key, [&](int fd, const std::string &path) {
-        return sr_i_write_table_file(p_source_, fd, path);
-      });
-    }
-    if (remove_source_) {
+  // The new target file, from the source object, by renaming the source
+  // file, or as a copy of it. A target open here gets `*pp_fresh`, its new
+  // image, once the new file is in place.
+  int32_t write_target_file(sr_i_table_t **pp_fresh) {
+    if (p_source_ == nullptr && remove_source_) {
       // Between table files a move is one rename.
-      if (const int32_t rc = sr_i_rename_durably(source_file_.c_str(), target_.key.c_str());
-          rc != 0) {
+      bool renamed = false;
+      const int32_t rc = rename_into_place(source_file_, pp_fresh, &renamed);
+      if (!renamed) {
         return rc;
       }
       sr_i_discard_file((source_file_ + ".rewrite").c_str());
       // The source's name is gone from its directory too, if that is
       // another one.
       const std::string source_directory = directory_of(source_file_);
-      return source_directory == directory_of(target_.key)
-                 ? 0
+      return rc != 0 || source_directory == directory_of(target_.key)
+                 ? rc
                  : sr_i_flush_directory(source_directory.c_str());
     }
-    return publish_file(target_.key, [&](int fd, const std::string &path) {
-      return copy_file_contents(source_file_, fd, path);
+    const int32_t rc = write_side_file(target_.key, [&](int fd, const std::string &path) {
+      return p_source_ != nullptr ? sr_i_write_table_file(p_source_, fd, path)
+                                  : copy_file_contents(source_file_, fd, path);
     });
+    if (rc != 0) {
+      return rc;
+    }
+    const std::string rewrite_path = target_.key + ".rewrite";
+    bool renamed = false;
+    const int32_t renaming = rename_into_place(rewrite_path, pp_fresh, &renamed);
+    if (!renamed) {
+      sr_i_discard_file(rewrite_path.c_str());
+    }
+    return renaming;
+  }
+
+  // Renames the complete file `from` over the target and flushes the
+  // directory. A target open here first reads `from` into a fresh image,
+  // so that nothing is left to fail between the rename and the exchange of
+  // images; the image goes to `*pp_fresh` once the file has the target's
+  // name (`*p_renamed`), even if the flush of the directory failed.
+  int32_t rename_into_place(const std::string &from, sr_i_table_t **pp_fresh, bool *p_renamed) {
+    sr_i_table_t *p_fresh = nullptr;
+    if (p_open_target_ != nullptr) {
+      if (const int32_t rc = open_like(p_tree_, p_open_target_, from, &p_fresh); rc != 0) {
+        return rc;
+      }
+    }
+    table_closer closer{p_fresh};
+    const int32_t rc = sr_i_rename_durably(from.c_str(), target_.key.c_str(), p_renamed);
+    if (*p_renamed && p_fresh != nullptr) {
+      p_fresh->p_file->path = target_.key;
+      p_fresh->p_file->rewrite_path = target_.key + ".rewrite";
+      *pp_fresh = closer.release();
+    }
+    return rc;
   }
 
   int32_t to_memory(bool &source_done) {
@@ -332,11 +368,15 @@ class duplication {
       return sr_i_raise(SR_E_TABLE_EXISTS);
     }
     sr_i_table_t *p_new = nullptr;
+    // A source file that is gone although the flush of its directory
+    // failed leaves the table in memory alone: it is entered under the
+    // target all the same, and the failure returned.
+    int32_t removal = 0;
+    bool removed = false;
     if (p_source_ != nullptr && remove_source_) {
-      if (p_source_->p_file != nullptr) {
-        if (const int32_t rc = sr_i_remove_table_files(p_source_->p_file->path); rc != 0) {
-          return rc;
-        }
+      if (p_source_->p_file != nullptr &&
+          (removal = sr_i_remove_table_files(p_source_->p_file->path, &removed)) != 0 && !removed) {
+        return removal;
       }
       if (const int32_t rc = rename_object(p_source_, target_.key); rc != 0) {
         return rc;
@@ -355,17 +395,17 @@ class duplication {
           rc != 0) {
         return rc;
       }
-      if (remove_source_) {
-        if (const int32_t rc = sr_i_remove_table_files(source_file_); rc != 0) {
-          sr_i_close_table(p_new);
-          return rc;
-        }
+      if (remove_source_ && (removal = sr_i_remove_table_files(source_file_, &removed)) != 0 &&
+          !removed) {
+        sr_i_close_table(p_new);
+        return removal;
       }
     }
     if (p_open_target_ != nullptr) {
       sr_i_detach_table(p_tree_, p_open_target_);
     }
-    return sr_i_enter_named_table(p_tree_, target_.key, p_new);
+    const int32_t rc = sr_i_enter_named_table(p_tree_, target_.key, p_new);
+    return rc != 0 ? rc : removal;
   }
 
   sr_i_tree_t *p_tree_;

@@ -69,7 +69,7 @@ int32_t sr_i_duplicate_table(sr_i_tree_t *p_tree, sr_i_table_t *p_source, const 
  */
 int32_t sr_i_delete_table(sr_i_tree_t *p_tree, const char *p_registry_path);
 
-/* Takes a table out of its tree's named tables or unnamed set, without
+/* Takes a table out of its tree's named, unnamed or detached tables, without
  * freeing it. The caller holds the tree's write lock. */
 void sr_i_take_out_of_tree(sr_i_tree_t *p_tree, sr_i_table_t *p_table);
 
@@ -81,7 +81,8 @@ void sr_i_take_out_of_tree(sr_i_tree_t *p_tree, sr_i_table_t *p_table);
 void sr_i_detach_table(sr_i_tree_t *p_tree, sr_i_table_t *p_table);
 
 /* Removes a table file from the disk durably, then its side file. 0, 200,
- * 206, 16 or 10 (raised). */
-int32_t sr_i_remove_table_files(const std::string &file);
+ * 206, 16 or 10 (raised); `*p_removed` (if given) says whether the file is
+ * gone, which it is when only the flush of its directory failed. */
+int32_t sr_i_remove_table_files(const std::string &file, bool *p_removed = nullptr);
 
 #endif /* SR_I_NAMESPACE_H */

@@ -296,8 +296,12 @@ int32_t sr_i_rename_durably(const char *p_from, const char *p_to, bool *p_rename
   return sr_i_flush_directory(directory_of(p_to).c_str());
 }
 
-int32_t sr_i_remove_file_durably(const char *p_path) {
-  if (Sr_File_System.unlink(p_path) != 0) {
+int32_t sr_i_remove_file_durably(const char *p_path, bool *p_removed) {
+  const bool removed = Sr_File_System.unlink(p_path) == 0;
+  if (p_removed != nullptr) {
+    *p_removed = removed;
+  }
+  if (!removed) {
     return errno == ENOENT ? sr_i_raise(SR_E_NO_TABLE) : raise_failure("unlink", errno, p_path);
   }
   return sr_i_flush_directory(directory_of(p_path).c_str());

@@ -104,8 +104,10 @@ int32_t sr_i_is_same_file(int fd, const char *p_path, bool *p_same);
 int32_t sr_i_rename_durably(const char *p_from, const char *p_to, bool *p_renamed = nullptr);
 
 /* Removes the file `p_path` and flushes its directory, so that the removal
- * survives a power loss. 0, 200 when there is no such file, 206, 16 or 10. */
-int32_t sr_i_remove_file_durably(const char *p_path);
+ * survives a power loss. 0, 200 when there is no such file, 206, 16 or 10.
+ * When only the flush failed, `*p_removed` (if given) is true: the file is
+ * gone for every reader now. */
+int32_t sr_i_remove_file_durably(const char *p_path, bool *p_removed = nullptr);
 
 /* Flushes the directory `p_directory`: the names created, renamed or
  * removed in it become durable. 0, 206, 16 or 10. */

@@ -37,6 +37,7 @@ extern "C" int32_t sr_close_table_1(sr_opaque_handle_t table_handle) {
         p_tree->tables.erase(found);  // persistent: dropped from memory
         sr_i_close_table(p_table);
       } else if (!still_in_tree) {
+        p_tree->detached_tables.erase(p_table);
         sr_i_close_table(p_table);  // deleted while it was open
       }
     }

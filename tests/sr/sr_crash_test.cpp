@@ -11,14 +11,10 @@
 // half-made tables.
 
 #include <gtest/gtest.h>
-#include <poll.h>
-#include <signal.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
@@ -28,8 +24,8 @@
 #include <random>
 #include <string>
 
-#include "frame/sr_i_frame.h"
 #include "qv_sr.h"
+#include "sr_killed_child.h"
 #include "sr_versioned_rows.h"
 
 namespace {
@@ -119,13 +115,7 @@ class child_writer {
     _exit(2);
   }
 
-  void say(const std::string &line) {
-    const std::string text = line + "\n";
-    // Short enough to go through the pipe in one piece.
-    if (write(pipe_fd_, text.data(), text.size()) != static_cast<ssize_t>(text.size())) {
-      _exit(3);
-    }
-  }
+  void say(const std::string &line) { sr_killed_child::say(pipe_fd_, line); }
 
   ino_t file_inode() const {
     struct stat status {};
@@ -231,58 +221,12 @@ class Crash : public ::testing::Test {
   // Runs one child with `seed`, kills it once it has sent `messages` lines
   // and `delay` microseconds more have passed, and collects its report.
   child_report kill_a_writer(writer_kind kind, uint32_t seed, int messages, useconds_t delay) {
-    int ends[2];
     child_report report;
-    if (pipe(ends) != 0) {
-      report.error = "pipe";
-      return report;
-    }
-    const pid_t child = fork();
-    if (child == 0) {
-      close(ends[0]);
-      // The child stands for another program. This process runs no other
-      // thread and holds no registry lock at the fork, so the guard that
-      // keeps forked children from changing tables can be lifted.
-      In_Child_Process.store(0);
-      child_writer(directory_, seed, ends[1], kind).run();
-    }
-    close(ends[1]);
-    std::string pending;
-    int lines = 0;
-    bool killed = false;
-    char buffer[8192];
-    for (;;) {
-      if (!killed && lines >= messages) {
-        usleep(delay);
-        kill(child, SIGKILL);
-        killed = true;
-      }
-      // A child that says nothing for a minute hangs: on a lock, say.
-      pollfd readable{ends[0], POLLIN, 0};
-      if (!killed && poll(&readable, 1, 60000) == 0) {
-        kill(child, SIGKILL);
-        killed = true;
-        report.error = "the child hung after " + std::to_string(lines) + " messages";
-      }
-      const ssize_t got = read(ends[0], buffer, sizeof buffer);
-      if (got < 0 && errno == EINTR) {
-        continue;
-      }
-      if (got <= 0) {
-        break;
-      }
-      pending.append(buffer, static_cast<size_t>(got));
-      for (size_t end; (end = pending.find('\n')) != std::string::npos;) {
-        take_line(pending.substr(0, end), report);
-        pending.erase(0, end + 1);
-        ++lines;
-      }
-    }
-    close(ends[0]);
-    int status = 0;
-    waitpid(child, &status, 0);
-    if (report.error.empty() && !(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL)) {
-      report.error = "the child ended by itself, status " + std::to_string(status);
+    const std::string problem = sr_killed_child::run_and_kill(
+        messages, delay, [&](int pipe_fd) { child_writer(directory_, seed, pipe_fd, kind).run(); },
+        [&](const std::string &line) { take_line(line, report); });
+    if (report.error.empty()) {
+      report.error = problem;
     }
     return report;
   }

@@ -7,8 +7,10 @@
 // run checks the code and its message, that the table in memory goes on (a
 // retried step or an abort, then a further transaction), and that the file,
 // opened by another tree, holds a committed state: the old one, or the new
-// one when the failed call came after the commit point. Last, a read-only
-// table read again for writing, once with a read that fails.
+// one when the failed call came after the commit point. Then copies, moves
+// and deletions of tables, each failing call leaving the target and the
+// source as they were and no side file; last, a read-only table read again
+// for writing, once with a read that fails.
 
 #include <gtest/gtest.h>
 #include <unistd.h>
@@ -17,6 +19,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
@@ -414,9 +417,10 @@ class FaultInjection : public ::testing::Test {
   // ---- Helpers ----
 
   // The table with Committed_Rows.
-  void create_committed(sr_opaque_handle_t *p_table) const {
-    ASSERT_EQ(create_table(p_table), 0);
-    for (const auto &[name, count] : Committed_Rows) {
+  void create_committed(sr_opaque_handle_t *p_table, const char *p_path = "/disk/t",
+                        const rows_t &rows = Committed_Rows) const {
+    ASSERT_EQ(create_table(p_table, p_path), 0);
+    for (const auto &[name, count] : rows) {
       ASSERT_EQ(add_named(*p_table, name.c_str(), count), 0);
     }
     ASSERT_EQ(sr_apply_1(*p_table, 0), 0);
@@ -427,10 +431,10 @@ class FaultInjection : public ::testing::Test {
   // is not checked on adding: a checked key without a hash table is scanned
   // for, and that scan refuses any row that takes the entry of a deleted
   // one, which the further transactions here would do.
-  int32_t create_table(sr_opaque_handle_t *p_table) const {
+  int32_t create_table(sr_opaque_handle_t *p_table, const char *p_path = "/disk/t") const {
     std::vector<sr_column_t> columns = {column("name", QV_CHAR_PTR, SR_PRIMARY_KEY_NOCHECK),
                                         column("count", QV_INT32, SR_STANDARD)};
-    return sr_create_table_1(tree_, "/disk/t", columns.data(), 2, sr_test::Explicit, p_table);
+    return sr_create_table_1(tree_, p_path, columns.data(), 2, sr_test::Explicit, p_table);
   }
 
   // A rewrite is asked for directly: the exported apply rewrites only large,
@@ -495,6 +499,28 @@ class FaultInjection : public ::testing::Test {
     rows_t rows = rc == 0 ? rows_in(table, 0) : rows_t{{"<the file does not open>", rc}};
     EXPECT_EQ(sr_close_tree_1(tree), 0);
     return rows;
+  }
+
+  // The committed rows another program finds at `p_path`; one "<code>"
+  // entry when the table does not open.
+  rows_t rows_at(const char *p_path) const {
+    sr_opaque_handle_t tree = mounted_tree(mount_directory_);
+    sr_opaque_handle_t table = nullptr;
+    const int32_t rc = sr_open_table_1(tree, p_path, 1, &table);
+    rows_t rows = rc == 0 ? rows_in(table, 0) : rows_t{{"<" + std::to_string(rc) + ">", rc}};
+    EXPECT_EQ(sr_close_tree_1(tree), 0);
+    return rows;
+  }
+
+  // The side files in the mount directory.
+  std::vector<std::string> side_files() const {
+    std::vector<std::string> found;
+    for (const auto &entry : std::filesystem::directory_iterator(mount_directory_)) {
+      if (entry.path().filename().string().ends_with(".rewrite")) {
+        found.push_back(entry.path().filename());
+      }
+    }
+    return found;
   }
 
   std::filesystem::path root_;
@@ -659,6 +685,233 @@ TEST_F(FaultInjection, SchemaChangeFailuresLeaveTheTableAndItsFileAsTheyWere) {
     }
   }
   std::printf("[ injected ] schema changes: %d calls x errnos\n", injected);
+}
+
+// ---- Copies, moves and deletions ---------------------------------------
+
+// The table "/disk/t" (or "/m/s" in memory) goes to "/disk/u", which holds
+// Old_Target_Rows, or is missing, or is open here; or "/disk/t" goes into
+// memory as "/m/y", or is deleted.
+struct namespace_step_t {
+  const char *p_name;
+  enum { From_Memory, From_File, From_Open_File } source;
+  bool move;
+  enum { Target_Exists, Target_Missing, Target_Open, Into_Memory, Deletion } target;
+};
+
+const namespace_step_t Namespace_Steps[] = {
+    {"copy memory to disk", namespace_step_t::From_Memory, false, namespace_step_t::Target_Exists},
+    {"copy memory to a new file", namespace_step_t::From_Memory, false,
+     namespace_step_t::Target_Missing},
+    {"move memory to disk", namespace_step_t::From_Memory, true, namespace_step_t::Target_Exists},
+    {"copy a file by name", namespace_step_t::From_File, false, namespace_step_t::Target_Exists},
+    {"copy a file onto an open target", namespace_step_t::From_File, false,
+     namespace_step_t::Target_Open},
+    {"copy an open file", namespace_step_t::From_Open_File, false, namespace_step_t::Target_Exists},
+    {"move a file by name", namespace_step_t::From_File, true, namespace_step_t::Target_Exists},
+    {"move an open file", namespace_step_t::From_Open_File, true, namespace_step_t::Target_Exists},
+    {"move a file into memory", namespace_step_t::From_File, true, namespace_step_t::Into_Memory},
+    {"delete a file", namespace_step_t::From_File, false, namespace_step_t::Deletion},
+};
+
+const rows_t Old_Target_Rows = {{"old", 7}};
+const rows_t No_Table = {{"<200>", 200}};
+
+class NamespaceFaults : public FaultInjection {
+ protected:
+  // What the paths hold: "/disk/t", "/disk/u", and "/m/y" in this tree.
+  struct paths_t {
+    rows_t source;
+    rows_t target;
+    rows_t in_memory;
+    bool operator==(const paths_t &) const = default;
+  };
+
+  paths_t before(const namespace_step_t &step) const {
+    return {step.source == namespace_step_t::From_Memory ? No_Table : Committed_Rows,
+            step.target == namespace_step_t::Target_Exists ||
+                    step.target == namespace_step_t::Target_Open
+                ? Old_Target_Rows
+                : No_Table,
+            No_Table};
+  }
+  paths_t after(const namespace_step_t &step) const {
+    paths_t paths = before(step);
+    if (step.target == namespace_step_t::Deletion) {
+      paths.source = No_Table;
+      return paths;
+    }
+    if (step.move) {
+      paths.source = No_Table;
+    }
+    (step.target == namespace_step_t::Into_Memory ? paths.in_memory : paths.target) =
+        Committed_Rows;
+    return paths;
+  }
+
+  paths_t paths_now() const {
+    sr_opaque_handle_t table = nullptr;
+    rows_t in_memory = No_Table;
+    if (const int32_t rc = sr_open_table_1(tree_, "/m/y", 1, &table); rc == 0) {
+      in_memory = rows_in(table, 0);
+      EXPECT_EQ(sr_close_table_1(table), 0);
+    }
+    return {rows_at("/disk/t"), rows_at("/disk/u"), in_memory};
+  }
+
+  // Makes the tables of `step`: the source, open in `*p_source` unless it
+  // is a file no one has open, and the target, open in `*p_target` when
+  // the step copies onto an open one.
+  void prepare(const namespace_step_t &step, sr_opaque_handle_t *p_source,
+               sr_opaque_handle_t *p_target) {
+    std::filesystem::remove_all(mount_directory_);
+    std::filesystem::create_directory(mount_directory_);
+    ASSERT_NE(tree_ = mounted_tree(mount_directory_), nullptr);
+    ASSERT_NO_FATAL_FAILURE(create_committed(
+        p_source, step.source == namespace_step_t::From_Memory ? "/m/s" : "/disk/t"));
+    if (step.source == namespace_step_t::From_File) {
+      ASSERT_EQ(sr_close_table_1(*p_source), 0);
+      *p_source = nullptr;
+    }
+    if (step.target == namespace_step_t::Target_Exists ||
+        step.target == namespace_step_t::Target_Open) {
+      ASSERT_NO_FATAL_FAILURE(create_committed(p_target, "/disk/u", Old_Target_Rows));
+      if (step.target == namespace_step_t::Target_Exists) {
+        ASSERT_EQ(sr_close_table_1(*p_target), 0);
+        *p_target = nullptr;
+      }
+    }
+  }
+
+  int32_t take_step(const namespace_step_t &step, sr_opaque_handle_t source) const {
+    const char *p_target = step.target == namespace_step_t::Into_Memory ? "/m/y" : "/disk/u";
+    if (step.target == namespace_step_t::Deletion) {
+      return sr_delete_table_1(tree_, "/disk/t");
+    }
+    if (source == nullptr) {
+      return step.move ? sr_move_table_by_name_1(tree_, "/disk/t", p_target, 1)
+                       : sr_copy_table_by_name_1(tree_, "/disk/t", p_target, 1);
+    }
+    return step.move ? sr_move_table_by_handle_1(source, p_target, 1)
+                     : sr_copy_table_by_handle_1(source, p_target, 1);
+  }
+
+  // The code a failed call of a copy, move or deletion gives: a full
+  // filesystem for a call that makes, writes, renames or removes a file.
+  static int32_t failure_code(call_kind kind, int error) {
+    const bool writes = kind == Open || kind == Rename || kind == Write || kind == Writev ||
+                        kind == Fsync || kind == Unlink;
+    return writes && error == ENOSPC ? SR_E_FILESYSTEM_FULL : SR_E_SYSTEM_CALL;
+  }
+
+  // One run of `step` with `fault`; the calls it made go to step_counts_.
+  void run_namespace(const namespace_step_t &step, const fault_t &fault) {
+    sr_opaque_handle_t source = nullptr, target = nullptr;
+    ASSERT_NO_FATAL_FAILURE(prepare(step, &source, &target));
+    cu_set_no_error_1();
+    Injector = injector_t{.target = fault.kind, .index = fault.index, .error = fault.error};
+    const int32_t rc = take_step(step, source);
+    std::copy(std::begin(Injector.counts), std::end(Injector.counts), std::begin(step_counts_));
+    Injector.target = Injector.interrupted = Total_Kinds;
+    if (rc != 0) {
+      EXPECT_EQ(rc, failure_code(fault.kind, fault.error));
+      expect_message(rc, fault);
+    }
+    const paths_t old_paths = before(step), new_paths = after(step);
+    paths_t found = paths_now();
+    if (fault.kind == Total_Kinds) {
+      ASSERT_EQ(rc, 0);
+    } else {
+      ASSERT_GT(Injector.failures, 0) << "the call did not fail";
+    }
+    // A move through a handle has written its target when it removes the
+    // source; a failure then is no failure of the move, and may leave both.
+    const bool source_removal = step.move && step.source == namespace_step_t::From_Open_File &&
+                                found.target == Committed_Rows;
+    if (rc == 0) {
+      paths_t both = new_paths;
+      both.source = Committed_Rows;
+      EXPECT_TRUE(found == new_paths || (source_removal && found == both))
+          << "a call failed and the step said it succeeded";
+      EXPECT_TRUE(fault.kind == Total_Kinds || fault.kind == Close || fault.kind == Unlink ||
+                  source_removal)
+          << "the failure went unreported";
+    } else {
+      // Once the new file has taken the target's name, or the source file
+      // is gone, only the flush of the directory may have failed: the step
+      // is done (a move through a handle stops before it removes the
+      // source), and the code says it may not be durable.
+      paths_t both = new_paths;
+      both.source = Committed_Rows;
+      if (found == new_paths || (step.move && found == both)) {
+        EXPECT_TRUE(fault.kind == Open || fault.kind == Fsync)
+            << "only a failed flush of the directory may follow the rename or unlink";
+      } else {
+        EXPECT_EQ(found.source, old_paths.source) << "the source changed";
+        EXPECT_EQ(found.target, old_paths.target) << "the target changed";
+        EXPECT_EQ(found.in_memory, old_paths.in_memory) << "a table reached memory";
+        if (step.target == namespace_step_t::Target_Open) {
+          EXPECT_EQ(rows_in(target, 0), Old_Target_Rows) << "the open target changed";
+        }
+        // A retry succeeds.
+        cu_set_no_error_1();
+        ASSERT_EQ(take_step(step, source), 0) << "the step cannot be retried";
+        found = paths_now();
+        EXPECT_EQ(found, new_paths);
+      }
+    }
+    EXPECT_EQ(side_files(), std::vector<std::string>{}) << "a side file was left";
+    if (step.target == namespace_step_t::Target_Open) {
+      // The open target shows the new table and writes on into its file.
+      EXPECT_EQ(rows_in(target, 0), found.target);
+      ASSERT_EQ(add_named(target, "late", 99), 0);
+      ASSERT_EQ(sr_apply_1(target, 0), 0);
+      ASSERT_EQ(sr_commit_1(target), 0);
+      rows_t rows = found.target;
+      rows["late"] = 99;
+      EXPECT_EQ(rows_at("/disk/u"), rows);
+    }
+    EXPECT_EQ(sr_close_tree_1(tree_), 0);
+  }
+};
+
+// Each call site of every step fails in turn with ENOSPC, EIO and EINTR
+// past its retries: the right code and message; no side file left; the
+// source where it was and the target as it was, unless only the flush of
+// the directory failed after the new name was in place; and the step then
+// succeeds when tried again.
+TEST_F(NamespaceFaults, EveryFailedCallLeavesTheSourceAndTheTargetAsTheyWereAndCanBeRetried) {
+  int injected = 0;
+  for (const namespace_step_t &step : Namespace_Steps) {
+    SCOPED_TRACE(step.p_name);
+    run_namespace(step, fault_t{});
+    ASSERT_FALSE(HasFatalFailure()) << step.p_name << " fails without any fault";
+    int counts[Total_Kinds];
+    std::copy(std::begin(step_counts_), std::end(step_counts_), counts);
+    const std::vector<call_kind> essential =
+        step.target == namespace_step_t::Deletion ? std::vector<call_kind>{Unlink, Open, Fsync}
+        : step.target == namespace_step_t::Into_Memory
+            ? std::vector<call_kind>{Open, Read, Unlink, Fsync}
+        : step.move && step.source == namespace_step_t::From_File
+            ? std::vector<call_kind>{Open, Lock, Rename, Fsync}
+            : std::vector<call_kind>{Open, Lock, Write, Fsync, Rename};
+    for (const call_kind kind : essential) {
+      EXPECT_GT(counts[kind] + (kind == Write ? counts[Writev] : 0), 0)
+          << step.p_name << " made no " << Call_Names[kind] << " call";
+    }
+    for (int kind = 0; kind < Total_Kinds; ++kind) {
+      for (int index = 1; index <= counts[kind]; ++index) {
+        for (const int error : {ENOSPC, EIO, EINTR}) {
+          const fault_t fault{static_cast<call_kind>(kind), index, error, recovery_t::retry};
+          SCOPED_TRACE(describe(Steps[0], fault).substr(std::strlen(Steps[0].p_name) + 2));
+          run_namespace(step, fault);
+          ASSERT_FALSE(HasFatalFailure());
+          ++injected;
+        }
+      }
+    }
+  }
+  std::printf("[ injected ] copies, moves and deletions: %d calls x errnos\n", injected);
 }
 
 // A read-only table turning writable is read again from its file, and finds

@@ -25,6 +25,7 @@
 // order they were made; and all of them, as after a crash of the process.
 // Every pairing of the two is opened.
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -42,6 +43,7 @@
 
 #include "qv_sr.h"
 #include "rows/sr_i_transaction.h"
+#include "sr_namespace_operations.h"
 #include "sr_versioned_rows.h"
 #include "storage/sr_i_system_calls.h"
 #include "tables/sr_i_table.h"
@@ -236,6 +238,9 @@ int platter_open(const char *p_path, int flags, mode_t mode) {
     P_Platter->file_of_inode[inode_of(fd)] = P_Platter->files.size();
     P_Platter->files.emplace_back();
     name_change(name_of(p_path), P_Platter->files.size() - 1);
+  } else if (fd >= 0 && (flags & O_TRUNC) != 0 && S_ISREG(status.st_mode)) {
+    // Emptied, as a truncation not yet flushed.
+    file_of(fd).unflushed.push_back({true, 0, {}});
   }
   return fd;
 }
@@ -394,6 +399,73 @@ std::vector<table_state> states_at(const std::vector<commit_window> &windows, ui
   return states;
 }
 
+// ---- Copies, moves and deletions ----------------------------------------
+
+namespace ns = sr_namespace_operations;
+
+#if defined(__SANITIZE_THREAD__) || defined(__SANITIZE_ADDRESS__)
+constexpr int Namespace_Steps = 24;
+#else
+constexpr int Namespace_Steps = 40;
+#endif
+
+// An operation of the namespace script: the calls at positions
+// [first_call, end_call) of the run carry the three paths from `before` to
+// what `step` leaves.
+struct operation_window {
+  uint64_t first_call;
+  uint64_t end_call;
+  ns::operation step;
+  ns::files_t before;
+  bool operator==(const operation_window &) const = default;
+};
+
+ns::files_t no_files() {
+  ns::files_t files;
+  for (const char *p_name : ns::Names) {
+    files[p_name] = table_state{};
+  }
+  return files;
+}
+
+// The scripted run: random copies, moves and deletions between the three
+// table files and memory, the same on every run. Returns the operations of
+// the run; `problem` is set when a call failed.
+std::vector<operation_window> run_namespace_script(const std::string &directory,
+                                                   std::string &problem) {
+  std::mt19937 rng(script_seed());
+  ns::random_operations operations(rng, 1);
+  sr_opaque_handle_t tree = mounted_tree(directory);
+  problem = tree == nullptr ? "no tree" : operations.start(tree, no_files());
+  std::vector<operation_window> windows;
+  const ns::random_operations::listener announce = [&](const ns::operation &step) {
+    windows.push_back({P_Platter->calls, UINT64_MAX, step, operations.files()});
+  };
+  const ns::random_operations::listener confirm = [&](const ns::operation &) {
+    windows.back().end_call = P_Platter->calls;
+  };
+  for (int step = 0; step < Namespace_Steps && problem.empty(); ++step) {
+    problem = operations.step(announce, confirm);
+  }
+  sr_close_tree_1(tree);
+  return windows;
+}
+
+// What the three paths may hold after a cut before call `cut`: what the
+// last operation that returned before it left, or any outcome of the one
+// under way at it.
+std::vector<ns::files_t> files_at(const std::vector<operation_window> &windows, uint64_t cut) {
+  std::vector<ns::files_t> allowed = {no_files()};
+  for (const operation_window &window : windows) {
+    if (window.end_call <= cut) {
+      allowed = {ns::after(window.before, window.step)};
+    } else if (window.first_call < cut) {
+      allowed = ns::outcomes(window.before, window.step);
+    }
+  }
+  return allowed;
+}
+
 class PowerLoss : public ::testing::Test {
  protected:
   // The image of a failure is kept for a look.
@@ -409,10 +481,11 @@ class PowerLoss : public ::testing::Test {
   // many runs down.
   static int no_flush(int) { return 0; }
 
-  // Runs the script on a new, empty mount directory, taken to be durable
-  // already, with the platter in the door; the power goes off before call
-  // `disk.cut`.
-  static std::vector<commit_window> run_on(platter &disk, std::string &problem) {
+  // Runs `script` (`run_script` or `run_namespace_script`) on a new, empty
+  // mount directory, taken to be durable already, with the platter in the
+  // door; the power goes off before call `disk.cut`.
+  template <typename Script>
+  static auto run_on(platter &disk, std::string &problem, Script script) {
     disk.directory = sr_test::new_directory("qv_power");
     ::stat(disk.directory.c_str(), &disk.directory_status);
     P_Platter = &disk;
@@ -423,7 +496,7 @@ class PowerLoss : public ::testing::Test {
     Sr_File_System.ftruncate = platter_ftruncate;
     Sr_File_System.rename = platter_rename;
     Sr_File_System.unlink = platter_unlink;
-    const std::vector<commit_window> windows = run_script(disk.directory, problem);
+    const auto windows = script(disk.directory, problem);
     if (disk.cut == disk.calls) {
       lose_power();  // after the last call: the power goes off at rest
     }
@@ -477,6 +550,39 @@ class PowerLoss : public ::testing::Test {
     return problem;
   }
 
+  // After the power is back each table found copies to another path by
+  // name, and each path takes a copy of a table in memory: side files left
+  // by the cut stop neither.
+  static std::string copy_on(const std::string &directory, const ns::files_t &found) {
+    sr_opaque_handle_t tree = mounted_tree(directory);
+    sr_opaque_handle_t table = nullptr;
+    if (tree == nullptr || create_table(tree, "/m/new", 0, &table) != 0 ||
+        add_row(table, 1, 1, ns::Payload_Spread) != 0) {
+      sr_close_tree_1(tree);
+      return "the table in memory failed";
+    }
+    std::string problem;
+    for (const auto &[name, state] : found) {
+      const std::string path = ns::path_of(name);
+      table_state copied;
+      if (state.exists &&
+          (sr_copy_table_by_name_1(tree, path.c_str(), "/disk/ns/z", 1) != 0 ||
+           !sr_versioned::read_table(directory, "/disk/ns/z", copied, ns::Payload_Spread).empty() ||
+           !(copied == state))) {
+        problem = "copying " + name + " on failed";
+        break;
+      }
+      if (sr_copy_table_by_handle_1(table, path.c_str(), 1) != 0 ||
+          !sr_versioned::read_table(directory, path.c_str(), copied, ns::Payload_Spread).empty() ||
+          copied.rows.size() != 1) {
+        problem = "copying onto " + name + " failed";
+        break;
+      }
+    }
+    sr_close_tree_1(tree);
+    return problem;
+  }
+
   const std::string restored_ = sr_test::new_directory("qv_power");
 };
 
@@ -487,7 +593,7 @@ TEST_F(PowerLoss, EveryCutLeavesACommittedStateThatTakesNewTransactions) {
   // A first run counts the calls and places the commits among them.
   platter counting;
   std::string problem;
-  const std::vector<commit_window> windows = run_on(counting, problem);
+  const std::vector<commit_window> windows = run_on(counting, problem, run_script);
   ASSERT_EQ(problem, "");
   const uint64_t total_calls = counting.calls;
   ASSERT_GT(counting.renames, 1u) << "no commit of the script rewrote the file";
@@ -496,7 +602,7 @@ TEST_F(PowerLoss, EveryCutLeavesACommittedStateThatTakesNewTransactions) {
   for (uint64_t cut = 0; cut <= total_calls; ++cut) {
     platter disk;
     disk.cut = cut;
-    const std::vector<commit_window> again = run_on(disk, problem);
+    const std::vector<commit_window> again = run_on(disk, problem, run_script);
     ASSERT_EQ(problem, "") << "cut " << cut;
     ASSERT_TRUE(disk.calls == total_calls && again == windows) << "the run is not repeatable";
     ASSERT_EQ(disk.problem, "") << "cut " << cut;
@@ -534,6 +640,79 @@ TEST_F(PowerLoss, EveryCutLeavesACommittedStateThatTakesNewTransactions) {
             << windows.size() << " commits in the script, " << counting.renames - 1
             << " of them by rewriting the file), images opened: " << images_checked
             << ", of which showed the commit in flight as done: " << new_states << "\n";
+  RecordProperty("cut_points", static_cast<int>(total_calls + 1));
+}
+
+// The script's operations publish each target by a rename and remove a
+// moved source by an unlink, each followed by a flush of the directory:
+// at every cut each table is whole at its source or its target, and one
+// whose copy or move returned before the cut is where it went. Afterwards
+// every table copies on, and every path takes a new copy, whatever side
+// files the cut left.
+TEST_F(PowerLoss, EveryCutLeavesEachCopiedOrMovedTableWholeAtItsSourceOrItsTarget) {
+  platter counting;
+  std::string problem;
+  const std::vector<operation_window> windows = run_on(counting, problem, run_namespace_script);
+  ASSERT_EQ(problem, "");
+  const uint64_t total_calls = counting.calls;
+  std::map<std::string, int> kinds;
+  for (const operation_window &window : windows) {
+    ++kinds[window.step.kind];
+  }
+  ASSERT_GE(kinds.size(), 6u) << "the script leaves kinds of operation out";
+  int images_checked = 0;
+  int new_outcomes = 0;
+  for (uint64_t cut = 0; cut <= total_calls; ++cut) {
+    platter disk;
+    disk.cut = cut;
+    const std::vector<operation_window> again = run_on(disk, problem, run_namespace_script);
+    ASSERT_EQ(problem, "") << "cut " << cut;
+    ASSERT_TRUE(disk.calls == total_calls && again == windows) << "the run is not repeatable";
+    ASSERT_EQ(disk.problem, "") << "cut " << cut;
+    const std::vector<ns::files_t> allowed = files_at(windows, cut);
+    std::vector<image> opened;
+    for (const auto &[kept, files] : disk.images) {
+      if (std::find(opened.begin(), opened.end(), files) != opened.end()) {
+        continue;
+      }
+      opened.push_back(files);
+      restore(files);
+      ns::files_t found;
+      for (const char *p_name : ns::Names) {
+        if (problem.empty()) {
+          problem = sr_versioned::read_table(restored_, ns::path_of(p_name).c_str(), found[p_name],
+                                             ns::Payload_Spread);
+        }
+      }
+      const auto match = std::find(allowed.begin(), allowed.end(), found);
+      if (problem.empty() && match == allowed.end()) {
+        problem = "found" + ns::describe(found);
+      }
+      if (problem.empty()) {
+        problem = copy_on(restored_, found);
+      }
+      if (!problem.empty()) {
+        std::string expected;
+        for (const ns::files_t &state : allowed) {
+          expected += (expected.empty() ? "" : "\n  or") + ns::describe(state);
+        }
+        FAIL() << "script seed " << script_seed()
+               << " (SR_POWER_LOSS_SEED), power lost before call " << cut << " of " << total_calls
+               << ", keeping " << kept << ": " << problem << "\n  expected" << expected
+               << "\n  image kept in " << restored_;
+      }
+      new_outcomes += match - allowed.begin() >= 1 ? 1 : 0;
+      ++images_checked;
+    }
+  }
+  std::cout << "cut points tried: " << total_calls + 1 << " (script seed " << script_seed() << ", "
+            << windows.size() << " operations: ";
+  for (const auto &[kind, count] : kinds) {
+    std::cout << kind << " " << count << ", ";
+  }
+  std::cout << "), images opened: " << images_checked
+            << ", of which showed the operation in flight done or half done: " << new_outcomes
+            << "\n";
   RecordProperty("cut_points", static_cast<int>(total_calls + 1));
 }
 

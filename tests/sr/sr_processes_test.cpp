@@ -3,7 +3,8 @@
 // until the other has closed the table, and then reads what the other
 // committed, so no update is lost. A reader takes no lock and, while a
 // writer appends, rewrites or changes the schema, only ever finds committed
-// states.
+// states. Copies onto one table file from two processes are serialised by
+// the mount directory's ",Lock" file, and a reader finds one whole copy.
 
 #include <gtest/gtest.h>
 #include <signal.h>
@@ -15,6 +16,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <iostream>
+#include <map>
 #include <random>
 #include <set>
 #include <string>
@@ -369,6 +371,92 @@ TEST_F(Processes, AReaderSeesTheOldOrTheNewSchemaWhileAWriterChangesIt) {
   EXPECT_EQ(found.counter, Filled_Counter + Changes);
   std::cout << "reads: " << reads << ", distinct schemas seen: " << states_seen.size() << " of "
             << Changes + 1 << "\n";
+}
+
+// The rows copy `round` of process `number` carries: its own ids, all at
+// version `round`.
+std::map<int32_t, int32_t> copied_rows(int number, int round) {
+  constexpr int Rows = 400;
+  std::map<int32_t, int32_t> rows;
+  for (int row = 0; row < Rows; ++row) {
+    rows[number * 100000 + row] = round;
+  }
+  return rows;
+}
+
+// Two processes copy tables of their own onto one table file again and
+// again while this one reads it. Each copy writes the side file beside the
+// target and renames it: without the ",Lock" file the two would write into
+// one side file at once. Every read must find one whole copy, never rows of
+// both or of two rounds.
+TEST_F(Processes, TwoCopiersOntoOneTableAreSerialisedAndAReaderSeesOneWholeCopy) {
+  constexpr int Rounds = 25;
+  constexpr uint32_t Payload_Spread = 200;
+  const auto copy_rounds = [this](int number) {
+    return [this, number] {
+      sr_opaque_handle_t tree = mounted_tree();
+      if (tree == nullptr) {
+        return 2;
+      }
+      for (int round = 1; round <= Rounds; ++round) {
+        const std::string path = "/m/copy" + std::to_string(round);
+        sr_opaque_handle_t table = nullptr;
+        if (sr_versioned::create_table(tree, path.c_str(), 4, &table) != 0) {
+          return 3;
+        }
+        for (const auto &[id, version] : copied_rows(number, round)) {
+          if (add_row(table, id, version, Payload_Spread) != 0) {
+            return 4;
+          }
+        }
+        if (sr_apply_1(table, 0) != 0 || sr_commit_1(table) != 0 ||
+            sr_copy_table_by_handle_1(table, Table_Path, 1) != 0 ||
+            sr_delete_table_1(tree, path.c_str()) != 0) {
+          return 5;
+        }
+      }
+      return sr_close_tree_1(tree) == 0 ? 0 : 6;
+    };
+  };
+  // The target exists from the start: process 0, round 0.
+  {
+    sr_opaque_handle_t tree = mounted_tree();
+    sr_opaque_handle_t table = nullptr;
+    ASSERT_EQ(sr_versioned::create_table(tree, Table_Path, 0, &table), 0);
+    for (const auto &[id, version] : copied_rows(0, 0)) {
+      ASSERT_EQ(add_row(table, id, version, Payload_Spread), 0);
+    }
+    ASSERT_EQ(sr_close_tree_1(tree), 0);
+  }
+  const pid_t copiers[2] = {start_process(copy_rounds(1)), start_process(copy_rounds(2))};
+  int statuses[2] = {};
+  bool ended[2] = {};
+  int reads = 0;
+  std::set<std::pair<int, int>> copies_seen;
+  table_state found;
+  // Reads until both copiers have ended: the last read comes after both.
+  for (; !(ended[0] && ended[1]); ++reads) {
+    for (int copier = 0; copier < 2; ++copier) {
+      ended[copier] =
+          ended[copier] || waitpid(copiers[copier], &statuses[copier], WNOHANG) == copiers[copier];
+    }
+    ASSERT_EQ(read_table(found, Payload_Spread), "") << "read " << reads;
+    ASSERT_FALSE(found.rows.empty()) << "read " << reads << " found no table";
+    const int number = found.rows.begin()->first / 100000;
+    const int round = found.rows.begin()->second;
+    ASSERT_TRUE(found.rows == copied_rows(number, round))
+        << "read " << reads << " found a mixture: " << describe(found);
+    copies_seen.emplace(number, round);
+  }
+  for (const int status : statuses) {
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "a copier failed: " << status;
+  }
+  // The last copy of one of the two is what stays.
+  EXPECT_TRUE(found.rows == copied_rows(1, Rounds) || found.rows == copied_rows(2, Rounds))
+      << describe(found);
+  EXPECT_FALSE(std::filesystem::exists(directory_ + "/" + Table_File + ".rewrite"));
+  std::cout << "reads: " << reads << ", distinct copies seen: " << copies_seen.size() << " of "
+            << 2 * Rounds + 1 << "\n";
 }
 
 }  // namespace

@@ -42,6 +42,11 @@ typedef struct sr_i_tree_struct_t {
   std::set<struct sr_i_table_struct_t *> unnamed_tables;
   /* Mount points by name. */
   std::map<std::string, sr_i_mount_point_t, std::less<>> mount_points;
+  /* Directories made by the older directory calls outside every mount
+   * point, by registry path without a trailing "/": an empty directory
+   * exists only here. Below a mount point a directory is implied by the
+   * table files whose paths pass through it, and nothing is kept. */
+  std::set<std::string, std::less<>> directories;
   /* From the process's code set into the stored form, and back; fixed for
    * the life of the tree. */
   cu_iconv_t *p_to_table_string_conversion_handle = nullptr;

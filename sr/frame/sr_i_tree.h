@@ -3,7 +3,8 @@
  * process-wide set of open trees.
  *
  * A tree owns its named tables (by name), its unnamed tables (selection
- * results, by address), its mount points (by name, byte for byte), the two
+ * results, by address), its mount points (by name, byte for byte), the
+ * directories made by the older directory calls, the two
  * string conversion handles every string value passes through, and the
  * read-write lock that serialises changes to its namespace. The tree lock is
  * taken before any table lock; Registry_Trees_Mutex guards only the set of

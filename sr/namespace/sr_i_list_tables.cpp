@@ -47,9 +47,12 @@ class table_list {
     if (p_entry == nullptr) {
       return sr_i_raise_no_memory();
     }
+    // An empty view may hold no pointer at all, which memcpy must not get.
     std::memcpy(p_entry, prefix.data(), prefix.size());
     char *p_rest = p_entry + prefix.size();
-    std::memcpy(p_rest, rest.data(), rest.size());
+    if (!rest.empty()) {
+      std::memcpy(p_rest, rest.data(), rest.size());
+    }
     p_rest[rest.size()] = '\0';
     if (from_file_name) {
       for (char *p_comma = std::strchr(p_rest, ','); p_comma != nullptr;

@@ -119,8 +119,9 @@ TEST_F(Listing, AMountDirectoryListsItsTableFilesAsRegistryPaths) {
 }
 
 TEST_F(Listing, TransientListingsTakeTheTablesWhosePathsBeginWithThePath) {
+  // Closed, a transient table stays in the tree, and is listed.
   for (const char *p_path : {"/m/a", "/m/b/c", "/mx", "/n/a", "m/a"}) {
-    ASSERT_NE(create_named_counts(p_path, Implicit), nullptr) << p_path;
+    EXPECT_EQ(sr_close_table_1(create_named_counts(p_path, Implicit)), 0) << p_path;
   }
   // Persistent tables open in the tree, and a table loaded from a mount
   // point that is gone since, are not transient tables.
@@ -330,7 +331,8 @@ TEST_F(Listing, MadeDirectoriesAreListedUntilDeletedAndReserveNothingOnDisk) {
   // Refused while a table lies below, open or not, on disk or in memory.
   EXPECT_EQ(sr_i_delete_directory_compat(tree_, "/disk/sub"), SR_E_TABLE_EXISTS);
   EXPECT_EQ(last_error().first, SR_E_TABLE_EXISTS);
-  ASSERT_NE(create_named_counts("/d/e/t", Implicit), nullptr);
+  sr_opaque_handle_t open_table = create_named_counts("/d/e/t", Implicit);
+  ASSERT_NE(open_table, nullptr);
   EXPECT_EQ(sr_i_delete_directory_compat(tree_, "/d"), SR_E_TABLE_EXISTS);
   EXPECT_EQ(directory("/d"), (std::vector<std::string>{"/d/e directory transient"}));
   // ... and while a mount point is at or below it.
@@ -342,6 +344,7 @@ TEST_F(Listing, MadeDirectoriesAreListedUntilDeletedAndReserveNothingOnDisk) {
   // Once the tables are gone the directory goes, with those made below it.
   ASSERT_EQ(sr_delete_table_1(tree_, "/disk/sub/t"), 0);
   EXPECT_EQ(sr_i_delete_directory_compat(tree_, "/disk/sub"), 0);
+  ASSERT_EQ(sr_close_table_1(open_table), 0);
   ASSERT_EQ(sr_delete_table_1(tree_, "/d/e/t"), 0);
   EXPECT_EQ(sr_i_delete_directory_compat(tree_, "/d/"), 0);
   EXPECT_EQ(directory("/"), (std::vector<std::string>{"/disk directory persistent"}));

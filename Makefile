@@ -33,15 +33,17 @@ test-tsan: deps
 	cd build-tsan && $(CTEST)
 
 # The comparison with SQLite and LMDB: every workload, then one table of
-# ratios. BENCH_ARGS passes Google Benchmark flags (e.g. a filter).
+# ratios; then a schema change and a listing, each beside its floor.
+# BENCH_ARGS passes Google Benchmark flags (e.g. a filter).
 BENCH_ARGS ?= --benchmark_min_time=0.2
 bench:
 	@tools/install-deps.sh bench
 	cmake --preset default
-	cmake --build build -j$(JOBS) --target compare_bench schema_bench copy_bench
+	cmake --build build -j$(JOBS) --target compare_bench schema_bench copy_bench listing_bench
 	build/bench/compare_bench $(BENCH_ARGS)
 	build/bench/schema_bench $(BENCH_ARGS)
 	build/bench/copy_bench $(BENCH_ARGS)
+	build/bench/listing_bench $(BENCH_ARGS)
 
 fuzz-smoke: deps
 	tools/fuzz-smoke.sh

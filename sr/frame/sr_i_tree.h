@@ -3,7 +3,8 @@
  * process-wide set of open trees.
  *
  * A tree owns its named tables (by name), its unnamed tables (selection
- * results, by address), its mount points (by name, byte for byte), the two
+ * results, by address), its mount points (by name, byte for byte), the
+ * directories made by the older directory calls, the two
  * string conversion handles every string value passes through, and the
  * read-write lock that serialises changes to its namespace. The tree lock is
  * taken before any table lock; Registry_Trees_Mutex guards only the set of
@@ -45,6 +46,11 @@ typedef struct sr_i_tree_struct_t {
   std::set<struct sr_i_table_struct_t *> detached_tables;
   /* Mount points by name. */
   std::map<std::string, sr_i_mount_point_t, std::less<>> mount_points;
+  /* Directories made by the older directory calls outside every mount
+   * point, by registry path without a trailing "/": an empty directory
+   * exists only here. Below a mount point a directory is implied by the
+   * table files whose paths pass through it, and nothing is kept. */
+  std::set<std::string, std::less<>> directories;
   /* From the process's code set into the stored form, and back; fixed for
    * the life of the tree. */
   cu_iconv_t *p_to_table_string_conversion_handle = nullptr;

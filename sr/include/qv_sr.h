@@ -139,7 +139,8 @@ typedef enum {
   SR_ROW_STATE_NO_ROW = 4
 } sr_row_state_t;
 
-/* Kinds and storage of the entries of the older directory-list calls. */
+/* Kinds and storage of the entries of the older directory calls (see
+ * sr_i_get_directory_list_compat). */
 typedef enum {
   SR_UNKNOWN_ENTRY = 0,
   SR_TABLE = 1,
@@ -832,6 +833,118 @@ QV_SR_EXPORT int32_t sr_move_table_by_name_1(sr_opaque_handle_t tree_handle,
  * when the file cannot be removed; SR_E_INTERNAL in a forked child.
  */
 QV_SR_EXPORT int32_t sr_delete_table_1(sr_opaque_handle_t tree_handle, const char *p_registry_path);
+
+/* ---- Listing tables ------------------------------------------------------ */
+
+/*
+ * Lists the tables whose registry paths begin with `p_registry_path`, a
+ * plain prefix of the path's text ("/a" lists "/a", "/a/b" and "/ab"):
+ *  - Below a mount point, the table files of the mount directory, as
+ *    registry paths: mount "/m" on a directory holding "a,b" and "/m/a/b"
+ *    is listed. The mount point's own path, with or without its trailing
+ *    "/", lists every table of the directory. The lock file ",Lock", side
+ *    files ending in ".rewrite", names starting with "." and files whose
+ *    names do not begin with the rest of the path are never listed.
+ *  - Elsewhere, the transient tables of the tree; persistent tables open in
+ *    the tree are not listed here (list their mount point instead).
+ * Entries come in directory order below a mount point, in byte order of
+ * their paths otherwise.
+ *
+ * On success *p_table_list receives a malloc'ed array of *array_count
+ * malloc'ed strings, an array even when no table is listed; release it with
+ * sr_free_table_list_1 (or free() each entry, then the array). On failure
+ * nothing is handed out and the two outputs are not changed.
+ *
+ * The call changes nothing: it works in a forked child too. Returns 0;
+ * SR_E_INVALID_HANDLE; SR_E_INVALID_PATH (a null path too);
+ * SR_E_NULL_POINTER when an output pointer is null; SR_E_NO_MEMORY;
+ * SR_E_ACCESS when the mount directory may not be read; SR_E_SYSTEM_CALL
+ * when it cannot be opened ("opendir") or read ("readdir").
+ */
+QV_SR_EXPORT int32_t sr_list_tables_1(sr_opaque_handle_t tree_handle, const char *p_registry_path,
+                                      char ***p_table_list, uint32_t *array_count);
+
+/* Frees a list of sr_list_tables_1: each of the `array_count` entries that
+ * is not null, then the array. Returns 0, or SR_E_NULL_POINTER for a null
+ * array. */
+QV_SR_EXPORT int32_t sr_free_table_list_1(char **p_table_list, uint32_t array_count);
+
+/* ---- Older directory calls -------------------------------------------------
+ *
+ * Kept for programs written against them. Registry paths have no
+ * directories of their own: the directory "/a/b" exists while a table, a
+ * mount point or a directory made by sr_i_create_directory_compat has a path
+ * below it ("/a/b/t", "/a/b/c/t"). A directory's path may be given with or
+ * without a trailing "/"; "/" is the root.
+ *
+ * Below a mount point every table is one flat file whose name holds its
+ * whole path ("/m/a/b/t" is the file "a,b,t"), so nothing on disk stands
+ * for a directory: making one there succeeds and reserves nothing, and the
+ * directory is listed once a table lies below it. Outside every mount point
+ * the tree remembers the directories made, so that they are listed while
+ * still empty, until they are deleted or the tree is closed.
+ *
+ * The records of a listing: `name` is the entry's full registry path, as
+ * sr_open_table_1 or another listing takes it; `type` is SR_TABLE or
+ * SR_DIRECTORY (a mount point is a directory); `storage` is SR_PERSISTENT
+ * below a mount point (a directory: when it is a mount point or lies below
+ * one), SR_TRANSIENT otherwise; `p_table_list` is always null.
+ */
+
+/*
+ * Lists the entries directly below the directory `p_registry_path`: the
+ * tables there, and each directory that a deeper path passes through, once.
+ * A name may appear twice, once as a table and once as a directory ("/a/b"
+ * and "/a/b/c" are both tables). Records are in byte order of their names,
+ * a table before a directory of the same name.
+ * Below a mount point the tables come from the mount directory's table
+ * files, as sr_list_tables_1 finds them; elsewhere from the tree's
+ * transient tables.
+ *
+ * On success *p_p_entries receives a malloc'ed array of *p_total_entries
+ * records whose names are malloc'ed, an array even when the directory is
+ * empty or does not exist; release it with sr_i_free_directory_list_compat.
+ * On failure nothing is handed out.
+ *
+ * Works in a forked child. Returns 0; SR_E_INVALID_HANDLE;
+ * SR_E_NULL_POINTER when an output pointer is null; SR_E_INVALID_PATH;
+ * SR_E_NO_MEMORY; SR_E_ACCESS or SR_E_SYSTEM_CALL when the mount directory
+ * cannot be read.
+ */
+QV_SR_EXPORT int32_t sr_i_get_directory_list_compat(sr_opaque_handle_t tree_handle,
+                                                    const char *p_registry_path,
+                                                    sr_entry_metadata_t **p_p_entries,
+                                                    uint32_t *p_total_entries);
+
+/* Frees a list of sr_i_get_directory_list_compat: the names of the
+ * `total_entries` records, then the array. Returns 0, or SR_E_NULL_POINTER
+ * for a null array. */
+QV_SR_EXPORT int32_t sr_i_free_directory_list_compat(sr_entry_metadata_t *p_entries,
+                                                     uint32_t total_entries);
+
+/*
+ * Makes the directory `p_registry_path`; the directories above it exist by
+ * implication. Making one that exists, or the root, succeeds and changes
+ * nothing; below a mount point it succeeds and reserves nothing (see
+ * above). Returns 0; SR_E_INVALID_HANDLE; SR_E_INVALID_PATH;
+ * SR_E_NO_MEMORY; SR_E_INTERNAL in a forked child.
+ */
+QV_SR_EXPORT int32_t sr_i_create_directory_compat(sr_opaque_handle_t tree_handle,
+                                                  const char *p_registry_path);
+
+/*
+ * Deletes the directory `p_registry_path` together with the empty
+ * directories made below it. It is refused while a table lies below it
+ * (below a mount point: a table file whose path does, whether or not the
+ * table is open), with SR_E_TABLE_EXISTS, and while a mount point is at or
+ * below it, with SR_E_MOUNT_POINT_EXISTS (unmount it first). Deleting a
+ * directory that does not exist succeeds, as there is nothing left of it.
+ * Returns 0; SR_E_INVALID_HANDLE; SR_E_INVALID_PATH; SR_E_TABLE_EXISTS;
+ * SR_E_MOUNT_POINT_EXISTS; SR_E_NO_MEMORY; SR_E_ACCESS or SR_E_SYSTEM_CALL
+ * when the mount directory cannot be read; SR_E_INTERNAL in a forked child.
+ */
+QV_SR_EXPORT int32_t sr_i_delete_directory_compat(sr_opaque_handle_t tree_handle,
+                                                  const char *p_registry_path);
 
 /* ---- Packed tables --------------------------------------------------------
  *

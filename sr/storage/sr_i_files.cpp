@@ -24,6 +24,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <string>
+#include <type_traits>
 
 #include "frame/sr_i_errors.h"
 #include "frame/sr_i_source_location.h"
@@ -36,14 +37,21 @@ namespace {
 constexpr const char *Module_Version = SR_I_MODULE_VERSION;
 constexpr useconds_t Retry_Pause_Microseconds = 10000;
 
-// Runs `call` (a system call through the door, -1 on failure) again after
-// a pause while it fails with EINTR and retries are left. `retries` counts
-// the repeats; errno is as the last attempt left it.
+// Runs `call` (a system call through the door: -1 on failure, or a null
+// pointer for a call that returns one) again after a pause while it fails
+// with EINTR and retries are left. `retries` counts the repeats; errno is
+// as the last attempt left it.
 template <typename Call>
 auto call_retrying_interrupts(Call call, uint32_t &retries) {
   for (;;) {
     const auto result = call();
-    if (result != -1 || errno != EINTR || retries == Sr_Interrupted_Call_Retries) {
+    bool failed;
+    if constexpr (std::is_pointer_v<decltype(result)>) {
+      failed = result == nullptr;
+    } else {
+      failed = result == -1;
+    }
+    if (!failed || errno != EINTR || retries == Sr_Interrupted_Call_Retries) {
       return result;
     }
     ++retries;
@@ -326,6 +334,38 @@ int32_t sr_i_make_directory(const char *p_path) {
 
 void sr_i_discard_file(const char *p_path) {
   Sr_File_System.unlink(p_path);
+}
+
+sr_i_directory_reader::~sr_i_directory_reader() {
+  if (p_directory_ != nullptr) {
+    // Nothing was written through it: a failing close loses nothing.
+    Sr_File_System.closedir(p_directory_);
+  }
+}
+
+int32_t sr_i_directory_reader::open(const char *p_path) {
+  uint32_t retries = 0;
+  p_directory_ = call_retrying_interrupts([&] { return Sr_File_System.opendir(p_path); }, retries);
+  trace_retries(retries);
+  if (p_directory_ != nullptr) {
+    return 0;
+  }
+  // The directory is no table file: a full filesystem has nothing to do
+  // with reading it.
+  return raise_failure("opendir", errno, nullptr);
+}
+
+int32_t sr_i_directory_reader::next(const char **pp_name) {
+  // readdir reports its end and its failure alike, by a null result; only
+  // errno, cleared first, tells them apart.
+  errno = 0;
+  const struct dirent *p_entry = Sr_File_System.readdir(p_directory_);
+  if (p_entry != nullptr) {
+    *pp_name = p_entry->d_name;
+    return 0;
+  }
+  *pp_name = nullptr;
+  return errno == 0 ? 0 : sr_i_raise_system_call("readdir", errno);
 }
 
 void sr_i_capture_errno(const char *p_function, int error_number, int line, const char *p_version) {

@@ -16,6 +16,7 @@
 #ifndef SR_I_FILES_H
 #define SR_I_FILES_H
 
+#include <dirent.h>
 #include <sys/types.h>
 #include <sys/uio.h>
 
@@ -121,6 +122,29 @@ int32_t sr_i_make_directory(const char *p_path);
  * that are given up while another failure is being reported, or that may
  * well not exist. */
 void sr_i_discard_file(const char *p_path);
+
+/*
+ * The names in a directory, in the order the directory gives them, "." and
+ * ".." included; the directory is closed with the object, whatever path
+ * the caller leaves by.
+ */
+class sr_i_directory_reader {
+ public:
+  sr_i_directory_reader() = default;
+  ~sr_i_directory_reader();
+  sr_i_directory_reader(const sr_i_directory_reader &) = delete;
+  sr_i_directory_reader &operator=(const sr_i_directory_reader &) = delete;
+
+  /* Opens the directory `p_path`. 0, 206, or 10 naming "opendir". */
+  int32_t open(const char *p_path);
+
+  /* Puts the next name in `*pp_name`, valid until the next call, or null
+   * after the last one. 0, or 10 naming "readdir". */
+  int32_t next(const char **pp_name);
+
+ private:
+  DIR *p_directory_ = nullptr;
+};
 
 /*
  * Records a failed flush for the administrator in "reginfo_pid.<pid>" in

@@ -5,6 +5,7 @@
 
 #include "storage/sr_i_system_calls.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -38,6 +39,9 @@ constexpr sr_i_file_system_calls_t C_Library_Calls = {
     .stat = ::stat,
     .fstat = ::fstat,
     .lock = lock_record,
+    .opendir = ::opendir,
+    .readdir = ::readdir,
+    .closedir = ::closedir,
     .usleep = ::usleep,
 };
 

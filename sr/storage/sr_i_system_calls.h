@@ -10,6 +10,7 @@
 #ifndef SR_I_SYSTEM_CALLS_H
 #define SR_I_SYSTEM_CALLS_H
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <sys/types.h>
@@ -32,6 +33,10 @@ typedef struct sr_i_file_system_calls_struct_t {
   int (*fstat)(int fd, struct stat *p_status);
   /* fcntl for the record-lock commands (F_OFD_SETLK, F_OFD_SETLKW). */
   int (*lock)(int fd, int command, struct flock *p_lock);
+  /* The names in a mount directory, for listing its tables. */
+  DIR *(*opendir)(const char *p_path);
+  struct dirent *(*readdir)(DIR *p_directory);
+  int (*closedir)(DIR *p_directory);
   /* The pause between retries of an interrupted call. */
   int (*usleep)(useconds_t microseconds);
 } sr_i_file_system_calls_t;

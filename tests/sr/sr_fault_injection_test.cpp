@@ -55,12 +55,15 @@ enum call_kind {
   Stat,
   Fstat,
   Lock,
+  Opendir,
+  Readdir,
+  Closedir,
   Total_Kinds
 };
 // As message 2605-010 names them.
 constexpr const char *Call_Names[Total_Kinds] = {
-    "mkdir",   "open",      "close",  "read",   "write", "writev", "fdatasync",
-    "lseek64", "ftruncate", "rename", "unlink", "stat",  "fstat",  "lockf"};
+    "mkdir",  "open",   "close", "read",  "write", "writev",  "fdatasync", "lseek64", "ftruncate",
+    "rename", "unlink", "stat",  "fstat", "lockf", "opendir", "readdir",   "closedir"};
 
 // The one call to fail, and what the door saw.
 struct injector_t {
@@ -134,6 +137,16 @@ constexpr door Proxy_Door = {
     .stat = proxy<Stat, &door::stat>,
     .fstat = proxy<Fstat, &door::fstat>,
     .lock = proxy<Lock, &door::lock>,
+    // The directory calls report failure by a null pointer.
+    .opendir =
+        [](const char *p_path) {
+          return fails(Opendir) ? nullptr : Sr_Default_File_System.opendir(p_path);
+        },
+    .readdir =
+        [](DIR *p_directory) {
+          return fails(Readdir) ? nullptr : Sr_Default_File_System.readdir(p_directory);
+        },
+    .closedir = proxy<Closedir, &door::closedir>,
     // Retries come at once.
     .usleep =
         [](useconds_t) {

@@ -92,7 +92,9 @@ TEST_F(Namespace, CopiesReachTheTargetInEveryDirectionAndLeaveTheSource) {
 
 TEST_F(Namespace, AnExistingTargetIsReplacedOnlyWithOverwrite) {
   sr_opaque_handle_t source = filled("/m/a");
-  ASSERT_NE(create_named_counts("/m/t", Implicit), nullptr);
+  // The replaced transient target lives on, detached, for this handle.
+  sr_opaque_handle_t old_target = create_named_counts("/m/t", Implicit);
+  ASSERT_NE(old_target, nullptr);
   ASSERT_NE(create_named_counts("/disk/t", Implicit), nullptr);
   for (const char *p_target : {"/m/t", "/disk/t"}) {
     EXPECT_EQ(sr_copy_table_by_handle_1(source, p_target, 0), SR_E_TABLE_EXISTS) << p_target;
@@ -112,6 +114,8 @@ TEST_F(Namespace, AnExistingTargetIsReplacedOnlyWithOverwrite) {
   write_file(file("empty"), "");
   EXPECT_EQ(sr_copy_table_by_handle_1(source, "/disk/empty", 0), 0);
   EXPECT_EQ(rows_elsewhere("/disk/empty"), Rows);
+  EXPECT_TRUE(rows_in<std::string>(old_target, "name", 0).empty());
+  EXPECT_EQ(sr_close_table_1(old_target), 0);
 }
 
 TEST_F(Namespace, MissingSourcesAndBadPathsAreRefused) {

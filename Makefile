@@ -14,8 +14,12 @@ deps:
 
 run: deps
 	cmake --preset default
-	cmake --build build -j$(JOBS) --target configuration
+	cmake --build build -j$(JOBS) --target configuration qvreg
 	build/examples/configuration
+	@echo '$$ qvreg ls /local && qvreg schema /local/services && qvreg dump /local/services'
+	@build/tools/qvreg/qvreg ls /local
+	@build/tools/qvreg/qvreg schema /local/services
+	@build/tools/qvreg/qvreg dump /local/services
 
 test: deps
 	cmake --preset default

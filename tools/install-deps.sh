@@ -3,7 +3,8 @@
 # Run by every make target; does nothing on a machine that has them all.
 # `install-deps.sh bench` adds the peers of the comparison benchmark.
 set -euo pipefail
-packages=(cmake make g++ libc-bin locales libgtest-dev libbenchmark-dev)
+packages=(cmake make g++ libc-bin locales libgtest-dev libbenchmark-dev
+  libcli11-dev nlohmann-json3-dev)
 if [ "${1:-}" = bench ]; then
   packages+=(libsqlite3-dev liblmdb-dev)
 fi

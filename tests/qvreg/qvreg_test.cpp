@@ -209,6 +209,25 @@ TEST_F(Qvreg, SchemaChangesAndTablesAreShownCopiedMovedAndRemoved) {
   EXPECT_FALSE(std::filesystem::exists(registry_ + "/services.rewrite"));
 }
 
+TEST_F(Qvreg, StructuredDataColumnsAreDefinedWrittenAndReadAsObjects) {
+  ok({"create", "/local/places", "id:uint64:key", R"(where:sd(x=int32,label=string))",
+      R"(route:sd_array(x=int32,label=string)=[])", "handle:resource_handle"});
+  ok({"add", "/local/places", "id=18446744073709551615", R"(where={"x":-3,"label":"dock"})",
+      R"(route=[{"x":1,"label":"a"},{"x":2,"label":"b"}])",
+      "handle=00010002:0000000a.0000000b.0000000c.0000000d"});
+  EXPECT_EQ(rows_of("/local/places"), json::parse(R"([{"id":18446744073709551615,
+      "where":{"x":-3,"label":"dock"},
+      "route":[{"x":1,"label":"a"},{"x":2,"label":"b"}],
+      "handle":"00010002:0000000a.0000000b.0000000c.0000000d"}])"));
+  const json schema = json::parse(ok({"--format", "json", "schema", "/local/places"}));
+  EXPECT_EQ(schema[1]["fields"], (json{"x:int32", "label:string"}));
+  const result missing_field = run({"add", "/local/places", "id=1", R"(where={"x":1})"});
+  EXPECT_EQ(missing_field.exit_code, 2);
+  EXPECT_NE(missing_field.err.find("field \"label\" missing"), std::string::npos)
+      << missing_field.err;
+  EXPECT_EQ(run({"create", "/local/bad", "id:int32:key", "s:sd(x=nothing)"}).exit_code, 2);
+}
+
 TEST_F(Qvreg, PackedBuffersAreWrittenAndTheirTablesShown) {
   create_services();
   ok({"create", "/local/hosts", "id:int32:key", "address:string"});

@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstring>
 #include <filesystem>
 #include <iostream>
@@ -67,49 +68,98 @@ uint32_t qualifier_of(const std::string &text) {
   return qualifier;
 }
 
-// Column definitions from "NAME:TYPE[:QUALIFIER][=DEFAULT]" arguments, with
-// what their defaults point into.
+// The fields of a structured-data type written "sd(NAME=TYPE,...)" or
+// "sd_array(...)", from the text inside the parentheses.
+std::vector<std::pair<std::string, qv_data_type_t>> fields_of(const std::string &text) {
+  std::vector<std::pair<std::string, qv_data_type_t>> fields;
+  for (size_t start = 0; start < text.size();) {
+    const size_t comma = std::min(text.find(',', start), text.size());
+    const std::string field = text.substr(start, comma - start);
+    const size_t equals = field.find('=');
+    const qv_data_type_t type =
+        equals == std::string::npos ? QV_UNKNOWN : type_of_name(field.substr(equals + 1));
+    if (type == QV_UNKNOWN || equals == 0) {
+      throw usage_error("\"" + field + "\" is not a structured-data field NAME=TYPE");
+    }
+    fields.emplace_back(field.substr(0, equals), type);
+    start = comma + 1;
+  }
+  return fields;
+}
+
+// Column definitions from "NAME:TYPE[:QUALIFIER][=DEFAULT]" arguments, a
+// structured-data TYPE being "sd(NAME=TYPE,...)" or "sd_array(...)", with
+// what their names, defaults and field definitions point into.
 struct column_specs {
-  std::vector<std::string> names;
-  std::vector<owned_value> defaults;
+  std::vector<column_info> infos;
+  std::vector<owned_value> defaults; /* also holds the field definitions */
   std::vector<sr_column_t> columns;
 
   explicit column_specs(const std::vector<std::string> &specs) {
-    names.reserve(specs.size());
+    infos.reserve(specs.size());
     defaults.reserve(specs.size());
     for (const std::string &spec : specs) {
-      const size_t equals = spec.find('=');
-      const std::string head = spec.substr(0, equals);
-      const size_t colon = head.find(':');
-      if (colon == std::string::npos) {
+      const size_t colon = spec.find(':');
+      if (colon == std::string::npos || colon == 0) {
         throw usage_error("\"" + spec + "\" is not NAME:TYPE[:QUALIFIER][=DEFAULT]");
       }
-      const size_t second = head.find(':', colon + 1);
-      const std::string type_text = head.substr(colon + 1, second - colon - 1);
-      column_info column{head.substr(0, colon), type_of_name(type_text), SR_STANDARD, {}};
-      if (column.type == QV_UNKNOWN) {
-        throw usage_error("\"" + type_text + "\" is not a column type");
+      // The type ends at the next ":" or "=", or after its field list.
+      size_t type_end = std::min(spec.find_first_of(":=", colon + 1), spec.size());
+      const size_t open = spec.find('(', colon + 1);
+      std::string fields_text;
+      if (open < type_end) {
+        const size_t close = spec.find(')', open);
+        if (close == std::string::npos) {
+          throw usage_error("\"" + spec + "\" has no \")\" after its fields");
+        }
+        fields_text = spec.substr(open + 1, close - open - 1);
+        type_end = close + 1;
       }
-      if (column.type == QV_SD_PTR || column.type == QV_SD_PTR_ARRAY) {
-        throw usage_error("structured-data columns cannot be defined from the command line");
+      const std::string type_text = spec.substr(colon + 1, std::min(open, type_end) - colon - 1);
+      column_info column{spec.substr(0, colon), type_of_name(type_text), SR_STANDARD, {}};
+      const bool structured = column.type == QV_SD_PTR || column.type == QV_SD_PTR_ARRAY;
+      if (column.type == QV_UNKNOWN || structured != (open < type_end)) {
+        throw usage_error("\"" + spec.substr(colon + 1, type_end - colon - 1) +
+                          "\" is not a column type");
       }
-      if (second != std::string::npos) {
-        column.qualifier = qualifier_of(head.substr(second + 1));
+      if (structured) {
+        column.fields = fields_of(fields_text);
       }
-      names.push_back(column.name);
+      const size_t equals = std::min(spec.find('=', type_end), spec.size());
+      if (type_end < spec.size() && spec[type_end] == ':') {
+        column.qualifier = qualifier_of(spec.substr(type_end + 1, equals - type_end - 1));
+      }
       defaults.emplace_back();
-      if (equals != std::string::npos) {
+      if (equals < spec.size()) {
         from_text(column, spec.substr(equals + 1), defaults.back());
       }
       sr_column_t definition{};
       definition.type = column.type;
       definition.qualifier = static_cast<sr_qualifier_t>(column.qualifier);
       definition.default_value = defaults.back().value;
+      if (structured) {
+        definition.sd_defn = field_definitions(column, defaults.back());
+      }
+      infos.push_back(std::move(column));
       columns.push_back(definition);
     }
     for (size_t at = 0; at < columns.size(); ++at) {
-      columns[at].name = names[at].data();
+      columns[at].name = infos[at].name.data();
     }
+  }
+
+  // The library's form of a column's fields, in blocks of `owner`.
+  static sr_sd_def_t *field_definitions(const column_info &column, owned_value &owner) {
+    auto *p_definition = static_cast<sr_sd_def_t *>(
+        owner.block(sizeof(sr_sd_def_t) + column.fields.size() * sizeof(sr_sd_field_def_t)));
+    p_definition->number_of_fields = static_cast<uint32_t>(column.fields.size());
+    for (size_t at = 0; at < column.fields.size(); ++at) {
+      const std::string &name = column.fields[at].first;
+      auto *p_name = static_cast<char *>(owner.block(name.size() + 1));
+      std::memcpy(p_name, name.c_str(), name.size() + 1);
+      p_definition->field_def[at] = {column.fields[at].second, p_name};
+    }
+    return p_definition;
   }
 };
 

@@ -37,13 +37,10 @@ int32_t sr_i_abort_in_memory(sr_i_table_t *p_table, sr_i_change_entry_t *p_first
  * commit, or abort and return the apply's code. */
 int32_t sr_i_apply_and_commit_implicitly(sr_i_table_t *p_table);
 
-/*
- * The common body of the calls that act on a table opened for writing: 100
- * for a null handle, the table's write lock, 206 unless the table is open
- * for writing, then `body(p_table)` under the lock.
- */
+/* The common body of the calls that change a table in any way: 100 for a
+ * null handle, the table's write lock, then `body(p_table)` under it. */
 template <typename Body>
-int32_t sr_i_with_writable_table(sr_opaque_handle_t table_handle, Body &&body) {
+int32_t sr_i_with_table_locked_for_writing(sr_opaque_handle_t table_handle, Body &&body) {
   if (table_handle == nullptr) {
     return sr_i_raise(SR_E_INVALID_HANDLE);
   }
@@ -52,10 +49,19 @@ int32_t sr_i_with_writable_table(sr_opaque_handle_t table_handle, Body &&body) {
   if (table_lock.result() != 0) {
     return table_lock.result();
   }
-  if ((p_table->mode & Sr_Mode_Writable) == 0) {
-    return sr_i_raise(SR_E_ACCESS);
-  }
   return body(p_table);
+}
+
+/* sr_i_with_table_locked_for_writing for the calls that act on a table
+ * opened for writing: 206 unless it is. */
+template <typename Body>
+int32_t sr_i_with_writable_table(sr_opaque_handle_t table_handle, Body &&body) {
+  return sr_i_with_table_locked_for_writing(table_handle, [&](sr_i_table_t *p_table) -> int32_t {
+    if ((p_table->mode & Sr_Mode_Writable) == 0) {
+      return sr_i_raise(SR_E_ACCESS);
+    }
+    return body(p_table);
+  });
 }
 
 /* sr_i_with_writable_table for a change of rows or metadata: a success on

@@ -17,8 +17,8 @@
 #include <cstdint>
 
 #include "frame/sr_i_errors.h"
-#include "frame/sr_i_read_write_lock.h"
 #include "qv_sr.h"
+#include "rows/sr_i_transaction.h"
 #include "tables/sr_i_table.h"
 
 /*
@@ -100,19 +100,13 @@ int32_t sr_i_overlay_memory_column_qualifier(sr_i_table_t *p_table, const char *
  */
 template <typename Build>
 int32_t sr_i_rebuild_table(sr_opaque_handle_t table_handle, Build &&build) {
-  if (table_handle == nullptr) {
-    return sr_i_raise(SR_E_INVALID_HANDLE);
-  }
-  auto *p_table = static_cast<sr_i_table_t *>(table_handle);
-  sr_i_write_guard table_lock(&p_table->lock);
-  if (table_lock.result() != 0) {
-    return table_lock.result();
-  }
-  sr_i_table_t *p_new_table = nullptr;
-  if (const int32_t rc = build(p_table, &p_new_table); rc != 0) {
-    return rc;
-  }
-  return sr_i_complete_rebuild(p_table, p_new_table);
+  return sr_i_with_table_locked_for_writing(table_handle, [&](sr_i_table_t *p_table) -> int32_t {
+    sr_i_table_t *p_new_table = nullptr;
+    if (const int32_t rc = build(p_table, &p_new_table); rc != 0) {
+      return rc;
+    }
+    return sr_i_complete_rebuild(p_table, p_new_table);
+  });
 }
 
 /* The common body of the overlays: 100 for a null handle, 101 for a null
@@ -120,18 +114,10 @@ int32_t sr_i_rebuild_table(sr_opaque_handle_t table_handle, Build &&build) {
 template <typename Overlay>
 int32_t sr_i_overlay_column(sr_opaque_handle_t table_handle, const char *p_column_name,
                             Overlay &&overlay) {
-  if (table_handle == nullptr) {
-    return sr_i_raise(SR_E_INVALID_HANDLE);
-  }
-  if (p_column_name == nullptr) {
+  if (table_handle != nullptr && p_column_name == nullptr) {
     return sr_i_raise(SR_E_NULL_POINTER);
   }
-  auto *p_table = static_cast<sr_i_table_t *>(table_handle);
-  sr_i_write_guard table_lock(&p_table->lock);
-  if (table_lock.result() != 0) {
-    return table_lock.result();
-  }
-  return overlay(p_table);
+  return sr_i_with_table_locked_for_writing(table_handle, overlay);
 }
 
 #endif /* SR_I_SCHEMA_CHANGES_H */

@@ -98,40 +98,41 @@ struct column_specs {
   explicit column_specs(const std::vector<std::string> &specs) {
     infos.reserve(specs.size());
     defaults.reserve(specs.size());
-    for (const std::string &spec : specs) {
-      const size_t colon = spec.find(':');
+    for (const std::string &argument : specs) {
+      const size_t colon = argument.find(':');
       if (colon == std::string::npos || colon == 0) {
-        throw usage_error("\"" + spec + "\" is not NAME:TYPE[:QUALIFIER][=DEFAULT]");
+        throw usage_error("\"" + argument + "\" is not NAME:TYPE[:QUALIFIER][=DEFAULT]");
       }
       // The type ends at the next ":" or "=", or after its field list.
-      size_t type_end = std::min(spec.find_first_of(":=", colon + 1), spec.size());
-      const size_t open = spec.find('(', colon + 1);
+      size_t type_end = std::min(argument.find_first_of(":=", colon + 1), argument.size());
+      const size_t open = argument.find('(', colon + 1);
       std::string fields_text;
       if (open < type_end) {
-        const size_t close = spec.find(')', open);
+        const size_t close = argument.find(')', open);
         if (close == std::string::npos) {
-          throw usage_error("\"" + spec + "\" has no \")\" after its fields");
+          throw usage_error("\"" + argument + "\" has no \")\" after its fields");
         }
-        fields_text = spec.substr(open + 1, close - open - 1);
+        fields_text = argument.substr(open + 1, close - open - 1);
         type_end = close + 1;
       }
-      const std::string type_text = spec.substr(colon + 1, std::min(open, type_end) - colon - 1);
-      column_info column{spec.substr(0, colon), type_of_name(type_text), SR_STANDARD, {}};
+      const std::string type_text =
+          argument.substr(colon + 1, std::min(open, type_end) - colon - 1);
+      column_info column{argument.substr(0, colon), type_of_name(type_text), SR_STANDARD, {}};
       const bool structured = column.type == QV_SD_PTR || column.type == QV_SD_PTR_ARRAY;
       if (column.type == QV_UNKNOWN || structured != (open < type_end)) {
-        throw usage_error("\"" + spec.substr(colon + 1, type_end - colon - 1) +
+        throw usage_error("\"" + argument.substr(colon + 1, type_end - colon - 1) +
                           "\" is not a column type");
       }
       if (structured) {
         column.fields = fields_of(fields_text);
       }
-      const size_t equals = std::min(spec.find('=', type_end), spec.size());
-      if (type_end < spec.size() && spec[type_end] == ':') {
-        column.qualifier = qualifier_of(spec.substr(type_end + 1, equals - type_end - 1));
+      const size_t equals = std::min(argument.find('=', type_end), argument.size());
+      if (type_end < argument.size() && argument[type_end] == ':') {
+        column.qualifier = qualifier_of(argument.substr(type_end + 1, equals - type_end - 1));
       }
       defaults.emplace_back();
-      if (equals < spec.size()) {
-        from_text(column, spec.substr(equals + 1), defaults.back());
+      if (equals < argument.size()) {
+        from_text(column, argument.substr(equals + 1), defaults.back());
       }
       sr_column_t definition{};
       definition.type = column.type;

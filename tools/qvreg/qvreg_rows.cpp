@@ -220,8 +220,9 @@ void set_row(session &s, const std::string &table, const std::string &key,
 
 void add_row(session &s, const std::string &table, const std::vector<std::string> &assignments) {
   const sr_opaque_handle_t handle = s.open(table, true);
+  const std::vector<column_info> columns = columns_of(handle);  // the names point into it
   field_values fields;
-  parse_assignments(columns_of(handle), table, assignments, fields);
+  parse_assignments(columns, table, assignments, fields);
   check(sr_add_row_1(handle, fields.names.data(), fields.pointers.data(),
                      static_cast<uint32_t>(fields.names.size())));
   s.changed(table);

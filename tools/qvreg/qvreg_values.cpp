@@ -179,15 +179,20 @@ qv_value_t build_text(const std::string &text, owned_value &blocks) {
 qv_value_t build_bytes(const column_info &column, const std::string &hex, owned_value &blocks) {
   const std::vector<unsigned char> bytes = bytes_of_hex(column, hex);
   qv_value_t value{};
+  // An empty value's blocks stay as calloc left them: nothing to copy.
   if (column.type == QV_SBS_PTR) {
     auto *p_sbs = static_cast<qv_sbs_t *>(blocks.block(sizeof(qv_sbs_t) + bytes.size()));
     p_sbs->length = static_cast<int32_t>(bytes.size());
-    std::memcpy(p_sbs->fields, bytes.data(), bytes.size());
+    if (!bytes.empty()) {
+      std::memcpy(p_sbs->fields, bytes.data(), bytes.size());
+    }
     value.ptr_sbs = p_sbs;
   } else {
     auto *p_binary = static_cast<qv_binary_t *>(blocks.block(sizeof(qv_binary_t) + bytes.size()));
     p_binary->length = static_cast<uint32_t>(bytes.size());
-    std::memcpy(p_binary->data, bytes.data(), bytes.size());
+    if (!bytes.empty()) {
+      std::memcpy(p_binary->data, bytes.data(), bytes.size());
+    }
     value.ptr_binary = p_binary;
   }
   return value;

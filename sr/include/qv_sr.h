@@ -809,10 +809,14 @@ QV_SR_EXPORT int32_t sr_copy_table_by_name_1(sr_opaque_handle_t tree_handle,
  * Moves a table to `p_target_table_name`: as a copy, after which the source
  * is gone from its path (and its file from the disk). A table moved into
  * memory is the same table object under its new name, rows and handles
- * included, and no longer refers to any file. Handles on a table moved to
- * disk keep working on the detached table in memory. A table file no one
- * has open moves to another path below a mount point by one rename (both
- * paths on one filesystem). Returns as sr_copy_table_by_handle_1.
+ * included, and no longer refers to any file. A table file moves to another
+ * path of its mount directory by one rename, so a crash leaves it at one of
+ * the two paths: when it is open here, the same table object goes on under
+ * the new path, handles, pending changes and file lock included (a rewrite
+ * applied and not committed, or a target open here, make it a copy and a
+ * removal instead). Handles on a table moved to disk otherwise keep
+ * working on the detached table in memory. Returns as
+ * sr_copy_table_by_handle_1.
  */
 QV_SR_EXPORT int32_t sr_move_table_by_handle_1(sr_opaque_handle_t table_handle,
                                                const char *p_target_table_name, int32_t overwrite);

@@ -226,6 +226,7 @@ class duplication {
     if (const int32_t rc = resolve(p_tree_, p_target_path, target_); rc != 0) {
       return rc;
     }
+    p_target_path_ = p_target_path;
     p_open_target_ = open_table_at(p_tree_, target_.key);
     if (p_source_ != nullptr ? p_open_target_ == p_source_ : source_file_ == target_.key) {
       // A table onto its own path: there is nothing to carry.
@@ -246,7 +247,7 @@ class duplication {
         rc = read_lock->result();
       }
       if (rc == 0) {
-        rc = target_.persistent() ? to_disk() : to_memory(source_done);
+        rc = target_.persistent() ? to_disk(source_done) : to_memory(source_done);
       }
     }
     if (rc == 0 && remove_source_ && !source_done && p_source_ != nullptr) {
@@ -279,7 +280,7 @@ class duplication {
     return 0;
   }
 
-  int32_t to_disk() {
+  int32_t to_disk(bool &source_done) {
     if (p_open_target_ != nullptr && has_changes_on_the_way(p_open_target_)) {
       return sr_i_raise(SR_E_UNCOMMITTED);
     }
@@ -293,7 +294,7 @@ class duplication {
       if (locks.target_length() != 0 && !overwrite_) {
         return sr_i_raise(SR_E_TABLE_EXISTS);
       }
-      rc = write_target_file(&p_fresh);
+      rc = moves_its_own_file() ? move_open_file(source_done) : write_target_file(&p_fresh);
     }
     // The file locks are given up first: the fresh image holds the writer's
     // lock of the new file on its own descriptor. Once renamed, the new file
@@ -304,6 +305,46 @@ class duplication {
       rc = rc != 0 ? rc : swapped;
     }
     return rc;
+  }
+
+  // Whether the source is a table file open here that moves within its
+  // directory, where one rename carries it: a crash then leaves it at its
+  // source or its target, never at both. A rewrite waiting for commit, or a
+  // target open here, takes the way of a copy.
+  bool moves_its_own_file() const {
+    return p_source_ != nullptr && remove_source_ && p_source_->p_file != nullptr &&
+           p_open_target_ == nullptr && p_source_->ready_for_commit != Sr_Applied_By_Rewrite &&
+           directory_of(p_source_->p_file->path) == directory_of(target_.key);
+  }
+
+  // Renames the open source's file over the target and moves the table
+  // object to the target's path, handles, pending changes and file lock
+  // with it. Once renamed (`source_done`), a failure is only the flush of
+  // the directory.
+  int32_t move_open_file(bool &source_done) {
+    // Everything the object will need is made first, so that nothing can
+    // fail once the file has its new name.
+    std::string path = target_.key;
+    std::string rewrite_path = target_.key + ".rewrite";
+    std::unique_ptr<char, decltype(&std::free)> name(strdup(target_.key.c_str()), &std::free);
+    std::unique_ptr<char, decltype(&std::free)> registry_path(strdup(p_target_path_), &std::free);
+    if (name == nullptr || registry_path == nullptr) {
+      return sr_i_raise_no_memory();
+    }
+    sr_i_table_file_t &file = *p_source_->p_file;
+    bool renamed = false;
+    const int32_t rc = sr_i_rename_durably(file.path.c_str(), target_.key.c_str(), &renamed);
+    if (!renamed) {
+      return rc;
+    }
+    sr_i_take_out_of_tree(p_tree_, p_source_);
+    std::swap(file.path, path);
+    std::swap(file.rewrite_path, rewrite_path);
+    std::free(std::exchange(p_source_->p_name, name.release()));
+    std::free(std::exchange(p_source_->p_persistent_table_registry_path, registry_path.release()));
+    source_done = true;
+    const int32_t entered = sr_i_enter_named_table(p_tree_, target_.key, p_source_);
+    return rc != 0 ? rc : entered;
   }
 
   // The new target file, from the source object, by renaming the source
@@ -415,6 +456,7 @@ class duplication {
   std::string source_file_; /* a source no one has open here */
   resolved_path target_;
   sr_i_table_t *p_open_target_ = nullptr;
+  const char *p_target_path_ = nullptr;
 };
 
 }  // namespace

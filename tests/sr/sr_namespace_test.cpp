@@ -3,6 +3,7 @@
 // source, what becomes of handles on either, and what is refused.
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -61,6 +62,10 @@ class Namespace : public RowTables {
   }
 
   std::string file(const char *p_name) const { return directory_ + "/" + p_name; }
+  static ino_t inode_of(const std::string &path) {
+    struct stat status {};
+    return ::stat(path.c_str(), &status) == 0 ? status.st_ino : 0;
+  }
   bool exists(const char *p_name) const { return std::filesystem::exists(file(p_name)); }
 };
 
@@ -173,6 +178,29 @@ TEST_F(Namespace, AMovedTableKeepsItsHandlesInMemoryAndItsPathIsFree) {
   apply_commit(open);
   EXPECT_FALSE(exists("c"));
   EXPECT_EQ(count_of(open, "e", 0), 5);
+}
+
+// A table file open here that moves within its directory is renamed: the
+// same object goes on under the new path, and what its handle changes
+// afterwards goes to the renamed file.
+TEST_F(Namespace, AnOpenTableFileMovesByRenameAndItsHandleWritesToTheNewPath) {
+  sr_opaque_handle_t table = filled("/disk/a");
+  ASSERT_EQ(add_named(table, "pending", 9), 0);  // stays pending across the move
+  const ino_t inode = inode_of(file("a"));
+  ASSERT_EQ(sr_move_table_by_handle_1(table, "/disk/b", 0), 0);
+  EXPECT_FALSE(exists("a"));
+  EXPECT_EQ(inode_of(file("b")), inode);
+  EXPECT_EQ(rows_elsewhere("/disk/b"), Rows);
+  apply_commit(table);
+  rows_t expected = Rows;
+  expected["pending"] = 9;
+  EXPECT_EQ(rows_elsewhere("/disk/b"), expected);
+  sr_opaque_handle_t again = nullptr;
+  ASSERT_EQ(sr_open_table_1(tree_, "/disk/b", SR_MODE_READ, &again), 0);
+  EXPECT_EQ(again, table);
+  EXPECT_EQ(rows_here("/disk/a"), (rows_t{{"<200>", 200}}));
+  ASSERT_EQ(sr_close_table_1(again), 0);
+  EXPECT_EQ(sr_close_table_1(table), 0);
 }
 
 // An open persistent target overwritten by a copy is read again: its

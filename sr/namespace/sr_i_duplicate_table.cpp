@@ -52,6 +52,12 @@ sr_i_table_t *open_table_at(const sr_i_tree_t *p_tree, const std::string &key) {
   return found != p_tree->tables.end() ? found->second : nullptr;
 }
 
+// A descriptor closed, and so its lock given up, when it goes.
+struct descriptor {
+  int fd = -1;
+  ~descriptor() { sr_i_close_file(fd); }
+};
+
 struct table_closer {
   sr_i_table_t *p_table;
   ~table_closer() { sr_i_close_table(p_table); }
@@ -347,12 +353,39 @@ class duplication {
     return rc != 0 ? rc : entered;
   }
 
+  // Opens and locks the source file. A writer that committed by renaming a
+  // new file over it meanwhile gave up the lock of the old one: the lock
+  // is taken again on the file the name holds now.
+  int32_t lock_source_file(descriptor &source) const {
+    for (;;) {
+      if (const int32_t rc = sr_i_open_file(source_file_.c_str(), O_RDWR, &source.fd); rc != 0) {
+        return rc;
+      }
+      bool same = false;
+      if (const int32_t rc = sr_i_lock_file(source.fd); rc != 0) {
+        return rc;
+      }
+      if (const int32_t rc = sr_i_is_same_file(source.fd, source_file_.c_str(), &same);
+          rc != 0 || same) {
+        return rc;
+      }
+      sr_i_close_file(std::exchange(source.fd, -1));
+    }
+  }
+
   // The new target file, from the source object, by renaming the source
   // file, or as a copy of it. A target open here gets `*pp_fresh`, its new
   // image, once the new file is in place.
   int32_t write_target_file(sr_i_table_t **pp_fresh) {
     if (p_source_ == nullptr && remove_source_) {
-      // Between table files a move is one rename.
+      // Between table files a move is one rename. A writer of the source in
+      // another process holds its file's lock while it has the table open:
+      // the move waits for it, so that no commit of that writer renames a
+      // new file onto the old name after the table has left it.
+      descriptor source;
+      if (const int32_t rc = lock_source_file(source); rc != 0) {
+        return rc;
+      }
       bool renamed = false;
       const int32_t rc = rename_into_place(source_file_, pp_fresh, &renamed);
       if (!renamed) {

@@ -459,4 +459,46 @@ TEST_F(Processes, TwoCopiersOntoOneTableAreSerialisedAndAReaderSeesOneWholeCopy)
             << 2 * Rounds + 1 << "\n";
 }
 
+// A move by name waits for a writer of the source in another process to
+// close it, and takes along what that writer committed, even by writing a
+// new file over the old one: the table ends at the target alone.
+TEST_F(Processes, AMoveByNameWaitsForAWriterOfTheSourceAndTakesWhatItCommitted) {
+  constexpr uint32_t Payload_Spread = 100;
+  create_table(4);
+  int ready[2];
+  ASSERT_EQ(pipe(ready), 0);
+  const pid_t writer = start_process([&] {
+    sr_opaque_handle_t tree = mounted_tree();
+    sr_opaque_handle_t table = nullptr;
+    if (tree == nullptr || open_table(tree, Table_Path, Open_Explicit, &table) != 0) {
+      return 2;
+    }
+    if (write(ready[1], "!", 1) != 1) {
+      return 3;
+    }
+    // Two commits, each writing a new file renamed over the table's name.
+    for (int32_t id = 1; id <= 2; ++id) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(100));
+      if (add_row(table, id, 1, Payload_Spread) != 0 ||
+          sr_i_apply(static_cast<sr_i_table_t *>(table), 1, 0) != 0 || sr_commit_1(table) != 0) {
+        return 4;
+      }
+    }
+    return sr_close_tree_1(tree) == 0 ? 0 : 5;
+  });
+  close(ready[1]);
+  char signal = 0;
+  ASSERT_EQ(read(ready[0], &signal, 1), 1);
+  close(ready[0]);
+  sr_opaque_handle_t tree = mounted_tree();
+  ASSERT_EQ(sr_move_table_by_name_1(tree, Table_Path, "/disk/shared/u", 0), 0);
+  EXPECT_EQ(sr_close_tree_1(tree), 0);
+  EXPECT_EQ(finish(writer), 0);
+  EXPECT_FALSE(std::filesystem::exists(directory_ + "/" + Table_File))
+      << "the writer's commit brought the table back to its old name";
+  table_state moved;
+  ASSERT_EQ(sr_versioned::read_table(directory_, "/disk/shared/u", moved, Payload_Spread), "");
+  EXPECT_EQ(moved.rows, (std::map<int32_t, int32_t>{{1, 1}, {2, 1}}));
+}
+
 }  // namespace

@@ -19,84 +19,28 @@
 #include <system_error>
 #include <vector>
 
+#include "bench_tables.h"
 #include "qv_sr.h"
 
 namespace {
 
-constexpr int64_t Rows = 100000;
+using namespace bench;
 
-// A directory of its own for one benchmark, removed afterwards.
-class scratch_directory {
- public:
-  scratch_directory() {
-    const char *p_base = std::getenv("QV_BENCH_DIR");
-    std::string pattern =
-        std::string(p_base != nullptr ? p_base : "/var/tmp") + "/qv-schema-XXXXXX";
-    if (mkdtemp(pattern.data()) == nullptr) {
-      std::perror(pattern.c_str());
-      std::exit(1);
-    }
-    path_ = pattern;
-  }
-  ~scratch_directory() {
-    std::error_code ignored;
-    std::filesystem::remove_all(path_, ignored);
-  }
-  scratch_directory(const scratch_directory &) = delete;
-  scratch_directory &operator=(const scratch_directory &) = delete;
-  const std::string &path() const { return path_; }
-
- private:
-  std::string path_;
-};
-
-// The note every row carries: about 20 bytes, different per row.
-std::string note_of(int64_t id) {
-  return "service-" + std::to_string(id * 7919 % 1000003);
-}
-
-// Our table: "id" key, "count", "note", filled in one transaction.
-sr_opaque_handle_t make_our_table(sr_opaque_handle_t tree) {
-  sr_column_t columns[3] = {};
-  columns[0].name = const_cast<char *>("id");
-  columns[0].type = QV_INT32;
-  columns[0].qualifier = SR_PRIMARY_KEY_NOCHECK;
-  columns[1].name = const_cast<char *>("count");
-  columns[1].type = QV_INT32;
-  columns[1].qualifier = SR_STANDARD;
-  columns[2].name = const_cast<char *>("note");
-  columns[2].type = QV_CHAR_PTR;
-  columns[2].qualifier = SR_STANDARD;
+// The table "/disk/t" of a tree made by tree_with_table, open for writing.
+sr_opaque_handle_t our_table(sr_opaque_handle_t tree) {
   sr_opaque_handle_t table = nullptr;
-  if (sr_create_table_1(tree, "/disk/t", columns, 3, SR_MODE_WRITE_EXPLICIT, &table) != 0) {
-    return nullptr;
-  }
-  const char *names[3] = {"id", "count", "note"};
-  for (int64_t id = 0; id < Rows; ++id) {
-    const std::string note = note_of(id);
-    qv_value_t values[3] = {};
-    values[0].val_int32 = static_cast<int32_t>(id);
-    values[1].val_int32 = static_cast<int32_t>(id % 100);
-    values[2].ptr_char = const_cast<char *>(note.c_str());
-    qv_value_t *pointers[3] = {&values[0], &values[1], &values[2]};
-    if (sr_add_row_1(table, names, pointers, 3) != 0) {
-      return nullptr;
-    }
-  }
-  return sr_apply_1(table, 0) == 0 && sr_commit_1(table) == 0 ? table : nullptr;
+  return tree != nullptr && sr_open_table_1(tree, "/disk/t", SR_MODE_WRITE_EXPLICIT, &table) == 0
+             ? table
+             : nullptr;
 }
 
 void add_column_ours(benchmark::State &state) {
-  scratch_directory directory;
-  sr_opaque_handle_t tree = nullptr;
-  if (sr_open_tree_1(&tree, 0, 0) != 0 ||
-      sr_mount_local_tree_1(tree, "/disk", directory.path().c_str(), 0) != 0) {
-    state.SkipWithError("no tree");
-    return;
-  }
-  sr_opaque_handle_t table = make_our_table(tree);
+  scratch_directory directory("schema");
+  sr_opaque_handle_t tree = tree_with_table(directory.path());
+  sr_opaque_handle_t table = our_table(tree);
   if (table == nullptr) {
     state.SkipWithError("the table was not made");
+    sr_close_tree_1(tree);
     return;
   }
   sr_column_t port = {};
@@ -124,34 +68,14 @@ void add_column_ours(benchmark::State &state) {
   sr_close_tree_1(tree);
 }
 
-bool run_sql(sqlite3 *p_database, const char *p_sql) {
-  return sqlite3_exec(p_database, p_sql, nullptr, nullptr, nullptr) == SQLITE_OK;
-}
-
 void add_column_sqlite(benchmark::State &state) {
-  scratch_directory directory;
-  sqlite3 *p_database = nullptr;
+  scratch_directory directory("schema");
   const std::string path = directory.path() + "/t.db";
-  if (sqlite3_open(path.c_str(), &p_database) != SQLITE_OK ||
-      !run_sql(p_database, "PRAGMA synchronous=FULL") ||
-      !run_sql(p_database,
-               "CREATE TABLE t(id INTEGER PRIMARY KEY, count INTEGER, note TEXT);BEGIN")) {
+  sqlite3 *p_database = database_with_table(path);
+  if (p_database == nullptr) {
     state.SkipWithError("no database");
-    sqlite3_close(p_database);
     return;
   }
-  sqlite3_stmt *p_insert = nullptr;
-  sqlite3_prepare_v2(p_database, "INSERT INTO t VALUES(?,?,?)", -1, &p_insert, nullptr);
-  for (int64_t id = 0; id < Rows; ++id) {
-    const std::string note = note_of(id);
-    sqlite3_bind_int64(p_insert, 1, id);
-    sqlite3_bind_int64(p_insert, 2, id % 100);
-    sqlite3_bind_text(p_insert, 3, note.c_str(), -1, SQLITE_TRANSIENT);
-    sqlite3_step(p_insert);
-    sqlite3_reset(p_insert);
-  }
-  sqlite3_finalize(p_insert);
-  run_sql(p_database, "COMMIT");
   // Each rebuild adds "port" to the three columns, so every iteration
   // carries the same table into a schema one column wider.
   const char *p_rebuild =
@@ -178,11 +102,9 @@ void add_column_sqlite(benchmark::State &state) {
 void add_column_floor(benchmark::State &state) {
   uint64_t file_bytes = 0;
   {
-    scratch_directory directory;
-    sr_opaque_handle_t tree = nullptr;
-    sr_open_tree_1(&tree, 0, 0);
-    sr_mount_local_tree_1(tree, "/disk", directory.path().c_str(), 0);
-    sr_opaque_handle_t table = make_our_table(tree);
+    scratch_directory directory("schema");
+    sr_opaque_handle_t tree = tree_with_table(directory.path());
+    sr_opaque_handle_t table = our_table(tree);
     sr_column_t port = {};
     port.name = const_cast<char *>("port");
     port.type = QV_INT32;
@@ -195,7 +117,7 @@ void add_column_floor(benchmark::State &state) {
     file_bytes = std::filesystem::file_size(directory.path() + "/t");
     sr_close_tree_1(tree);
   }
-  scratch_directory directory;
+  scratch_directory directory("schema");
   const std::string path = directory.path() + "/floor";
   const std::vector<char> block(1 << 20, 'x');
   for (auto _ : state) {

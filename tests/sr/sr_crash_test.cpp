@@ -32,18 +32,7 @@ namespace {
 
 using namespace sr_versioned;
 
-#if defined(__has_feature)
-#define SR_HAS_FEATURE(feature) __has_feature(feature)
-#else
-#define SR_HAS_FEATURE(feature) 0
-#endif
-#if defined(__SANITIZE_THREAD__) || SR_HAS_FEATURE(thread_sanitizer)
-constexpr int Crash_Points = 100;
-#elif defined(__SANITIZE_ADDRESS__) || SR_HAS_FEATURE(address_sanitizer)
-constexpr int Crash_Points = 150;
-#else
-constexpr int Crash_Points = 300;
-#endif
+constexpr int Crash_Points = sr_killed_child::scaled_crash_points(300);
 
 // Every this many crash points the table is removed, so that creation is
 // killed too.

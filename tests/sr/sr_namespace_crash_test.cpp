@@ -36,18 +36,7 @@ namespace {
 using namespace sr_versioned;
 using namespace sr_namespace_operations;
 
-#if defined(__has_feature)
-#define SR_HAS_FEATURE(feature) __has_feature(feature)
-#else
-#define SR_HAS_FEATURE(feature) 0
-#endif
-#if defined(__SANITIZE_THREAD__) || SR_HAS_FEATURE(thread_sanitizer)
-constexpr int Crash_Points = 60;
-#elif defined(__SANITIZE_ADDRESS__) || SR_HAS_FEATURE(address_sanitizer)
-constexpr int Crash_Points = 100;
-#else
-constexpr int Crash_Points = 200;
-#endif
+constexpr int Crash_Points = sr_killed_child::scaled_crash_points(200);
 
 // The child: random operations for ever, each announced ("P ...") and
 // confirmed ("C ...") on the pipe, from what the parent found on the disk.

@@ -110,11 +110,28 @@ int32_t sr_i_close_tree(sr_i_tree_t *p_tree) {
 }
 
 int32_t sr_i_enter_named_table(sr_i_tree_t *p_tree, std::string key, sr_i_table_t *p_table) {
-  try {
-    p_tree->tables.emplace(std::move(key), p_table);
-  } catch (const std::bad_alloc &) {
+  sr_i_named_table_place place;
+  if (const int32_t rc = sr_i_make_named_table_place(std::move(key), place); rc != 0) {
     sr_i_close_table(p_table);
+    return rc;
+  }
+  sr_i_enter_table_at(p_tree, std::move(place), p_table);
+  return 0;
+}
+
+int32_t sr_i_make_named_table_place(std::string key, sr_i_named_table_place &place) {
+  // The node is made in a map of its own and taken out of it: the tree's
+  // map then only links it in, which allocates nothing.
+  try {
+    decltype(sr_i_tree_t::tables) maker;
+    place = maker.extract(maker.emplace(std::move(key), nullptr).first);
+  } catch (const std::bad_alloc &) {
     return sr_i_raise_no_memory();
   }
   return 0;
+}
+
+void sr_i_enter_table_at(sr_i_tree_t *p_tree, sr_i_named_table_place place, sr_i_table_t *p_table) {
+  place.mapped() = p_table;
+  p_tree->tables.insert(std::move(place));
 }

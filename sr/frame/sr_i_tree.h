@@ -94,4 +94,18 @@ int32_t sr_i_close_tree(sr_i_tree_t *p_tree);
 int32_t sr_i_enter_named_table(sr_i_tree_t *p_tree, std::string key,
                                struct sr_i_table_struct_t *p_table);
 
+/* A place among a tree's named tables, made before the table is entered so
+ * that entering it cannot fail. A table that moves to another name needs
+ * one: once it has left its old name (or its file has), a failure could
+ * neither give it back nor free it under the handles that hold it. */
+using sr_i_named_table_place = decltype(sr_i_tree_t::tables)::node_type;
+
+/* Makes the place for `key`. Returns 0 or 12 (raised). */
+int32_t sr_i_make_named_table_place(std::string key, sr_i_named_table_place &place);
+
+/* Enters `p_table` at `place`, with the tree write-locked; no table of the
+ * tree may hold the place's key. */
+void sr_i_enter_table_at(sr_i_tree_t *p_tree, sr_i_named_table_place place,
+                         struct sr_i_table_struct_t *p_table);
+
 #endif /* SR_I_TREE_H */

@@ -775,7 +775,9 @@ QV_SR_EXPORT int32_t sr_abort_1(sr_opaque_handle_t table_handle);
  * the old table or the new one, and a copy reported done survives a power
  * cut. Copies into one mount directory are serialised across processes by
  * the directory's ",Lock" file, and a writer of the target (another process
- * with the table open for writing) is waited for. A target open in this
+ * with the table open for writing) is waited for. A target that another
+ * process is creating at that moment is left to it: the copy gives
+ * SR_E_TABLE_EXISTS, with or without `overwrite`. A target open in this
  * tree is read again from its new file: its handles see the new table and
  * their later changes go to the new file; it must have nothing pending or
  * applied (SR_E_UNCOMMITTED). A transient target open in this tree is
@@ -822,7 +824,10 @@ QV_SR_EXPORT int32_t sr_move_table_by_handle_1(sr_opaque_handle_t table_handle,
                                                const char *p_target_table_name, int32_t overwrite);
 
 /* As sr_move_table_by_handle_1, the source named by path, as for
- * sr_copy_table_by_name_1. */
+ * sr_copy_table_by_name_1. A table file no one has open here moves by one
+ * rename, waiting for a writer of it in another process; onto another file
+ * system, where no rename reaches, it is copied and its file then removed
+ * (a failure to remove it is returned, the table then at both paths). */
 QV_SR_EXPORT int32_t sr_move_table_by_name_1(sr_opaque_handle_t tree_handle,
                                              const char *p_source_table_name,
                                              const char *p_target_table_name, int32_t overwrite);

@@ -52,12 +52,6 @@ sr_i_table_t *open_table_at(const sr_i_tree_t *p_tree, const std::string &key) {
   return found != p_tree->tables.end() ? found->second : nullptr;
 }
 
-// A descriptor closed, and so its lock given up, when it goes.
-struct descriptor {
-  int fd = -1;
-  ~descriptor() { sr_i_close_file(fd); }
-};
-
 struct table_closer {
   sr_i_table_t *p_table;
   ~table_closer() { sr_i_close_table(p_table); }
@@ -91,26 +85,68 @@ int32_t copy_file_contents(const std::string &source_file, int fd, const std::st
   return rc;
 }
 
-// Writes the rewrite file of `target_file` through `write(fd, path)` and
-// flushes it. On failure the rewrite file is removed.
-template <typename Write>
-int32_t write_side_file(const std::string &target_file, Write &&write) {
-  const std::string rewrite_path = target_file + ".rewrite";
-  int fd = -1;
-  // Truncated: a crash may have left an older rewrite file behind.
-  int32_t rc = sr_i_open_file(rewrite_path.c_str(), O_RDWR | O_CREAT | O_TRUNC, &fd);
-  if (rc == 0) {
-    rc = write(fd, rewrite_path);
+// The rewrite file a copy writes its target into, locked from before its
+// first byte until it has the target's name, as a writer's rewrite file is.
+// Another process creating the target at this moment holds that lock while
+// it writes the table's first file: the copy finds the lock taken, or the
+// file gone to the target's name before it got the lock, and fails with
+// 201, the target being made. A file a crash left behind is taken over and
+// emptied. A file that is this copy's and was not renamed is removed.
+class side_file {
+ public:
+  explicit side_file(const std::string &target_file) : path_(target_file + ".rewrite") {}
+  side_file(const side_file &) = delete;
+  side_file &operator=(const side_file &) = delete;
+  ~side_file() {
+    if (owned_ && !renamed_) {
+      sr_i_discard_file(path_.c_str());
+    }
   }
-  if (rc == 0) {
-    rc = sr_i_flush_file(fd, rewrite_path.c_str());
+
+  // Opens, locks and empties the file. Returns 0, 201 or a failure of the
+  // calls, raised.
+  int32_t open() {
+    if (const int32_t rc = sr_i_open_file(path_.c_str(), O_RDWR | O_CREAT, &locked_.fd); rc != 0) {
+      return rc;
+    }
+    bool locked = false;
+    if (const int32_t rc = sr_i_try_lock_file(locked_.fd, &locked); rc != 0) {
+      return rc;
+    }
+    bool same = false;
+    if (locked) {
+      if (const int32_t rc = sr_i_is_same_file(locked_.fd, path_.c_str(), &same); rc != 0) {
+        return rc;
+      }
+    }
+    if (!same) {
+      return sr_i_raise(SR_E_TABLE_EXISTS);
+    }
+    owned_ = true;
+    return sr_i_truncate(locked_.fd, path_.c_str(), 0);
   }
-  sr_i_close_file(fd);
-  if (rc != 0) {
-    sr_i_discard_file(rewrite_path.c_str());
+
+  // Writes the file through `write(fd, path)` and flushes it.
+  template <typename Write>
+  int32_t write(Write &&write) {
+    if (const int32_t rc = write(locked_.fd, path_); rc != 0) {
+      return rc;
+    }
+    return sr_i_flush_file(locked_.fd, path_.c_str());
   }
-  return rc;
-}
+
+  const std::string &path() const { return path_; }
+  // The descriptor that holds the lock, for whoever takes it over.
+  sr_i_descriptor &locked() { return locked_; }
+  // The file has the target's name now: it is no longer removed.
+  void renamed() { renamed_ = true; }
+
+ private:
+  std::string path_;
+  sr_i_descriptor locked_;
+  bool owned_ = false;
+  bool renamed_ = false;
+};
 
 // The open mode that loads a table again as it is open now.
 int32_t open_mode_of(const sr_i_table_t *p_table) {
@@ -121,17 +157,20 @@ int32_t open_mode_of(const sr_i_table_t *p_table) {
 }
 
 // The table file `file` read into a new object opened as `p_like` is, with
-// a key hash table like its own, not in the tree.
+// a key hash table like its own, not in the tree. `locked` holds the lock
+// of `file`: a writable object takes that descriptor over, since one of its
+// own would wait for the lock for ever.
 int32_t open_like(sr_i_tree_t *p_tree, const sr_i_table_t *p_like, const std::string &file,
-                  sr_i_table_t **pp_fresh) {
+                  sr_i_descriptor &locked, sr_i_table_t **pp_fresh) {
   sr_hash_table_t *p_hash_table = nullptr;
   if (const int32_t rc = sr_i_hash_table_open_like(p_like->p_rows_hash_table, &p_hash_table);
       rc != 0) {
     return rc;
   }
+  const int32_t mode = open_mode_of(p_like);
+  const int handed_over = (mode & SR_MODE_WRITE) != 0 ? std::exchange(locked.fd, -1) : -1;
   return sr_i_open_persistent_table(p_tree, p_like->p_persistent_table_registry_path, file.c_str(),
-                                    open_mode_of(p_like), p_like->block_size, p_hash_table,
-                                    pp_fresh);
+                                    mode, p_like->block_size, p_hash_table, pp_fresh, handed_over);
 }
 
 // Gives an open persistent target the image of `p_fresh`, read from its new
@@ -337,6 +376,10 @@ class duplication {
     if (name == nullptr || registry_path == nullptr) {
       return sr_i_raise_no_memory();
     }
+    sr_i_named_table_place place;
+    if (const int32_t rc = sr_i_make_named_table_place(target_.key, place); rc != 0) {
+      return rc;
+    }
     sr_i_table_file_t &file = *p_source_->p_file;
     bool renamed = false;
     const int32_t rc = sr_i_rename_durably(file.path.c_str(), target_.key.c_str(), &renamed);
@@ -349,14 +392,14 @@ class duplication {
     std::free(std::exchange(p_source_->p_name, name.release()));
     std::free(std::exchange(p_source_->p_persistent_table_registry_path, registry_path.release()));
     source_done = true;
-    const int32_t entered = sr_i_enter_named_table(p_tree_, target_.key, p_source_);
-    return rc != 0 ? rc : entered;
+    sr_i_enter_table_at(p_tree_, std::move(place), p_source_);
+    return rc;
   }
 
   // Opens and locks the source file. A writer that committed by renaming a
   // new file over it meanwhile gave up the lock of the old one: the lock
   // is taken again on the file the name holds now.
-  int32_t lock_source_file(descriptor &source) const {
+  int32_t lock_source_file(sr_i_descriptor &source) const {
     for (;;) {
       if (const int32_t rc = sr_i_open_file(source_file_.c_str(), O_RDWR, &source.fd); rc != 0) {
         return rc;
@@ -377,53 +420,79 @@ class duplication {
   // file, or as a copy of it. A target open here gets `*pp_fresh`, its new
   // image, once the new file is in place.
   int32_t write_target_file(sr_i_table_t **pp_fresh) {
-    if (p_source_ == nullptr && remove_source_) {
-      // Between table files a move is one rename. A writer of the source in
-      // another process holds its file's lock while it has the table open:
-      // the move waits for it, so that no commit of that writer renames a
-      // new file onto the old name after the table has left it.
-      descriptor source;
-      if (const int32_t rc = lock_source_file(source); rc != 0) {
-        return rc;
-      }
-      bool renamed = false;
-      const int32_t rc = rename_into_place(source_file_, pp_fresh, &renamed);
-      if (!renamed) {
-        return rc;
-      }
-      sr_i_discard_file((source_file_ + ".rewrite").c_str());
-      // The source's name is gone from its directory too, if that is
-      // another one.
-      const std::string source_directory = directory_of(source_file_);
-      return rc != 0 || source_directory == directory_of(target_.key)
-                 ? rc
-                 : sr_i_flush_directory(source_directory.c_str());
+    if (p_source_ != nullptr || !remove_source_) {
+      return copy_into_place(pp_fresh);
     }
-    const int32_t rc = write_side_file(target_.key, [&](int fd, const std::string &path) {
-      return p_source_ != nullptr ? sr_i_write_table_file(p_source_, fd, path)
-                                  : copy_file_contents(source_file_, fd, path);
-    });
-    if (rc != 0) {
+    // Between table files a move is one rename. A writer of the source in
+    // another process holds its file's lock while it has the table open:
+    // the move waits for it, so that no commit of that writer renames a
+    // new file onto the old name after the table has left it.
+    sr_i_descriptor source;
+    if (const int32_t rc = lock_source_file(source); rc != 0) {
       return rc;
     }
-    const std::string rewrite_path = target_.key + ".rewrite";
-    bool renamed = false;
-    const int32_t renaming = rename_into_place(rewrite_path, pp_fresh, &renamed);
-    if (!renamed) {
-      sr_i_discard_file(rewrite_path.c_str());
+    bool same_file_system = false;
+    if (const int32_t rc = sr_i_is_on_file_system_of(source.fd, directory_of(target_.key).c_str(),
+                                                     &same_file_system);
+        rc != 0) {
+      return rc;
     }
-    return renaming;
+    if (!same_file_system) {
+      // No rename crosses file systems: the file is copied, and removed
+      // once the copy has the target's name, its lock held all the while.
+      // A failure to remove it leaves the table at both paths, and says so.
+      if (const int32_t rc = copy_into_place(pp_fresh); rc != 0) {
+        return rc;
+      }
+      return sr_i_remove_table_files(source_file_);
+    }
+    bool renamed = false;
+    const int32_t rc = rename_into_place(source_file_, source, pp_fresh, &renamed);
+    if (!renamed) {
+      return rc;
+    }
+    sr_i_discard_file((source_file_ + ".rewrite").c_str());
+    // The source's name is gone from its directory too, if that is
+    // another one.
+    const std::string source_directory = directory_of(source_file_);
+    return rc != 0 || source_directory == directory_of(target_.key)
+               ? rc
+               : sr_i_flush_directory(source_directory.c_str());
   }
 
-  // Renames the complete file `from` over the target and flushes the
-  // directory. A target open here first reads `from` into a fresh image,
-  // so that nothing is left to fail between the rename and the exchange of
-  // images; the image goes to `*pp_fresh` once the file has the target's
-  // name (`*p_renamed`), even if the flush of the directory failed.
-  int32_t rename_into_place(const std::string &from, sr_i_table_t **pp_fresh, bool *p_renamed) {
+  // Writes the new target file beside the target, from the source object
+  // or as a copy of the source file, and renames it into place.
+  int32_t copy_into_place(sr_i_table_t **pp_fresh) {
+    side_file side(target_.key);
+    if (const int32_t rc = side.open(); rc != 0) {
+      return rc;
+    }
+    if (const int32_t rc = side.write([&](int fd, const std::string &path) {
+          return p_source_ != nullptr ? sr_i_write_table_file(p_source_, fd, path)
+                                      : copy_file_contents(source_file_, fd, path);
+        });
+        rc != 0) {
+      return rc;
+    }
+    bool renamed = false;
+    const int32_t rc = rename_into_place(side.path(), side.locked(), pp_fresh, &renamed);
+    if (renamed) {
+      side.renamed();
+    }
+    return rc;
+  }
+
+  // Renames the complete file `from`, whose lock `locked` holds, over the
+  // target and flushes the directory. A target open here first reads `from`
+  // into a fresh image, so that nothing is left to fail between the rename
+  // and the exchange of images; the image goes to `*pp_fresh` once the file
+  // has the target's name (`*p_renamed`), even if the flush of the
+  // directory failed.
+  int32_t rename_into_place(const std::string &from, sr_i_descriptor &locked,
+                            sr_i_table_t **pp_fresh, bool *p_renamed) {
     sr_i_table_t *p_fresh = nullptr;
     if (p_open_target_ != nullptr) {
-      if (const int32_t rc = open_like(p_tree_, p_open_target_, from, &p_fresh); rc != 0) {
+      if (const int32_t rc = open_like(p_tree_, p_open_target_, from, locked, &p_fresh); rc != 0) {
         return rc;
       }
     }
@@ -440,6 +509,12 @@ class duplication {
   int32_t to_memory(bool &source_done) {
     if (p_open_target_ != nullptr && !overwrite_) {
       return sr_i_raise(SR_E_TABLE_EXISTS);
+    }
+    // The target's place is made first: a source object that moved there
+    // could not be freed under its handles if entering it failed.
+    sr_i_named_table_place place;
+    if (const int32_t rc = sr_i_make_named_table_place(target_.key, place); rc != 0) {
+      return rc;
     }
     sr_i_table_t *p_new = nullptr;
     // A source file that is gone although the flush of its directory
@@ -478,8 +553,8 @@ class duplication {
     if (p_open_target_ != nullptr) {
       sr_i_detach_table(p_tree_, p_open_target_);
     }
-    const int32_t rc = sr_i_enter_named_table(p_tree_, target_.key, p_new);
-    return rc != 0 ? rc : removal;
+    sr_i_enter_table_at(p_tree_, std::move(place), p_new);
+    return removal;
   }
 
   sr_i_tree_t *p_tree_;

@@ -293,6 +293,20 @@ int32_t sr_i_is_same_file(int fd, const char *p_path, bool *p_same) {
   return 0;
 }
 
+int32_t sr_i_is_on_file_system_of(int fd, const char *p_path, bool *p_same) {
+  struct stat opened {};
+  struct stat there {};
+  *p_same = false;
+  if (Sr_File_System.fstat(fd, &opened) != 0) {
+    return sr_i_raise_system_call("fstat", errno);
+  }
+  if (Sr_File_System.stat(p_path, &there) != 0) {
+    return sr_i_raise_system_call("stat", errno);
+  }
+  *p_same = opened.st_dev == there.st_dev;
+  return 0;
+}
+
 int32_t sr_i_rename_durably(const char *p_from, const char *p_to, bool *p_renamed) {
   const bool renamed = Sr_File_System.rename(p_from, p_to) == 0;
   if (p_renamed != nullptr) {

@@ -35,6 +35,17 @@ int32_t sr_i_open_file(const char *p_path, int flags, int *p_fd);
 /* Closes a descriptor; -1 is ignored. Closing ends the descriptor's lock. */
 void sr_i_close_file(int fd);
 
+/* A descriptor closed, and so its lock given up, when it goes; -1 holds
+ * none. Whoever takes the descriptor over exchanges `fd` for -1. */
+struct sr_i_descriptor {
+  int fd = -1;
+  sr_i_descriptor() = default;
+  explicit sr_i_descriptor(int owned_fd) : fd(owned_fd) {}
+  sr_i_descriptor(const sr_i_descriptor &) = delete;
+  sr_i_descriptor &operator=(const sr_i_descriptor &) = delete;
+  ~sr_i_descriptor() { sr_i_close_file(fd); }
+};
+
 /* Writes all `length` bytes of the file `p_path` open as `fd`, going on
  * after short writes. 0, 16 or 10. */
 int32_t sr_i_write(int fd, const char *p_path, const void *p_buffer, uint32_t length);
@@ -93,6 +104,10 @@ bool sr_i_path_is_free(const char *p_path);
 /* Whether `fd` is the file at `p_path` now (false when nothing is there
  * any more). 0 or 10. */
 int32_t sr_i_is_same_file(int fd, const char *p_path, bool *p_same);
+
+/* Whether the file open as `fd` lies on the file system that holds
+ * `p_path`, so that a rename can carry it there. 0 or 10. */
+int32_t sr_i_is_on_file_system_of(int fd, const char *p_path, bool *p_same);
 
 /*
  * Renames `p_from` onto `p_to` and flushes the directory of `p_to`, so that

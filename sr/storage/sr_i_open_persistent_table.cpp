@@ -59,10 +59,14 @@ struct table_closer {
   ~table_closer() { sr_i_close_table(p_table); }
 };
 
-// Opens (and for writing locks) the table file. A writer that waited for
-// the lock may find that the holder replaced the file (a rewrite renames a
-// new file over it) while it waited: it opens the new one.
+// Opens (and for writing locks) the table file, unless a descriptor that
+// holds the lock was handed over. A writer that waited for the lock may
+// find that the holder replaced the file (a rewrite renames a new file over
+// it) while it waited: it opens the new one.
 int32_t open_table_file(sr_i_table_file_t &file, bool writable) {
+  if (file.fd >= 0) {
+    return 0;
+  }
   for (;;) {
     if (const int32_t rc =
             sr_i_open_file(file.path.c_str(), writable ? O_RDWR : O_RDONLY, &file.fd);
@@ -390,7 +394,9 @@ int32_t load(sr_i_table_t *p_table, bool writable) {
 
 int32_t sr_i_open_persistent_table(sr_i_tree_t *p_tree, const char *p_registry_path,
                                    const char *p_file_path, int32_t mode, uint32_t block_size,
-                                   sr_hash_table_t *p_rows_hash_table, sr_i_table_t **pp_table) {
+                                   sr_hash_table_t *p_rows_hash_table, sr_i_table_t **pp_table,
+                                   int locked_fd) {
+  sr_i_descriptor handed_over(locked_fd);
   if (p_file_path == nullptr) {
     sr_i_hash_table_close(p_rows_hash_table);
     return sr_i_raise(SR_E_NULL_POINTER);
@@ -412,6 +418,9 @@ int32_t sr_i_open_persistent_table(sr_i_tree_t *p_tree, const char *p_registry_p
   }
   if (const int32_t rc = sr_i_attach_table_file(p_table, p_file_path, p_registry_path); rc != 0) {
     return rc;
+  }
+  if (writable) {
+    p_table->p_file->fd = std::exchange(handed_over.fd, -1);
   }
   if (const int32_t rc = load(p_table, writable); rc != 0) {
     return rc;

@@ -67,12 +67,17 @@ int32_t sr_i_create_persistent_table(struct sr_i_tree_struct_t *p_tree, const ch
  * `mode` is a normalised open mode (SR_MODE_WRITE: writable, which locks
  * the file, waiting for another writer to close it; SR_MODE_EXPLICIT_CONTROL:
  * explicit control).
- * `p_rows_hash_table` (or null) is taken over whatever the outcome.
+ * `p_rows_hash_table` (or null) is taken over whatever the outcome, and so
+ * is `locked_fd`: a descriptor of the file open for reading and writing
+ * that already holds its lock, which a writable table then uses instead of
+ * opening and locking the file itself (a second descriptor of this process
+ * would wait for that lock for ever).
  * Returns 0 or a raised code: 10, 12, 14, 16, 101, 200, 206, 213, 214, 215.
  */
 int32_t sr_i_open_persistent_table(struct sr_i_tree_struct_t *p_tree, const char *p_registry_path,
                                    const char *p_file_path, int32_t mode, uint32_t block_size,
-                                   sr_hash_table_t *p_rows_hash_table, sr_i_table_t **pp_table);
+                                   sr_hash_table_t *p_rows_hash_table, sr_i_table_t **pp_table,
+                                   int locked_fd = -1);
 
 /*
  * Whether an apply should write the live rows into a new file instead of

@@ -810,10 +810,11 @@ class NamespaceFaults : public FaultInjection {
   }
 
   // The code a failed call of a copy, move or deletion gives: a full
-  // filesystem for a call that makes, writes, renames or removes a file.
+  // filesystem for a call that makes, writes, cuts, renames or removes a
+  // file.
   static int32_t failure_code(call_kind kind, int error) {
     const bool writes = kind == Open || kind == Rename || kind == Write || kind == Writev ||
-                        kind == Fsync || kind == Unlink;
+                        kind == Ftruncate || kind == Fsync || kind == Unlink;
     return writes && error == ENOSPC ? SR_E_FILESYSTEM_FULL : SR_E_SYSTEM_CALL;
   }
 

@@ -2,6 +2,7 @@
 // between memory and disk: what reaches the target, what is left of the
 // source, what becomes of handles on either, and what is refused.
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -227,6 +228,93 @@ TEST_F(Namespace, AnOpenPersistentTargetIsRefreshedAndItsChangesReachTheNewFile)
   EXPECT_EQ(rows_in<std::string>(transient, "name", 0), (rows_t{{"mine", 1}}));
   EXPECT_EQ(rows_here("/m/t"), Rows);
   EXPECT_EQ(sr_close_table_1(transient), 0);
+}
+
+// A target open here for writing holds its file's lock: every way onto it
+// must hand that lock over rather than wait for it, and leave the handle
+// writing into the new file.
+TEST_F(Namespace, EveryWayOntoATargetOpenForWritingRefreshesItsHandle) {
+  sr_opaque_handle_t memory = filled("/m/a");
+  ASSERT_EQ(sr_close_table_1(filled("/disk/a")), 0);
+  sr_opaque_handle_t target = create_named_counts("/disk/t", Explicit);
+  const auto expect_target_written_on = [&](const char *p_way, const char *p_row) {
+    SCOPED_TRACE(p_way);
+    EXPECT_EQ(rows_in<std::string>(target, "name", 0), Rows);
+    ASSERT_EQ(add_named(target, p_row, 10), 0);
+    apply_commit(target);
+    rows_t expected = Rows;
+    expected[p_row] = 10;
+    EXPECT_EQ(rows_elsewhere("/disk/t"), expected);
+    EXPECT_FALSE(exists("t.rewrite"));
+  };
+  ASSERT_EQ(sr_copy_table_by_handle_1(memory, "/disk/t", 1), 0);
+  expect_target_written_on("copy by handle", "x");
+  ASSERT_EQ(sr_copy_table_by_name_1(tree_, "/disk/a", "/disk/t", 1), 0);
+  expect_target_written_on("copy by name", "y");
+  ASSERT_EQ(sr_move_table_by_name_1(tree_, "/disk/a", "/disk/t", 1), 0);
+  EXPECT_FALSE(exists("a"));
+  expect_target_written_on("move by name", "z");
+  EXPECT_EQ(sr_close_table_1(target), 0);
+}
+
+// Another process creating a table writes its first file as "<file>.rewrite"
+// under that file's lock. A copy onto the same path meanwhile must neither
+// write into that file nor remove it: it is refused as onto a table that
+// exists. A side file nobody holds is a crash's leftover, taken over.
+TEST_F(Namespace, ACopyLeavesASideFileBeingWrittenByACreatorAlone) {
+  sr_opaque_handle_t source = filled("/m/a");
+  const std::string side = file("t.rewrite");
+  const std::string creators_bytes(100000, 'c');
+  write_file(side, creators_bytes);
+  const int creator = ::open(side.c_str(), O_RDWR | O_CLOEXEC);
+  ASSERT_GE(creator, 0);
+  struct flock whole {};
+  whole.l_type = F_WRLCK;
+  whole.l_whence = SEEK_SET;
+  ASSERT_EQ(::fcntl(creator, F_OFD_SETLK, &whole), 0);
+  for (const int overwrite : {0, 1}) {
+    EXPECT_EQ(sr_copy_table_by_handle_1(source, "/disk/t", overwrite), SR_E_TABLE_EXISTS);
+    EXPECT_EQ(sr_move_table_by_handle_1(source, "/disk/t", overwrite), SR_E_TABLE_EXISTS);
+  }
+  EXPECT_EQ(file_bytes(side), creators_bytes);
+  EXPECT_FALSE(exists("t"));
+  EXPECT_EQ(rows_here("/m/a"), Rows);
+  // The creator is gone and left its file: the copy empties it first.
+  ASSERT_EQ(::close(creator), 0);
+  ASSERT_EQ(sr_copy_table_by_handle_1(source, "/disk/t", 0), 0);
+  EXPECT_EQ(rows_elsewhere("/disk/t"), Rows);
+  EXPECT_LT(std::filesystem::file_size(file("t")), creators_bytes.size());
+  EXPECT_FALSE(exists("t.rewrite"));
+}
+
+// A move by name to a mount point on another file system cannot rename:
+// the table is copied there and its file removed, and nothing is left
+// beside either.
+TEST_F(Namespace, AMoveByNameCrossesFileSystems) {
+  const std::string other = new_directory("qv_other", false);
+  struct stat here {
+  }, there{};
+  ASSERT_EQ(::stat(directory_.c_str(), &here), 0);
+  ASSERT_EQ(::stat(other.c_str(), &there), 0);
+  if (here.st_dev == there.st_dev) {
+    std::filesystem::remove_all(other);
+    GTEST_SKIP() << "/tmp and /dev/shm are one file system here";
+  }
+  ASSERT_EQ(sr_mount_local_tree_1(tree_, "/shm", other.c_str(), 0), 0);
+  ASSERT_EQ(sr_close_table_1(filled("/disk/a")), 0);
+  ASSERT_EQ(sr_move_table_by_name_1(tree_, "/disk/a", "/shm/a", 0), 0);
+  EXPECT_EQ(rows_here("/shm/a"), Rows);
+  EXPECT_FALSE(exists("a"));
+  // And back, onto a table open here for writing.
+  sr_opaque_handle_t target = create_named_counts("/disk/b", Explicit);
+  ASSERT_EQ(sr_move_table_by_name_1(tree_, "/shm/a", "/disk/b", 1), 0);
+  EXPECT_EQ(rows_in<std::string>(target, "name", 0), Rows);
+  EXPECT_EQ(rows_elsewhere("/disk/b"), Rows);
+  EXPECT_EQ(sr_close_table_1(target), 0);
+  EXPECT_FALSE(std::filesystem::exists(other + "/a"));
+  EXPECT_FALSE(std::filesystem::exists(other + "/a.rewrite"));
+  EXPECT_FALSE(exists("b.rewrite"));
+  std::filesystem::remove_all(other);
 }
 
 TEST_F(Namespace, DeletingFreesThePathAndHandlesKeepWorking) {

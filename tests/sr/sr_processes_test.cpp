@@ -384,6 +384,57 @@ std::map<int32_t, int32_t> copied_rows(int number, int round) {
   return rows;
 }
 
+// A creator writes the new table's first file as the side file, under its
+// lock, before it renames it into place; a copy onto the same new path
+// writes that side file too. Of a creator and a copier started together
+// exactly one makes the table, the other is told it exists, and the table
+// is the whole of what the winner wrote.
+TEST_F(Processes, OfACreatorAndACopierOntoOneNewPathOneWinsAndTheTableIsWhole) {
+  constexpr int Rounds = 20;
+  constexpr uint32_t Payload_Spread = 8;
+  int creations = 0;
+  for (int round = 0; round < Rounds; ++round) {
+    std::filesystem::remove(directory_ + "/" + Table_File);
+    const auto outcome = [](int32_t rc) { return rc == 0 ? 0 : rc == SR_E_TABLE_EXISTS ? 1 : 2; };
+    const pid_t creator = start_process([&] {
+      sr_opaque_handle_t tree = mounted_tree(), table = nullptr;
+      const int32_t rc = sr_versioned::create_table(tree, Table_Path, 0, &table);
+      return sr_close_tree_1(tree) == 0 ? outcome(rc) : 3;
+    });
+    const pid_t copier = start_process([&] {
+      sr_opaque_handle_t tree = mounted_tree(), table = nullptr;
+      if (sr_versioned::create_table(tree, "/m/source", 4, &table) != 0) {
+        return 3;
+      }
+      for (const auto &[id, version] : copied_rows(1, round)) {
+        if (add_row(table, id, version, Payload_Spread) != 0) {
+          return 4;
+        }
+      }
+      if (sr_apply_1(table, 0) != 0 || sr_commit_1(table) != 0) {
+        return 5;
+      }
+      const int32_t rc = sr_copy_table_by_handle_1(table, Table_Path, 0);
+      return sr_close_tree_1(tree) == 0 ? outcome(rc) : 6;
+    });
+    const int created = finish(creator), copied = finish(copier);
+    const int results = created * 10 + copied;
+    ASSERT_TRUE(results == 1 || results == 10)
+        << "round " << round << ": creator " << created << ", copier " << copied;
+    table_state state;
+    ASSERT_EQ(read_table(state, Payload_Spread), "") << "round " << round;
+    if (results == 1) {
+      ++creations;
+      EXPECT_TRUE(state.rows.empty()) << "round " << round << ": " << describe(state);
+    } else {
+      EXPECT_TRUE(state.rows == copied_rows(1, round))
+          << "round " << round << ": " << describe(state);
+    }
+    EXPECT_FALSE(std::filesystem::exists(directory_ + "/" + Table_File + ".rewrite"));
+  }
+  std::cout << "[ creator ] won " << creations << " of " << Rounds << " rounds\n";
+}
+
 // Two processes copy tables of their own onto one table file again and
 // again while this one reads it. Each copy writes the side file beside the
 // target and renames it: without the ",Lock" file the two would write into

@@ -3,6 +3,8 @@
 // detached: its path is free at once for a new table.
 
 #include <algorithm>
+#include <new>
+#include <utility>
 
 #include "frame/sr_i_errors.h"
 #include "frame/sr_i_paths.h"
@@ -15,14 +17,35 @@ void sr_i_take_out_of_tree(sr_i_tree_t *p_tree, sr_i_table_t *p_table) {
   }
 }
 
-void sr_i_detach_table(sr_i_tree_t *p_tree, sr_i_table_t *p_table) {
+int32_t sr_i_detach_table(sr_i_tree_t *p_tree, sr_i_table_t *p_table) {
+  sr_i_detached_place place;
+  if (const int32_t rc = sr_i_make_detached_place(p_table, place); rc != 0) {
+    return rc;
+  }
+  sr_i_detach_table_at(p_tree, p_table, std::move(place));
+  return 0;
+}
+
+int32_t sr_i_make_detached_place(sr_i_table_t *p_table, sr_i_detached_place &place) {
+  // The node is made in a set of its own and taken out of it: the tree's
+  // set then only links it in, which allocates nothing.
+  try {
+    decltype(sr_i_tree_t::detached_tables) maker;
+    place = maker.extract(maker.insert(p_table).first);
+  } catch (const std::bad_alloc &) {
+    return sr_i_raise_no_memory();
+  }
+  return 0;
+}
+
+void sr_i_detach_table_at(sr_i_tree_t *p_tree, sr_i_table_t *p_table, sr_i_detached_place place) {
   sr_i_take_out_of_tree(p_tree, p_table);
   // An unnamed table is freed by its last close whatever its count says;
   // a named one held by handles is the tree's to free if they never are.
   if (p_table->references == 0) {
     sr_i_close_table(p_table);
   } else if (p_table->p_name != nullptr) {
-    p_tree->detached_tables.insert(p_table);
+    p_tree->detached_tables.insert(std::move(place));
   }
 }
 
@@ -39,7 +62,9 @@ int32_t sr_i_delete_table(sr_i_tree_t *p_tree, const char *p_registry_path) {
   const auto found = p_tree->tables.find(key);
   const bool was_open = found != p_tree->tables.end();
   if (was_open) {
-    sr_i_detach_table(p_tree, found->second);
+    if (const int32_t rc = sr_i_detach_table(p_tree, found->second); rc != 0) {
+      return rc;
+    }
   }
   if (block_size == 0) {
     return was_open ? 0 : sr_i_raise(SR_E_NO_TABLE);
@@ -49,10 +74,12 @@ int32_t sr_i_delete_table(sr_i_tree_t *p_tree, const char *p_registry_path) {
 }
 
 int32_t sr_i_remove_table_files(const std::string &file, bool *p_removed) {
+  // Named first: once the table file is gone, nothing may fail.
+  const std::string side_file = file + ".rewrite";
   bool removed = false;
   const int32_t rc = sr_i_remove_file_durably(file.c_str(), &removed);
   if (removed) {
-    sr_i_discard_file((file + ".rewrite").c_str());
+    sr_i_discard_file(side_file.c_str());
   }
   if (p_removed != nullptr) {
     *p_removed = removed;

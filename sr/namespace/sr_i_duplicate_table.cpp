@@ -296,11 +296,12 @@ class duplication {
       }
     }
     if (rc == 0 && remove_source_ && !source_done && p_source_ != nullptr) {
-      // The target is complete: a failure to remove the source leaves both.
+      // The target is complete: a failure to remove the source leaves both
+      // (only a want of memory is reported: the source's file is gone).
       if (p_source_->p_file != nullptr) {
         sr_i_remove_table_files(p_source_->p_file->path);
       }
-      sr_i_detach_table(p_tree_, p_source_);
+      rc = sr_i_detach_table(p_tree_, p_source_);
     }
     return rc;
   }
@@ -446,18 +447,20 @@ class duplication {
       }
       return sr_i_remove_table_files(source_file_);
     }
+    // Everything named before the rename, which nothing may follow that
+    // could fail for want of memory.
+    const std::string source_side_file = source_file_ + ".rewrite";
+    const std::string source_directory = directory_of(source_file_);
+    const bool other_directory = source_directory != directory_of(target_.key);
     bool renamed = false;
     const int32_t rc = rename_into_place(source_file_, source, pp_fresh, &renamed);
     if (!renamed) {
       return rc;
     }
-    sr_i_discard_file((source_file_ + ".rewrite").c_str());
+    sr_i_discard_file(source_side_file.c_str());
     // The source's name is gone from its directory too, if that is
     // another one.
-    const std::string source_directory = directory_of(source_file_);
-    return rc != 0 || source_directory == directory_of(target_.key)
-               ? rc
-               : sr_i_flush_directory(source_directory.c_str());
+    return rc != 0 || !other_directory ? rc : sr_i_flush_directory(source_directory.c_str());
   }
 
   // Writes the new target file beside the target, from the source object
@@ -497,10 +500,12 @@ class duplication {
       }
     }
     table_closer closer{p_fresh};
+    std::string path = target_.key;
+    std::string rewrite_path = target_.key + ".rewrite";
     const int32_t rc = sr_i_rename_durably(from.c_str(), target_.key.c_str(), p_renamed);
     if (*p_renamed && p_fresh != nullptr) {
-      p_fresh->p_file->path = target_.key;
-      p_fresh->p_file->rewrite_path = target_.key + ".rewrite";
+      p_fresh->p_file->path = std::move(path);
+      p_fresh->p_file->rewrite_path = std::move(rewrite_path);
       *pp_fresh = closer.release();
     }
     return rc;
@@ -510,11 +515,19 @@ class duplication {
     if (p_open_target_ != nullptr && !overwrite_) {
       return sr_i_raise(SR_E_TABLE_EXISTS);
     }
-    // The target's place is made first: a source object that moved there
-    // could not be freed under its handles if entering it failed.
+    // Everything that takes memory is made first: the places of the target
+    // and of an open target it replaces, and the moved object's new name.
+    // Once a source file is gone or an object has left its old name, there
+    // is no way back, and an object could not be freed under its handles.
     sr_i_named_table_place place;
     if (const int32_t rc = sr_i_make_named_table_place(target_.key, place); rc != 0) {
       return rc;
+    }
+    sr_i_detached_place replaced_place;
+    if (p_open_target_ != nullptr) {
+      if (const int32_t rc = sr_i_make_detached_place(p_open_target_, replaced_place); rc != 0) {
+        return rc;
+      }
     }
     sr_i_table_t *p_new = nullptr;
     // A source file that is gone although the flush of its directory
@@ -523,13 +536,15 @@ class duplication {
     int32_t removal = 0;
     bool removed = false;
     if (p_source_ != nullptr && remove_source_) {
+      std::unique_ptr<char, decltype(&std::free)> name(strdup(target_.key.c_str()), &std::free);
+      if (name == nullptr) {
+        return sr_i_raise_no_memory();
+      }
       if (p_source_->p_file != nullptr &&
           (removal = sr_i_remove_table_files(p_source_->p_file->path, &removed)) != 0 && !removed) {
         return removal;
       }
-      if (const int32_t rc = rename_object(p_source_, target_.key); rc != 0) {
-        return rc;
-      }
+      std::free(std::exchange(p_source_->p_name, name.release()));
       // Out of the tree under its old name, in again under the new one.
       sr_i_take_out_of_tree(p_tree_, p_source_);
       forget_file(p_source_);
@@ -551,7 +566,7 @@ class duplication {
       }
     }
     if (p_open_target_ != nullptr) {
-      sr_i_detach_table(p_tree_, p_open_target_);
+      sr_i_detach_table_at(p_tree_, p_open_target_, std::move(replaced_place));
     }
     sr_i_enter_table_at(p_tree_, std::move(place), p_new);
     return removal;

@@ -76,9 +76,21 @@ void sr_i_take_out_of_tree(sr_i_tree_t *p_tree, sr_i_table_t *p_table);
 /*
  * Takes an open table out of its tree and frees it when no handle holds
  * it; otherwise it lives on, detached, until its last handle is closed.
- * The caller holds the tree's write lock.
+ * The caller holds the tree's write lock. Returns 0, or 12 (raised) with
+ * the table where it was.
  */
-void sr_i_detach_table(sr_i_tree_t *p_tree, sr_i_table_t *p_table);
+int32_t sr_i_detach_table(sr_i_tree_t *p_tree, sr_i_table_t *p_table);
+
+/* A place among a tree's detached tables, made before the table is
+ * detached so that detaching it cannot fail: what a step needs that
+ * detaches a table after something it cannot take back. */
+using sr_i_detached_place = decltype(sr_i_tree_t::detached_tables)::node_type;
+
+/* Makes the place for `p_table`. Returns 0 or 12 (raised). */
+int32_t sr_i_make_detached_place(sr_i_table_t *p_table, sr_i_detached_place &place);
+
+/* sr_i_detach_table at a place made for the table. */
+void sr_i_detach_table_at(sr_i_tree_t *p_tree, sr_i_table_t *p_table, sr_i_detached_place place);
 
 /* Removes a table file from the disk durably, then its side file. 0, 200,
  * 206, 16 or 10 (raised); `*p_removed` (if given) says whether the file is

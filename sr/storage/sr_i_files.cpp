@@ -307,7 +307,11 @@ int32_t sr_i_is_on_file_system_of(int fd, const char *p_path, bool *p_same) {
   return 0;
 }
 
+// The durable renames and removals name the directory to flush before they
+// change it: once a file has its new name or is gone, the caller must learn
+// that it is, and nothing left may fail for want of memory.
 int32_t sr_i_rename_durably(const char *p_from, const char *p_to, bool *p_renamed) {
+  const std::string directory = directory_of(p_to);
   const bool renamed = Sr_File_System.rename(p_from, p_to) == 0;
   if (p_renamed != nullptr) {
     *p_renamed = renamed;
@@ -315,10 +319,11 @@ int32_t sr_i_rename_durably(const char *p_from, const char *p_to, bool *p_rename
   if (!renamed) {
     return errno == ENOENT ? sr_i_raise(SR_E_NO_TABLE) : raise_failure("rename", errno, p_to);
   }
-  return sr_i_flush_directory(directory_of(p_to).c_str());
+  return sr_i_flush_directory(directory.c_str());
 }
 
 int32_t sr_i_remove_file_durably(const char *p_path, bool *p_removed) {
+  const std::string directory = directory_of(p_path);
   const bool removed = Sr_File_System.unlink(p_path) == 0;
   if (p_removed != nullptr) {
     *p_removed = removed;
@@ -326,7 +331,7 @@ int32_t sr_i_remove_file_durably(const char *p_path, bool *p_removed) {
   if (!removed) {
     return errno == ENOENT ? sr_i_raise(SR_E_NO_TABLE) : raise_failure("unlink", errno, p_path);
   }
-  return sr_i_flush_directory(directory_of(p_path).c_str());
+  return sr_i_flush_directory(directory.c_str());
 }
 
 int32_t sr_i_flush_directory(const char *p_directory) {

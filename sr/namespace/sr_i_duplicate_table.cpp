@@ -559,11 +559,12 @@ class duplication {
           rc != 0) {
         return rc;
       }
+      table_closer loaded{p_new};
       if (remove_source_ && (removal = sr_i_remove_table_files(source_file_, &removed)) != 0 &&
           !removed) {
-        sr_i_close_table(p_new);
         return removal;
       }
+      loaded.release();
     }
     if (p_open_target_ != nullptr) {
       sr_i_detach_table_at(p_tree_, p_open_target_, std::move(replaced_place));

@@ -350,13 +350,15 @@ int32_t sr_i_compile_expression(const char *p_selection_criteria, sr_i_table_t *
   if (const int32_t rc =
           cu_iconv_str_1(p_string_conversion_handle, p_selection_criteria, &p_converted);
       rc != 0) {
-    return sr_i_raise_library_call("cu_iconv_str", rc);
+    return rc == CU_RESULT_NO_MEMORY ? sr_i_raise_no_memory()
+                                     : sr_i_raise_library_call("cu_iconv_str", rc);
   }
   const int32_t rc =
       cu_comp_expr_1(p_converted, 0, sr_i_validate_column_callback, p_table, p_compiled_expression);
   std::free(p_converted);
   if (rc != 0) {
-    return sr_i_raise_library_call("cu_comp_expr", rc);
+    return rc == CU_RESULT_NO_MEMORY ? sr_i_raise_no_memory()
+                                     : sr_i_raise_library_call("cu_comp_expr", rc);
   }
   return 0;
 }

@@ -41,7 +41,7 @@ int32_t sr_i_expand_criteria(const char *p_selection_criteria, va_list ap,
  * tables' code set with `p_string_conversion_handle` first; without a handle
  * the call fails with 15. Returns 0 with the expression in
  * `*p_compiled_expression` (freed with cu_free_expr_1(expression, 0)), or
- * 15, or 11 naming "cu_iconv_str" or "cu_comp_expr", raised.
+ * 15, 12, or 11 naming "cu_iconv_str" or "cu_comp_expr", raised.
  */
 int32_t sr_i_compile_expression(const char *p_selection_criteria, sr_i_table_t *p_table,
                                 cu_expression_t **p_compiled_expression,

@@ -33,6 +33,19 @@ bool this_allocation_fails() {
   return false;
 }
 
+// The test's own allocations while a failure waits: made as if none could
+// fail, and the count left as it was.
+class test_allocations {
+ public:
+  test_allocations() : left_(Allocations_Before_Failure.exchange(0)) {}
+  ~test_allocations() { Allocations_Before_Failure = left_; }
+  test_allocations(const test_allocations &) = delete;
+  test_allocations &operator=(const test_allocations &) = delete;
+
+ private:
+  long left_;
+};
+
 void *allocate(std::size_t size, std::size_t alignment) {
   if (this_allocation_fails()) {
     return nullptr;
@@ -234,6 +247,107 @@ TEST_F(AllocationFailure, EveryFailedAllocationOfACopyOrMoveLeavesBothTablesAsTh
       }
     }
     EXPECT_TRUE(succeeded) << "the call never got through";
+  }
+  std::printf("[ injected ] %d failed allocations\n", failures);
+}
+
+// One change of a persistent table with committed Rows, open for explicit
+// control: what is made pending or applied first, the change itself, and
+// the rows the file holds once the change is applied and committed.
+struct change_t {
+  const char *p_name;
+  enum { Nothing, Added, Applied } before;
+  int32_t (*change)(sr_opaque_handle_t table);
+  rows_t committed;
+};
+
+// The row "d" with count 4, added without an allocation of the test's.
+int32_t add_d(sr_opaque_handle_t table) {
+  const char *names[] = {"name", "count"};
+  qv_value_t name = string_value("d");
+  qv_value_t count = int32_value(4);
+  qv_value_t *values[] = {&name, &count};
+  return sr_add_row_1(table, names, values, 2);
+}
+
+const change_t Changes[] = {
+    {"add a row", change_t::Nothing, add_d, {{"a", 1}, {"b", 2}, {"c", 3}, {"d", 4}}},
+    {"set a field",
+     change_t::Nothing,
+     [](sr_opaque_handle_t table) {
+       const qv_value_t count = int32_value(20);
+       return sr_set_field_by_key_1(table, string_value("b"), "count", &count);
+     },
+     {{"a", 1}, {"b", 20}, {"c", 3}}},
+    {"delete rows",
+     change_t::Nothing,
+     [](sr_opaque_handle_t table) { return sr_delete_rows_1(table, "count > $i", 2); },
+     {{"a", 1}, {"b", 2}}},
+    {"apply",
+     change_t::Added,
+     [](sr_opaque_handle_t table) { return sr_apply_1(table, 0); },
+     {{"a", 1}, {"b", 2}, {"c", 3}, {"d", 4}}},
+    {"commit", change_t::Applied, sr_commit_1, {{"a", 1}, {"b", 2}, {"c", 3}, {"d", 4}}},
+    {"select", change_t::Nothing,
+     [](sr_opaque_handle_t table) {
+       sr_opaque_handle_t result = nullptr;
+       const int32_t rc = sr_select_1(table, nullptr, 0, &result, "count > $i", 1);
+       if (rc != 0) {
+         return rc;
+       }
+       {
+         test_allocations checking;
+         EXPECT_EQ(rows_in<std::string>(result, "name", 0), (rows_t{{"b", 2}, {"c", 3}}));
+       }
+       return sr_close_table_1(result);
+     },
+     Rows},
+};
+
+// Each allocation of each change fails in turn. A change that fails for
+// want of memory leaves the table as it was, so that the same change tried
+// again succeeds, and the file ends up with the change made once.
+TEST_F(AllocationFailure, EveryFailedAllocationOfAChangeLeavesTheTableToTryAgain) {
+  int failures = 0;
+  for (const change_t &change : Changes) {
+    SCOPED_TRACE(change.p_name);
+    bool succeeded = false;
+    for (long nth = 1; !succeeded && nth < 10000; ++nth) {
+      SCOPED_TRACE("allocation " + std::to_string(nth) + " fails");
+      sr_delete_table_1(tree_, "/disk/c");
+      sr_opaque_handle_t table = create_named_counts("/disk/c", Explicit);
+      ASSERT_NE(table, nullptr);
+      for (const auto &[name, count] : Rows) {
+        ASSERT_EQ(add_named(table, name.c_str(), count), 0);
+      }
+      apply_commit(table);
+      if (change.before != change_t::Nothing) {
+        ASSERT_EQ(add_d(table), 0);
+      }
+      if (change.before == change_t::Applied) {
+        ASSERT_EQ(sr_apply_1(table, 0), 0);
+      }
+      Allocations_Before_Failure = nth;
+      const int32_t rc = change.change(table);
+      succeeded = Allocations_Before_Failure.exchange(0) != 0;
+      if (rc != 0) {
+        ++failures;
+        ASSERT_EQ(rc, SR_E_NO_MEMORY);
+        ASSERT_EQ(change.change(table), 0) << "the change cannot be tried again";
+      }
+      // The change made, it is applied (unless that was the change or came
+      // before it) and committed.
+      if (change.before == change_t::Nothing) {
+        ASSERT_EQ(sr_apply_1(table, 0), 0);
+      }
+      if (change.change != sr_commit_1) {
+        ASSERT_EQ(sr_commit_1(table), 0);
+      }
+      EXPECT_EQ(rows_in<std::string>(table, "name", 0), change.committed);
+      ASSERT_EQ(sr_close_table_1(table), 0);
+      EXPECT_EQ(rows_at("/disk/c"), change.committed);
+    }
+    EXPECT_TRUE(succeeded) << "the change never got through";
   }
   std::printf("[ injected ] %d failed allocations\n", failures);
 }

@@ -1094,9 +1094,10 @@ QV_SR_EXPORT int32_t sr_i_dump_tree(sr_opaque_handle_t tree_handle);
  * Removes the side files ("<table file>.rewrite") that a crash during an
  * apply or a creation may have left beside the persistent tables named by
  * the `total_paths` registry paths; transient paths are skipped and a
- * missing side file is not an error. Table files are never touched. Meant
- * for a time when no other process uses the tables; it also works in a
- * forked child. Returns 0 (also for a count of 0, whatever the array);
+ * missing side file is not an error. Table files are never touched, nor
+ * a side file whose lock a live writer holds (an apply, creation or copy
+ * under way, in this process or another). It also works in a forked
+ * child. Returns 0 (also for a count of 0, whatever the array);
  * SR_E_INVALID_HANDLE; SR_E_NULL_POINTER for a null array; SR_E_INVALID_PATH
  * for a path that cannot be resolved (the paths before it were handled).
  */

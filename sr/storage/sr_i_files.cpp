@@ -355,6 +355,24 @@ void sr_i_discard_file(const char *p_path) {
   Sr_File_System.unlink(p_path);
 }
 
+void sr_i_discard_abandoned_file(const char *p_path) {
+  const int fd = open_retrying(p_path, O_RDWR, 0);
+  if (fd < 0) {
+    return;
+  }
+  // The lock is only had when no descriptor anywhere holds it; the name
+  // is checked again under it, since the writer may have renamed the file
+  // away just before.
+  struct stat opened {};
+  struct stat named {};
+  if (lock_whole_file(fd, F_OFD_SETLK) == 0 && Sr_File_System.fstat(fd, &opened) == 0 &&
+      Sr_File_System.stat(p_path, &named) == 0 && opened.st_dev == named.st_dev &&
+      opened.st_ino == named.st_ino) {
+    Sr_File_System.unlink(p_path);
+  }
+  sr_i_close_file(fd);
+}
+
 sr_i_directory_reader::~sr_i_directory_reader() {
   if (p_directory_ != nullptr) {
     // Nothing was written through it: a failing close loses nothing.

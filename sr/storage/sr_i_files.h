@@ -138,6 +138,11 @@ int32_t sr_i_make_directory(const char *p_path);
  * well not exist. */
 void sr_i_discard_file(const char *p_path);
 
+/* Removes the side file `p_path` only when nobody holds its lock: a file
+ * left by a writer that is gone, not one a live writer (in this process or
+ * another) is still writing. Raises nothing. */
+void sr_i_discard_abandoned_file(const char *p_path);
+
 /*
  * The names in a directory, in the order the directory gives them, "." and
  * ".." included; the directory is closed with the object, whatever path

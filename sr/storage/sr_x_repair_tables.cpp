@@ -3,8 +3,10 @@
 // tables. The table files themselves are never touched: their readers
 // already ignore whatever an uncommitted apply wrote.
 //
-// Repair runs in a forked child too (it takes neither the fork guard nor
-// ForkMutex); it is meant for a time when no other process uses the tables.
+// A side file whose lock is held is being written by a live apply,
+// creation or copy, here or in another process, and is left alone. Repair
+// runs in a forked child too (it takes neither the fork guard nor
+// ForkMutex).
 
 #include <string>
 
@@ -43,7 +45,7 @@ extern "C" int32_t sr_repair_tables_1(sr_opaque_handle_t tree_handle,
       }
       if (block_size != 0) {
         // A missing rewrite file is the normal case.
-        sr_i_discard_file((file_path + ".rewrite").c_str());
+        sr_i_discard_abandoned_file((file_path + ".rewrite").c_str());
       }
     }
     return 0;

@@ -175,7 +175,7 @@ TEST_F(Persistent, DamagedFilesAreRefusedWithACode) {
   EXPECT_EQ(count_of(opened, "b", 0), 2);
 }
 
-TEST_F(Persistent, RepairRemovesLeftoverRewriteFilesOnly) {
+TEST_F(Persistent, RepairRemovesLeftoverRewriteFilesOnlyWhenNoWriterHoldsThem) {
   ASSERT_EQ(sr_close_table_1(create_named_counts("/disk/t", Implicit)), 0);
   const auto table_file = file_bytes(path("t"));
   write_file(path("t.rewrite"), "\1\2\3");
@@ -184,6 +184,19 @@ TEST_F(Persistent, RepairRemovesLeftoverRewriteFilesOnly) {
   EXPECT_EQ(sr_repair_tables_1(tree_, paths, 3), 0);
   EXPECT_FALSE(std::filesystem::exists(path("t.rewrite")));
   EXPECT_EQ(file_bytes(path("t")), table_file);
+  // A side file whose lock is held is a live writer's, here or elsewhere.
+  write_file(path("t.rewrite"), "\1\2\3");
+  const int writer = ::open(path("t.rewrite").c_str(), O_RDWR | O_CLOEXEC);
+  ASSERT_GE(writer, 0);
+  struct flock whole {};
+  whole.l_type = F_WRLCK;
+  whole.l_whence = SEEK_SET;
+  ASSERT_EQ(::fcntl(writer, F_OFD_SETLK, &whole), 0);
+  EXPECT_EQ(sr_repair_tables_1(tree_, paths, 3), 0);
+  EXPECT_EQ(file_bytes(path("t.rewrite")), "\1\2\3");
+  ASSERT_EQ(::close(writer), 0);
+  EXPECT_EQ(sr_repair_tables_1(tree_, paths, 3), 0);
+  EXPECT_FALSE(std::filesystem::exists(path("t.rewrite")));
   EXPECT_EQ(sr_repair_tables_1(tree_, nullptr, 0), 0);
   EXPECT_EQ(sr_repair_tables_1(tree_, nullptr, 1), SR_E_NULL_POINTER);
   EXPECT_EQ(sr_repair_tables_1(nullptr, paths, 1), SR_E_INVALID_HANDLE);

@@ -274,7 +274,7 @@ TEST_F(Select, SelectingReadsTheTablesViewAndListingTheAskedOneJudgingPendingVal
   EXPECT_EQ(listed(committed_view, 0, nullptr), listed(committed_view, 1, nullptr));
 }
 
-// Rows are judged many index positions at a time: a table of some
+// Rows are judged many index positions at a time: a table of a few
 // thousand rows, with pending additions, updates and deletions spread over
 // it (and a run of deletions longer than one batch), lists and copies
 // exactly the rows a position-by-position reading through the interface
@@ -282,21 +282,21 @@ TEST_F(Select, SelectingReadsTheTablesViewAndListingTheAskedOneJudgingPendingVal
 // not, and none.
 TEST_F(Select, LongTablesWithPendingChangesAreJudgedPositionByPosition) {
   sr_opaque_handle_t table = create_named_counts("/long", Explicit);
-  for (int32_t row = 0; row < 1100; ++row) {
+  for (int32_t row = 0; row < 2500; ++row) {
     ASSERT_EQ(add_named(table, ("r" + std::to_string(row)).c_str(), row), 0);
   }
   apply_commit(table);
   for (int32_t row = 0; row < 60; ++row) {
     ASSERT_EQ(add_named(table, ("n" + std::to_string(row)).c_str(), 300 + row), 0);
   }
-  for (int32_t row = 1; row < 1100; row += 5) {
+  for (int32_t row = 1; row < 2500; row += 5) {
     qv_value_t changed = int32_value(-row);
     ASSERT_EQ(sr_set_field_by_key_1(table, string_value(("r" + std::to_string(row)).c_str()),
                                     "count", &changed),
               0);
   }
   ASSERT_EQ(sr_delete_rows_1(table, "count % $i == $i", 7, 3), 0);
-  ASSERT_EQ(sr_delete_rows_1(table, "count >= $i && count < $i", 700, 1000), 0);
+  ASSERT_EQ(sr_delete_rows_1(table, "count >= $i && count < $i", 700, 1900), 0);
 
   struct criteria_case {
     const char *p_text;
@@ -308,7 +308,7 @@ TEST_F(Select, LongTablesWithPendingChangesAreJudgedPositionByPosition) {
       {"count % 3 == 1", [](int32_t count) { return count % 3 == 1; }},
       {nullptr, [](int32_t) { return true; }}};
   const uint32_t positions = object(table)->maximum_rows;
-  ASSERT_GT(positions, 1160u);
+  ASSERT_GT(positions, 2560u);
   for (const criteria_case &criteria : cases) {
     SCOPED_TRACE(criteria.p_text != nullptr ? criteria.p_text : "no criteria");
     std::vector<uint32_t> committed_view;

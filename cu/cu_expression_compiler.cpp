@@ -603,6 +603,7 @@ int32_t cu_i_compile_expression(std::string_view text, cu_validate_callback_t ca
   } catch (const cu_i_compile_error &error) {
     return error.code;
   }
+  cu_i_fuse_tests(*program);
   compiled = std::move(program);
   return CU_RESULT_OK;
 }

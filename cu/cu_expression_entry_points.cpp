@@ -1,6 +1,7 @@
-// cu_expression_entry_points.cpp - cu_comp_expr_1, cu_exec_expr_1 and
-// cu_free_expr_1: argument checks, the text length limit, and the boundary
-// that no exception crosses. The work is in the compiler and the evaluator.
+// cu_expression_entry_points.cpp - cu_comp_expr_1, cu_exec_expr_1,
+// cu_exec_expr_rows_1 and cu_free_expr_1: argument checks, the text length
+// limit, and the boundary that no exception crosses. The work is in the
+// compiler and the evaluator.
 
 #include <cxxabi.h>
 
@@ -65,6 +66,23 @@ int32_t cu_exec_expr_1(const cu_expression_t *p_expression, uint32_t mode, const
     *p_result = 0;
   }
   return result;
+}
+
+int32_t cu_exec_expr_rows_1(const cu_expression_t *p_expression, uint32_t mode,
+                            const void *p_row_pointers, uint32_t pointer_stride,
+                            uint32_t total_rows, uint32_t values_offset, uint32_t total_values,
+                            uint32_t indirect_offset, unsigned char *p_verdicts) {
+  if (p_expression == nullptr ||
+      (total_rows != 0 && (p_row_pointers == nullptr || p_verdicts == nullptr))) {
+    return CU_RESULT_NULL_ARGUMENT;
+  }
+  if (mode != CU_EXPR_MODE_ENCODED_SLOTS) {
+    return CU_RESULT_BAD_MODE;
+  }
+  cu_i_evaluate_rows(*p_expression, static_cast<const unsigned char *>(p_row_pointers),
+                     pointer_stride, total_rows, values_offset, total_values, indirect_offset,
+                     p_verdicts);
+  return CU_RESULT_OK;
 }
 
 int32_t cu_free_expr_1(cu_expression_t *p_expression, uint32_t flags) {

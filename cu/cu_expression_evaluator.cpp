@@ -1,5 +1,7 @@
-// cu_expression_evaluator.cpp - runs a compiled expression on one row whose
-// values are encoded slots and bodies, reading them where they lie.
+// cu_expression_evaluator.cpp - the stack machine: runs any compiled
+// program on one row whose values are encoded slots and bodies, reading them
+// where they lie. Programs of the commonest shape have fused tests as well
+// (cu_expression_rows.cpp runs those); this runs all the others.
 //
 // The stack is a fixed array sized by Cu_I_Max_Stack, strings are compared
 // in place (a stored string ends with its NUL, which regexec relies on), and
@@ -341,9 +343,9 @@ bool is_in_projection(const cu_i_value &value, uint32_t position, uint8_t field_
 
 }  // namespace
 
-int32_t cu_i_evaluate_encoded(const cu_expression_t &expression, const unsigned char *p_slots,
-                              uint32_t total_slots, const unsigned char *p_indirect,
-                              uint32_t *p_result) noexcept {
+int32_t cu_i_interpret_encoded(const cu_expression_t &expression, const unsigned char *p_slots,
+                               uint32_t total_slots, const unsigned char *p_indirect,
+                               uint32_t *p_result) noexcept {
   cu_i_value stack[Cu_I_Max_Stack];
   size_t top = 0;  // values on the stack
   const cu_i_instruction *const p_code = expression.code.data();

@@ -110,6 +110,37 @@ struct cu_i_pattern {
   }
 };
 
+// A comparison of one row value with a constant, decided for the value's
+// stored type when the program was compiled (cu_expression_fusion.cpp), so
+// that judging a row needs neither the stack nor the general number order.
+enum class cu_i_fused_kind : uint8_t {
+  // A 32- or 64-bit integer slot: the test holds when the value, as a 64-bit
+  // pattern, lies in [low, low + span] (or outside it, when negated).
+  signed_32,
+  unsigned_32,
+  signed_64,
+  unsigned_64,
+  // A float or double slot compared with `bound` by `comparison`.
+  floating_32,
+  floating_64,
+  // A string or binary body equal to the constant's bytes (or different
+  // from them, when negated).
+  string_bytes,
+  plain_bytes,
+};
+
+struct cu_i_fused_test {
+  cu_i_fused_kind kind;
+  cu_i_comparison comparison;  // floating kinds
+  bool negated;                // integer and byte kinds
+  uint32_t slot;
+  uint64_t low;                  // integer kinds, in the value's two's-complement pattern
+  uint64_t span;                 // integer kinds: the range's last value minus its first
+  double bound;                  // floating kinds
+  const unsigned char *p_bytes;  // byte kinds: the constant's bytes and their length
+  uint32_t length;
+};
+
 struct cu_expression_struct_t {
   std::vector<cu_i_instruction> code;
   std::vector<cu_i_value> constants;
@@ -120,6 +151,10 @@ struct cu_expression_struct_t {
   std::vector<std::unique_ptr<cu_i_pattern>> patterns;
   uint32_t stack_depth = 0;     // the most values the program holds at once
   bool reads_indirect = false;  // some variable is variable-length
+  // The whole program as tests that must all hold, in program order, when
+  // it has that shape; empty when only the stack machine can run it.
+  std::vector<cu_i_fused_test> fused_tests;
+  uint32_t first_slot_read = 0;  // the slot a batch asks the cache for ahead of time
 };
 
 // ---- Compiler and evaluator ---------------------------------------------
@@ -129,11 +164,32 @@ struct cu_expression_struct_t {
 int32_t cu_i_compile_expression(std::string_view text, cu_validate_callback_t callback,
                                 void *p_token, std::unique_ptr<cu_expression_t> &compiled);
 
-// Runs a program on one row of encoded slots. Returns 0 with *p_result set,
-// or 6, 7 or 8.
+// Finds the fused tests of a compiled program (and the first slot it
+// reads), leaving the tests empty when the program is of another shape.
+// May throw std::bad_alloc.
+void cu_i_fuse_tests(cu_expression_t &expression);
+
+// Runs a program on one row of encoded slots: by its fused tests when it
+// has them, otherwise on the stack machine. Returns 0 with *p_result set,
+// or 6, 7 or 8 (with *p_result untouched).
 int32_t cu_i_evaluate_encoded(const cu_expression_t &expression, const unsigned char *p_slots,
                               uint32_t total_slots, const unsigned char *p_indirect,
                               uint32_t *p_result) noexcept;
+
+// The stack machine alone, whatever fused tests the program has; the same
+// contract as cu_i_evaluate_encoded.
+int32_t cu_i_interpret_encoded(const cu_expression_t &expression, const unsigned char *p_slots,
+                               uint32_t total_slots, const unsigned char *p_indirect,
+                               uint32_t *p_result) noexcept;
+
+// Judges `total_rows` rows whose pointers lie `pointer_stride` bytes apart
+// from `p_row_pointers`: a row's slots are at `values_offset` bytes from its
+// pointer, its indirect area at `indirect_offset`. Writes 1 or 0 for each
+// into `p_verdicts`; a null pointer and a row that cannot match give 0.
+void cu_i_evaluate_rows(const cu_expression_t &expression, const unsigned char *p_row_pointers,
+                        uint32_t pointer_stride, uint32_t total_rows, uint32_t values_offset,
+                        uint32_t total_values, uint32_t indirect_offset,
+                        unsigned char *p_verdicts) noexcept;
 
 // ---- Literals and patterns (cu_expression_literals.cpp) -----------------
 

@@ -3,11 +3,12 @@
  * compiler that turns criteria text such as
  *     Age > 30 && Name =~ "^a" && "eth0" in Interfaces.Name
  * into an immutable compiled expression, and an evaluator that runs it on
- * one row record whose values are still in their encoded form (8-byte slots
- * and an indirect area, as libqv_pmsg lays them out). The language itself is
- * described in docs/expressions.md.
+ * row records whose values are still in their encoded form (8-byte slots
+ * and an indirect area, as libqv_pmsg lays them out), one row per call or a
+ * batch of rows per call. The language itself is described in
+ * docs/expressions.md.
  *
- * Conventions for the three functions below:
+ * Conventions for the functions below:
  *  1. They return a signed 32-bit result: 0 for success, otherwise one of
  *     the codes listed here or in qv_cu.h (CU_RESULT_NULL_ARGUMENT 1,
  *     CU_RESULT_BAD_FLAGS 4, CU_RESULT_NO_MEMORY 12). They record no
@@ -169,6 +170,40 @@ QV_CU_EXPORT int32_t cu_comp_expr_1(const char *p_text, uint32_t flags,
 QV_CU_EXPORT int32_t cu_exec_expr_1(const cu_expression_t *p_expression, uint32_t mode,
                                     const void *p_values, uint32_t total_values, uint32_t *p_result,
                                     const void *p_indirect);
+
+/*
+ * Evaluates a compiled expression on a batch of row records, giving the
+ * verdicts cu_exec_expr_1 would give row by row, at a lower cost per row:
+ * the arguments are checked once, and rows are read ahead.
+ *   p_expression     from cu_comp_expr_1
+ *   mode             CU_EXPR_MODE_ENCODED_SLOTS, as for cu_exec_expr_1
+ *   p_row_pointers   the first of total_rows row pointers (const void *,
+ *                    at any alignment); the i-th lies i * pointer_stride
+ *                    bytes after it, so the pointers may be a plain array
+ *                    (stride sizeof(void *)) or a member of an array of
+ *                    structures (stride the structure's size). A null row
+ *                    pointer is a row that does not match.
+ *   pointer_stride   the bytes from one row pointer to the next
+ *   total_rows       how many rows; 0 does nothing
+ *   values_offset    a row's first 8-byte slot lies this many bytes after
+ *                    its pointer
+ *   total_values     how many slots each row has
+ *   indirect_offset  a row's indirect area starts this many bytes after its
+ *                    pointer
+ *   p_verdicts       receives total_rows bytes: 1 for a row that matches,
+ *                    0 for one that does not, including a row for which
+ *                    cu_exec_expr_1 would return CU_RESULT_ARITHMETIC_FAULT,
+ *                    CU_RESULT_VALUE_MISSING or CU_RESULT_INDEX_OUT_OF_RANGE
+ * Returns 0, or, with nothing written, CU_RESULT_NULL_ARGUMENT (a null
+ * expression, or a null p_row_pointers or p_verdicts with total_rows above
+ * 0) or CU_RESULT_BAD_MODE. Safe to call from several threads at once on
+ * the same expression.
+ */
+QV_CU_EXPORT int32_t cu_exec_expr_rows_1(const cu_expression_t *p_expression, uint32_t mode,
+                                         const void *p_row_pointers, uint32_t pointer_stride,
+                                         uint32_t total_rows, uint32_t values_offset,
+                                         uint32_t total_values, uint32_t indirect_offset,
+                                         unsigned char *p_verdicts);
 
 /*
  * Releases a compiled expression; a null pointer is ignored.

@@ -10,6 +10,7 @@
 
 #include "queries/sr_i_select.h"
 
+#include <algorithm>
 #include <cstdlib>
 #include <cstring>
 #include <vector>
@@ -35,45 +36,43 @@ struct table_view {
   }
 };
 
-// How many index positions ahead of the row being judged the walk asks for
-// the record the view shows there to be brought into the cache. A row
-// record takes about 100 to 200 bytes and starts anywhere in a line, so its
-// first three lines are asked for; reaching it only when it is judged would
-// leave the walk waiting for every record in turn.
-constexpr uint32_t Prefetch_Distance = 8;
-constexpr uintptr_t Cache_Line_Bytes = 64;
-constexpr uintptr_t Prefetched_Lines = 3;
+// How many positions of the fixed index one call of the evaluator judges:
+// enough that the call's own cost is spread thin and that few rows come at
+// the start of a batch, before the evaluator's reading ahead has begun (256
+// was measurably slower); few enough that the verdicts, a byte each, stay
+// on the stack.
+constexpr uint32_t Batch_Positions = 1024;
 
-// The addresses are computed as integers: the lines after a short record lie
-// beyond it, and a prefetch never faults.
-void prefetch_record(const void *p_record) {
-  if (p_record == nullptr) {
-    return;
-  }
-  const auto address = reinterpret_cast<uintptr_t>(p_record);
-  for (uintptr_t line = 0; line < Prefetched_Lines; ++line) {
-    __builtin_prefetch(reinterpret_cast<const void *>(address + line * Cache_Line_Bytes));
-  }
-}
-
-// Calls `visit(position, entry, record)` for each row the view shows, in
-// fixed-index order, and stops at the first failure it returns.
+// Calls `visit(position, entry, record)` for each row the view shows whose
+// record in the `judged` view matches the criteria, in fixed-index order,
+// and stops at the first failure it returns. Positions are judged a batch
+// at a time, before the view is walked through them.
 template <typename Visit>
-int32_t walk_view(const sr_i_table_t *p_table, table_view view, Visit &&visit) {
+int32_t walk_matching_rows(const sr_i_table_t *p_table, table_view view, table_view judged,
+                           const sr_i_table_criteria &criteria, Visit &&visit) {
   const uint32_t total_rows = view.total_rows(p_table);
+  unsigned char verdicts[Batch_Positions];
   uint32_t seen = 0;
-  for (uint32_t position = 0; position < p_table->maximum_rows && seen < total_rows; ++position) {
-    if (position + Prefetch_Distance < p_table->maximum_rows) {
-      prefetch_record(view.record(p_table->p_rows_fixed_index[position + Prefetch_Distance]));
-    }
-    const sr_i_index_entry_t &entry = p_table->p_rows_fixed_index[position];
-    const void *p_record = view.record(entry);
-    if (p_record == nullptr) {
-      continue;
-    }
-    ++seen;
-    if (const int32_t rc = visit(position, entry, p_record); rc != 0) {
+  for (uint32_t first = 0; first < p_table->maximum_rows && seen < total_rows;
+       first += Batch_Positions) {
+    const uint32_t count = std::min(Batch_Positions, p_table->maximum_rows - first);
+    const sr_i_index_entry_t *p_entries = p_table->p_rows_fixed_index + first;
+    if (const int32_t rc = criteria.judge(p_table, p_entries, count, judged.applied, verdicts);
+        rc != 0) {
       return rc;
+    }
+    for (uint32_t at = 0; at < count && seen < total_rows; ++at) {
+      const void *p_record = view.record(p_entries[at]);
+      if (p_record == nullptr) {
+        continue;
+      }
+      ++seen;
+      if (verdicts[at] == 0) {
+        continue;
+      }
+      if (const int32_t rc = visit(first + at, p_entries[at], p_record); rc != 0) {
+        return rc;
+      }
     }
   }
   return 0;
@@ -238,15 +237,10 @@ int32_t sr_i_select_columns(sr_i_table_t *p_table, std::span<const uint32_t> col
   }
   const uint32_t *p_column_indices = copies_whole_rows(p_table, columns) ? nullptr : columns.data();
   const table_view view{uncommitted_updates_visible != 0};
-  const auto copy_if_matching = [&](uint32_t, const sr_i_index_entry_t &, const void *p_record) {
-    bool matches = false;
-    int32_t copy_rc = criteria.matches(p_table, p_record, &matches);
-    if (copy_rc == 0 && matches) {
-      copy_rc = sr_i_copy_row(p_table, p_record, p_new_table, p_column_indices);
-    }
-    return copy_rc;
+  const auto copy_row = [&](uint32_t, const sr_i_index_entry_t &, const void *p_record) {
+    return sr_i_copy_row(p_table, p_record, p_new_table, p_column_indices);
   };
-  if (const int32_t rc = walk_view(p_table, view, copy_if_matching); rc != 0) {
+  if (const int32_t rc = walk_matching_rows(p_table, view, view, criteria, copy_row); rc != 0) {
     return rc;
   }
   p_new_table->total_committed_rows = p_new_table->total_applied_rows;
@@ -277,23 +271,14 @@ int32_t sr_i_get_selected_rows(sr_i_table_t *p_table, const char *p_selection_cr
   uint32_t total = 0;
   int32_t rc = criteria.compile(p_table, p_selection_criteria);
   if (rc == 0) {
-    rc = walk_view(
-        p_table, view, [&](uint32_t position, const sr_i_index_entry_t &entry, const void *) {
-          // Criteria are judged on the row's pending values, in
-          // either view; a row deleted in the applied view has none
-          // and does not match.
-          bool matches = p_selection_criteria == nullptr;
-          if (!matches && entry.p_applied != nullptr) {
-            if (const int32_t match_rc = criteria.matches(p_table, entry.p_applied, &matches);
-                match_rc != 0) {
-              return match_rc;
-            }
-          }
-          if (matches) {
-            p_rows[total++] = position;
-          }
-          return 0;
-        });
+    // Criteria are judged on the row's pending values, in either view; a
+    // row deleted in the applied view has none and does not match.
+    const table_view judged{true};
+    rc = walk_matching_rows(p_table, view, judged, criteria,
+                            [&](uint32_t position, const sr_i_index_entry_t &, const void *) {
+                              p_rows[total++] = position;
+                              return 0;
+                            });
   }
   if (rc != 0) {
     std::free(p_rows);

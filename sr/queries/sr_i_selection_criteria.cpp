@@ -3,7 +3,8 @@
 // literals of the expression language, the compilation of the expanded text
 // against a table's columns (with the column callback the compiler asks for
 // each name), and the evaluation of the compiled expression on one row
-// record. The expression language itself is libqv_cu's.
+// record or, in one call, on a run of fixed-index entries. The expression
+// language itself is libqv_cu's.
 
 #include "queries/sr_i_selection_criteria.h"
 
@@ -407,6 +408,25 @@ int32_t sr_i_table_criteria::compile(sr_i_table_t *p_table, const char *p_criter
   cu_iconv_t *p_conversion =
       p_table->p_tree != nullptr ? p_table->p_tree->p_to_table_string_conversion_handle : nullptr;
   return sr_i_compile_expression(p_criteria, p_table, &p_expression_, p_conversion);
+}
+
+int32_t sr_i_table_criteria::judge(const sr_i_table_t *p_table, const sr_i_index_entry_t *p_entries,
+                                   uint32_t total, bool applied, unsigned char *p_verdicts) const {
+  if (p_expression_ == nullptr) {
+    std::memset(p_verdicts, 1, total);
+    return 0;
+  }
+  // The evaluator reads each entry's record pointer in place, one entry's
+  // size after the other, and finds slots and the variable part where a row
+  // record keeps them.
+  const void *p_first_pointer = applied ? &p_entries->p_applied : &p_entries->p_committed;
+  const int32_t rc = cu_exec_expr_rows_1(
+      p_expression_, CU_EXPR_MODE_ENCODED_SLOTS, p_first_pointer, sizeof(sr_i_index_entry_t), total,
+      Sr_Row_Header_Length, p_table->total_columns, sr_i_row_fixed_length(p_table), p_verdicts);
+  if (rc != 0) {
+    return sr_i_raise_library_call("cu_exec_expr_rows", rc);
+  }
+  return 0;
 }
 
 int32_t sr_i_expand_criteria(const char *p_selection_criteria, va_list ap,

@@ -2,7 +2,7 @@
  * sr_i_selection_criteria.h - selection criteria: the expansion of a
  * criteria format with the caller's replacement values into a plain
  * expression, its compilation against a table's columns, and its evaluation
- * on one row record.
+ * on one row record or on a run of the fixed index's entries.
  */
 #ifndef SR_I_SELECTION_CRITERIA_H
 #define SR_I_SELECTION_CRITERIA_H
@@ -96,6 +96,14 @@ class sr_i_table_criteria {
    * strings converted with its tree's conversion handle. Returns 0, or the
    * raised code of sr_i_compile_expression. */
   int32_t compile(sr_i_table_t *p_table, const char *p_criteria);
+
+  /* Verdicts for `total` consecutive entries of the table's fixed index,
+   * judged on their applied records (`applied`) or on their committed ones:
+   * 1 for a record that matches, 0 for one that does not and for an entry
+   * without that record. Without criteria every entry gets 1. One call of
+   * the evaluator judges them all. Returns 0 or 11 (raised). */
+  int32_t judge(const sr_i_table_t *p_table, const sr_i_index_entry_t *p_entries, uint32_t total,
+                bool applied, unsigned char *p_verdicts) const;
 
   /* Whether a row record of the table matches: 0 with `*p_matches` set, or
    * 11 (raised). */

@@ -39,6 +39,12 @@ uint32_t test_row::body_offset(uint32_t index) const {
   return offset;
 }
 
+laid_out_row lay_out(const test_row &row) {
+  laid_out_row laid{row.record, row.total_slots};
+  laid.bytes.insert(laid.bytes.end(), row.indirect.begin(), row.indirect.end());
+  return laid;
+}
+
 test_row encode_row(const std::vector<std::pair<int32_t, qv_value_t>> &cells) {
   test_row row;
   row.total_slots = static_cast<uint32_t>(cells.size());

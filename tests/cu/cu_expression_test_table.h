@@ -72,6 +72,17 @@ struct test_row {
   uint32_t body_offset(uint32_t index) const;
 };
 
+// A row as the batch call reads it: one block with the 4-byte header word,
+// the slots, and the indirect area right after them.
+struct laid_out_row {
+  std::vector<unsigned char> bytes;
+  uint32_t total_slots = 0;
+  const unsigned char *slots() const { return bytes.data() + 4; }
+  uint32_t indirect_offset() const { return 4 + 8 * total_slots; }
+  const unsigned char *indirect() const { return bytes.data() + indirect_offset(); }
+};
+laid_out_row lay_out(const test_row &row);
+
 // Encodes the cells with qv_pmsg_build_conv_protocol_value_1 (a failure is
 // reported as a test failure).
 test_row encode_row(const std::vector<std::pair<int32_t, qv_value_t>> &cells);

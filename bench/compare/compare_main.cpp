@@ -252,6 +252,7 @@ int main(int argc, char **argv) {
   compare::register_lmdb();
   compare::register_floors();
   compare::register_record_floor();
+  compare::register_index_floor();
   compare::comparison_reporter reporter;
   benchmark::RunSpecifiedBenchmarks(&reporter);
   reporter.print_table();

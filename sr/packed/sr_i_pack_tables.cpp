@@ -79,6 +79,8 @@ uint32_t pool_record_length(const void *p_record) {
   return sr_i_rb_record_header(const_cast<void *>(p_record))->record_length;
 }
 
+constexpr uint32_t Records_Asked_Ahead = 16;
+
 // Calls visit(p_record) with the visible record of every row of the view,
 // in packed-index order, or of the rows at the caller's fixed indexes, in
 // the caller's order (203 for an index outside the table, 204 for a row
@@ -92,10 +94,19 @@ int32_t visit_rows(const table_plan &plan, Visit &&visit) {
     return applied ? entry.p_applied : entry.p_committed;
   };
   if (plan.total_fixed_indices == 0) {
-    for (uint32_t packed = 0; packed < p_table->total_applied_rows; ++packed) {
-      const void *p_record =
-          record(p_table->p_rows_fixed_index[p_table->p_rows_packed_index[packed]]);
-      if (p_record != nullptr) {
+    const uint32_t total_rows = p_table->total_applied_rows;
+    const auto record_at = [&](uint32_t packed) {
+      return record(p_table->p_rows_fixed_index[p_table->p_rows_packed_index[packed]]);
+    };
+    for (uint32_t packed = 0; packed < total_rows; ++packed) {
+      // Each record starts a cache line of its own, wherever the pool put
+      // it: the one a few rows on is asked for now.
+      if (packed + Records_Asked_Ahead < total_rows) {
+        if (const void *p_ahead = record_at(packed + Records_Asked_Ahead)) {
+          __builtin_prefetch(sr_i_rb_record_header(const_cast<void *>(p_ahead)));
+        }
+      }
+      if (const void *p_record = record_at(packed)) {
         visit(p_record);
       }
     }

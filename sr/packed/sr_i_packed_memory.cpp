@@ -22,6 +22,8 @@
 namespace {
 
 constexpr uintptr_t Huge_Page_Bytes = uintptr_t{1} << 21;
+// mincore reports on whole pages; the smallest of any Linux port will do.
+constexpr size_t Small_Page_Bytes = 4096;
 
 }  // namespace
 
@@ -32,7 +34,12 @@ void sr_i_map_block_to_fill(void *p_memory, size_t length) {
   const auto start = reinterpret_cast<uintptr_t>(p_memory);
   const uintptr_t first_huge_page = (start + Huge_Page_Bytes - 1) & ~(Huge_Page_Bytes - 1);
   const uintptr_t end_huge_page = (start + length) & ~(Huge_Page_Bytes - 1);
-  if (end_huge_page > first_huge_page) {
+  // Memory the heap hands out again is mapped already, in small pages:
+  // advice would change nothing now and only split the heap's mapping.
+  unsigned char residence = 0;
+  if (end_huge_page > first_huge_page &&
+      mincore(reinterpret_cast<void *>(first_huge_page), Small_Page_Bytes, &residence) == 0 &&
+      (residence & 1) == 0) {
     // Refused by a kernel built without huge pages: the block is then
     // mapped page by page, as without the advice.
     madvise(reinterpret_cast<void *>(first_huge_page), end_huge_page - first_huge_page,

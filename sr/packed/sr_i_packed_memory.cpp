@@ -34,8 +34,8 @@ void sr_i_map_block_to_fill(void *p_memory, size_t length) {
   const auto start = reinterpret_cast<uintptr_t>(p_memory);
   const uintptr_t first_huge_page = (start + Huge_Page_Bytes - 1) & ~(Huge_Page_Bytes - 1);
   const uintptr_t end_huge_page = (start + length) & ~(Huge_Page_Bytes - 1);
-  // Memory the heap hands out again is mapped already, in small pages:
-  // advice would change nothing now and only split the heap's mapping.
+  // Memory the heap hands out again is mapped already: advice would change
+  // nothing now and only split the heap's mapping.
   unsigned char residence = 0;
   if (end_huge_page > first_huge_page &&
       mincore(reinterpret_cast<void *>(first_huge_page), Small_Page_Bytes, &residence) == 0 &&

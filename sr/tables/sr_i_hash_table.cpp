@@ -341,9 +341,12 @@ int32_t sr_i_hash_table_add_entries(sr_hash_table_t *p_hash_table, sr_i_index_en
 
   sr_hash_table_element_t **p_heads = p_hash_table->p_elements;
   const bool unique = (qualifier & 15) == SR_PRIMARY_KEY;
+  // A row's key is had once, when it is hashed, and kept in its element.
   const auto hash_row = [&](uint32_t row) {
     uint32_t &bucket = p_entries[row].hash_index;
-    if (!sr_i_hash_table_try_bucket(p_hash_table, key_of(p_context, &p_entries[row]), &bucket)) {
+    const void *p_key_value = key_of(p_context, &p_entries[row]);
+    p_block[row].p_key_value = p_key_value;
+    if (!sr_i_hash_table_try_bucket(p_hash_table, p_key_value, &bucket)) {
       return false;
     }
     __builtin_prefetch(&p_heads[bucket]);
@@ -366,7 +369,8 @@ int32_t sr_i_hash_table_add_entries(sr_hash_table_t *p_hash_table, sr_i_index_en
       return sr_i_raise_internal();
     }
     sr_i_index_entry_t &entry = p_entries[row];
-    const void *p_key_value = key_of(p_context, &entry);
+    sr_hash_table_element_t &element = p_block[row];
+    const void *p_key_value = element.p_key_value;
     sr_hash_table_element_t *&p_head = p_heads[entry.hash_index];
     if (unique) {
       if (const sr_hash_table_element_t *p_element = head_ahead(row + Heads_Followed_Ahead)) {
@@ -383,9 +387,7 @@ int32_t sr_i_hash_table_add_entries(sr_hash_table_t *p_hash_table, sr_i_index_en
         }
       }
     }
-    sr_hash_table_element_t &element = p_block[row];
     element.row_index = row;
-    element.p_key_value = p_key_value;
     element.p_next = p_head;
     p_head = &element;
     entry.p_hash_table_element = &element;

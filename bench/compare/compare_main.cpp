@@ -235,7 +235,9 @@ void print_settings() {
       "std::unordered_map<std::string, row>. Selections: SQLite steps through a prepared "
       "SELECT rowid with no index on the columns it tests, and copies with CREATE TEMP TABLE "
       "... AS SELECT under temp_store=MEMORY; record-loop reads our row records in a loop "
-      "written by hand.\n",
+      "written by hand. Shipping: memcpy+read copies the packed bytes and reads our table "
+      "in place; index-build builds the unpacked table's row index and key hash table again "
+      "from its records by a loop written by hand.\n",
       sqlite3_libversion(), MDB_VERSION_MAJOR, MDB_VERSION_MINOR, MDB_VERSION_PATCH);
 }
 

@@ -587,6 +587,27 @@ sr_opaque_handle_t loaded_transient_table(int64_t rows) {
   return table;
 }
 
+sr_opaque_handle_t unpacked_transient_table(int64_t rows) {
+  static tree receiver;
+  static std::map<int64_t, sr_opaque_handle_t> tables;
+  auto &table = tables[rows];
+  sr_opaque_handle_t loaded = loaded_transient_table(rows);
+  if (table != nullptr || loaded == nullptr || !receiver.ok()) {
+    return table;
+  }
+  const uint32_t committed_view = 0, all_rows = 0;
+  void *p_buffer = nullptr;
+  if (sr_pack_tables_1(1, &loaded, &committed_view, &all_rows, nullptr, &p_buffer) == 0) {
+    const hash_settings hash = hash_settings_for(rows);
+    if (sr_unpack_table_1(p_buffer, hash.buckets, hash.function, compare_keys, receiver.handle(), 0,
+                          &table) != 0) {
+      table = nullptr;
+    }
+    std::free(p_buffer);
+  }
+  return table;
+}
+
 void register_ours() {
   add(W1_Read_By_Key, "ours", read_by_key);
   add(W2_Read_By_Packed_Index, "ours", read_by_index<false>);

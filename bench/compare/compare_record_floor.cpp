@@ -3,9 +3,9 @@
 // that takes each value out of its slot and compares it in C. It is what a
 // selection costs with nothing between the records and the comparison (no
 // lock, no compiled criteria, no evaluator), and it lists the matching rows
-// as the selection does. It is the one part of the comparison that reads the
-// library's internal layout (sr/rows/sr_i_rows.h), so it alone includes
-// internal headers.
+// as the selection does. It and the index floor (compare_index_floor.cpp)
+// are the parts of the comparison that read the library's internal layout
+// (sr/rows/sr_i_rows.h), so they alone include internal headers.
 
 #include <cstring>
 #include <vector>

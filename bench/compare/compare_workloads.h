@@ -71,7 +71,8 @@ inline config_row make_row(uint32_t i) {
 //     a table of another handle (ours: sr_unpack_table_1 into a new tree;
 //     SQLite: sqlite3_deserialize into a new connection), and every column
 //     of every row read there; one item is one row. w10_unpack times the
-//     unpacking alone.
+//     unpacking alone, beside the floor of building its row index and key
+//     hash table alone ("index-build", compare_index_floor.cpp).
 //  w11 concurrent reads: w1's read by key, by 1, 2 and (where the machine
 //     has four processors) 4 threads at once from one table held in memory
 //     (LMDB: one read transaction per thread, reset and renewed around each
@@ -225,6 +226,7 @@ void register_sqlite();
 void register_lmdb();
 void register_floors();
 void register_record_floor();
+void register_index_floor();
 
 }  // namespace compare
 

@@ -16,8 +16,8 @@
 #include "frame/sr_i_errors.h"
 #include "packed/sr_i_packed_buffer.h"
 #include "packed/sr_i_packed_columns.h"
+#include "packed/sr_i_packed_memory.h"
 #include "rows/sr_i_rows.h"
-#include "storage/sr_i_prefault.h"
 
 namespace {
 
@@ -62,7 +62,10 @@ constexpr uint32_t Fixed_Metadata_Elements = 5;
 struct table_plan {
   const sr_i_table_t *p_table = nullptr;
   const char *p_name = "";
-  std::vector<const void *> rows;  // the visible records, in order
+  bool applied = false;  // the view packed
+  uint32_t total_fixed_indices = 0;
+  const uint32_t *p_fixed_indices = nullptr;
+  uint32_t total_rows = 0;
   qv_structured_data_t *p_fixed_metadata = nullptr;
   sr_i_packed_column_metadata column_metadata;
   uint64_t name_bytes = 0;
@@ -76,35 +79,49 @@ uint32_t pool_record_length(const void *p_record) {
   return sr_i_rb_record_header(const_cast<void *>(p_record))->record_length;
 }
 
-// The visible record of every row of the view, in packed-index order, or
-// of the rows at the caller's fixed indexes, in the caller's order (203
-// for an index outside the table, 204 for a row the view does not show).
-int32_t choose_rows(const sr_i_table_t *p_table, bool applied, uint32_t total_fixed_indices,
-                    const uint32_t *p_fixed_indices, std::vector<const void *> &rows) {
-  const auto record = [applied](const sr_i_index_entry_t &entry) {
+constexpr uint32_t Records_Asked_Ahead = 16;
+
+// Calls visit(p_record) with the visible record of every row of the view,
+// in packed-index order, or of the rows at the caller's fixed indexes, in
+// the caller's order (203 for an index outside the table, 204 for a row
+// the view does not show). Sizing and writing each walk the rows once,
+// rather than a list of them made for the purpose.
+template <typename Visit>
+int32_t visit_rows(const table_plan &plan, Visit &&visit) {
+  const sr_i_table_t *p_table = plan.p_table;
+  const bool applied = plan.applied;
+  const auto record = [applied](const sr_i_index_entry_t &entry) -> const void * {
     return applied ? entry.p_applied : entry.p_committed;
   };
-  if (total_fixed_indices == 0) {
-    rows.reserve(applied ? p_table->total_applied_rows : p_table->total_committed_rows);
-    for (uint32_t packed = 0; packed < p_table->total_applied_rows; ++packed) {
-      const void *p_record =
-          record(p_table->p_rows_fixed_index[p_table->p_rows_packed_index[packed]]);
-      if (p_record != nullptr) {
-        rows.push_back(p_record);
+  if (plan.total_fixed_indices == 0) {
+    const uint32_t total_rows = p_table->total_applied_rows;
+    const auto record_at = [&](uint32_t packed) {
+      return record(p_table->p_rows_fixed_index[p_table->p_rows_packed_index[packed]]);
+    };
+    for (uint32_t packed = 0; packed < total_rows; ++packed) {
+      // Each record starts a cache line of its own, wherever the pool put
+      // it: the one a few rows on is asked for now.
+      if (packed + Records_Asked_Ahead < total_rows) {
+        if (const void *p_ahead = record_at(packed + Records_Asked_Ahead)) {
+          __builtin_prefetch(sr_i_rb_record_header(const_cast<void *>(p_ahead)));
+        }
+      }
+      if (const void *p_record = record_at(packed)) {
+        visit(p_record);
       }
     }
     return 0;
   }
-  rows.reserve(total_fixed_indices);
-  for (uint32_t at = 0; at < total_fixed_indices; ++at) {
-    if (p_fixed_indices[at] >= p_table->maximum_rows) {
+  for (uint32_t at = 0; at < plan.total_fixed_indices; ++at) {
+    const uint32_t fixed_index = plan.p_fixed_indices[at];
+    if (fixed_index >= p_table->maximum_rows) {
       return sr_i_raise(SR_E_NO_ROW_FOR_INDEX);
     }
-    const void *p_record = record(p_table->p_rows_fixed_index[p_fixed_indices[at]]);
+    const void *p_record = record(p_table->p_rows_fixed_index[fixed_index]);
     if (p_record == nullptr) {
       return sr_i_raise(SR_E_ROW_DELETED);
     }
-    rows.push_back(p_record);
+    visit(p_record);
   }
   return 0;
 }
@@ -118,11 +135,15 @@ int32_t indirect_size(qv_data_type_t type, const qv_value_t &value, uint64_t &by
   return 0;
 }
 
-// Chooses the table's rows and builds and sizes its four values.
+// Counts and sizes the table's rows, and builds and sizes its other three
+// values.
 int32_t plan_table(const sr_i_table_t *p_table, bool applied, uint32_t total_fixed_indices,
                    const uint32_t *p_fixed_indices, qv_structured_data_t *p_fixed_metadata,
                    table_plan &plan) {
   plan.p_table = p_table;
+  plan.applied = applied;
+  plan.total_fixed_indices = total_fixed_indices;
+  plan.p_fixed_indices = p_fixed_indices;
   // A persistent table is known in its tree by its file's path; the other
   // side knows it by its registry path.
   if (p_table->p_persistent_table_registry_path != nullptr) {
@@ -130,8 +151,12 @@ int32_t plan_table(const sr_i_table_t *p_table, bool applied, uint32_t total_fix
   } else if (p_table->p_name != nullptr) {
     plan.p_name = p_table->p_name;
   }
-  if (const int32_t rc =
-          choose_rows(p_table, applied, total_fixed_indices, p_fixed_indices, plan.rows);
+  uint64_t records_bytes = 0;
+  if (const int32_t rc = visit_rows(plan,
+                                    [&](const void *p_record) {
+                                      ++plan.total_rows;
+                                      records_bytes += pool_record_length(p_record);
+                                    });
       rc != 0) {
     return rc;
   }
@@ -145,7 +170,7 @@ int32_t plan_table(const sr_i_table_t *p_table, bool applied, uint32_t total_fix
   }
   p_fixed_metadata->elements[0].value.ptr_char = const_cast<char *>(plan.p_name);
   // The rows packed: all the view shows, or those chosen.
-  p_fixed_metadata->elements[1].value.val_uint32 = static_cast<uint32_t>(plan.rows.size());
+  p_fixed_metadata->elements[1].value.val_uint32 = plan.total_rows;
   p_fixed_metadata->elements[2].value.val_uint32 = p_table->total_columns;
   p_fixed_metadata->elements[3].value.val_uint64 = p_table->change_counter;
   p_fixed_metadata->elements[4].value.val_int32 = 0;
@@ -164,10 +189,7 @@ int32_t plan_table(const sr_i_table_t *p_table, bool applied, uint32_t total_fix
       rc != 0) {
     return rc;
   }
-  plan.rows_bytes = 4 + uint64_t{Sr_Packed_Slot_Bytes} * plan.rows.size();
-  for (const void *p_record : plan.rows) {
-    plan.rows_bytes += pool_record_length(p_record);
-  }
+  plan.rows_bytes = 4 + uint64_t{Sr_Packed_Slot_Bytes} * plan.total_rows + records_bytes;
   return 0;
 }
 
@@ -193,21 +215,22 @@ void write_rows(const table_plan &plan, unsigned char *p_slot, unsigned char *p_
   const qv_pmsg_value_anchor_t array_anchor{offset, static_cast<uint32_t>(plan.rows_bytes)};
   std::memcpy(p_slot, &array_anchor, sizeof array_anchor);
   unsigned char *p_body = p_indirect + offset;
-  const auto total_rows = static_cast<uint32_t>(plan.rows.size());
-  sr_i_store_u32(p_body, total_rows);
-  uint32_t element_offset = 4 + Sr_Packed_Slot_Bytes * total_rows;
-  for (uint32_t row = 0; row < total_rows; ++row) {
-    const void *p_record = plan.rows[row];
+  sr_i_store_u32(p_body, plan.total_rows);
+  unsigned char *p_anchor = p_body + 4;
+  uint32_t element_offset = 4 + Sr_Packed_Slot_Bytes * plan.total_rows;
+  // The rows were walked once to size them: the walk cannot fail now.
+  visit_rows(plan, [&](const void *p_record) {
     const uint32_t length = pool_record_length(p_record);
     const qv_pmsg_value_anchor_t anchor{element_offset, length};
-    std::memcpy(p_body + 4 + Sr_Packed_Slot_Bytes * row, &anchor, sizeof anchor);
+    std::memcpy(p_anchor, &anchor, sizeof anchor);
+    p_anchor += Sr_Packed_Slot_Bytes;
     sr_i_record_metadata_t header = *sr_i_rb_record_header(const_cast<void *>(p_record));
     header.p_next = nullptr;
     std::memcpy(p_body + element_offset, &header, Sr_Record_Header_Length);
     std::memcpy(p_body + element_offset + Sr_Record_Header_Length, p_record,
                 length - Sr_Record_Header_Length);
     element_offset += length;
-  }
+  });
   offset += element_offset;
 }
 
@@ -259,14 +282,12 @@ int32_t sr_i_pack_tables(uint32_t total_tables, const sr_opaque_handle_t *p_tabl
     return sr_i_raise_no_memory();  // more than a buffer's 32-bit length can say
   }
   const auto length = static_cast<uint32_t>(fixed_part + indirect_length);
-  // Every byte is written below, so the buffer is not cleared first; a
-  // large one has its pages mapped in one call.
-  auto *p_buffer = static_cast<unsigned char *>(std::malloc(length));
+  // Every byte is written below, so the buffer is not cleared first.
+  auto *p_buffer = static_cast<unsigned char *>(sr_i_allocate_block_to_fill(length));
   if (p_buffer == nullptr) {
     return sr_i_raise_no_memory();
   }
   sr_i_decoded<unsigned char> buffer(p_buffer);
-  sr_i_prefault(p_buffer, length);
   const qv_pmsg_header_t header{length, QV_PMSG_VERSION, QV_PMSG_ARCH_LOCAL,
                                 Sr_Packed_Protocol_Type, 0};
   std::memcpy(p_buffer, &header, sizeof header);

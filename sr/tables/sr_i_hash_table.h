@@ -142,4 +142,31 @@ int32_t sr_i_hash_table_remove(sr_hash_table_t *p_hash_table, const void *p_key_
  * chain and the number of empty buckets. */
 void sr_i_hash_table_output_stats(const sr_hash_table_t *p_hash_table);
 
+/* ---- Entering many rows at once ----------------------------------------- */
+
+struct sr_i_index_entry_struct_t;
+
+/* The key of the row an index entry holds, as sr_i_hash_table_add_entries
+ * reads it: a pointer the elements keep, like `p_key_value` above. */
+typedef const void *(*sr_i_entry_key_function_t)(const void *p_context,
+                                                 const struct sr_i_index_entry_struct_t *p_entry);
+
+/*
+ * Enters the rows of `total_entries` consecutive index entries, entry i
+ * holding the row at fixed index i, into a hash table that holds no
+ * element yet, as many sr_i_hash_table_add calls in entry order would:
+ * each entry's `hash_index` and `p_hash_table_element` are set, equal keys
+ * under a qualifier other than SR_PRIMARY_KEY are all kept, the newest
+ * first. All elements come from one block, in entry order; the bucket
+ * heads, chains and keys a row will meet are asked for a few rows ahead.
+ * Returns 0, 108 (raised) when two keys are equal under SR_PRIMARY_KEY, 12
+ * (raised), 15 (raised) for a bad bucket or a table that holds elements.
+ * On failure the table holds no element and the entries' hash fields mean
+ * nothing.
+ */
+int32_t sr_i_hash_table_add_entries(sr_hash_table_t *p_hash_table,
+                                    struct sr_i_index_entry_struct_t *p_entries,
+                                    uint32_t total_entries, sr_i_entry_key_function_t key_of,
+                                    const void *p_context, sr_qualifier_t qualifier);
+
 #endif /* SR_I_HASH_TABLE_H */

@@ -14,6 +14,9 @@ uint32_t swapped(uint32_t word, bool other_byte_order) {
 }
 
 void put_bytes(std::vector<unsigned char> &bytes, const void *p_bytes, size_t length) {
+  if (length == 0) {
+    return;  // an empty part may come from an empty vector, whose data() is null
+  }
   const size_t end = bytes.size();
   bytes.resize(end + length);
   std::memcpy(bytes.data() + end, p_bytes, length);

@@ -74,12 +74,14 @@ benchmark::internal::Benchmark *add_concurrent_reads(const std::string &system,
                                                      void (*setup)(const benchmark::State &)) {
   benchmark::internal::Benchmark *p_benchmark =
       add(W11_Concurrent_Reads, system, function, Concurrent_Read_Row_Counts)->Setup(setup);
-  for (const int threads : {1, 2, 4}) {
-    if (threads <= 2 || std::thread::hardware_concurrency() >= static_cast<unsigned>(threads)) {
-      p_benchmark->Threads(threads);
-    }
+  for (int threads = 1; threads <= most_concurrent_readers(); threads *= 2) {
+    p_benchmark->Threads(threads);
   }
   return p_benchmark;
+}
+
+int most_concurrent_readers() {
+  return std::thread::hardware_concurrency() >= 4 ? 4 : 2;
 }
 
 bool check(benchmark::State &state, bool ok, const char *what) {

@@ -179,44 +179,53 @@ void read_by_key(benchmark::State &state) {
   read_keys(state, loaded_transient_table(state.range(0)), 0);
 }
 
-// Workload 11: the threads share the table w1 reads, loaded before they
-// start; they only look it up here.
-std::map<int64_t, sr_opaque_handle_t> &shared_tables() {
-  static std::map<int64_t, sr_opaque_handle_t> tables;
+// Workload 11's tables of one size: the one the threads share, and the
+// floor's private copies, one per thread of the largest run, each in a tree
+// of its own so that the threads reading them share nothing. All are loaded
+// together, one after another, the first time either side asks, and kept
+// for the whole run. Loaded at different moments they get memory in
+// different states of the heap (fresh pages, or pieces freed by earlier
+// workloads), and the comparison would measure the heap as well as the
+// sharing: the shared table used to be w1's, loaded at the start of a full
+// run, and the copies were loaded after every other workload had run.
+struct concurrent_read_tables {
+  sr_opaque_handle_t shared = nullptr;
+  std::vector<sr_opaque_handle_t> copies;
+};
+
+const concurrent_read_tables &concurrent_tables(int64_t rows) {
+  static std::vector<std::unique_ptr<tree>> owners;
+  static std::map<int64_t, concurrent_read_tables> made;
+  auto [place, inserted] = made.try_emplace(rows);
+  concurrent_read_tables &tables = place->second;
+  if (inserted) {
+    for (int table = 0; table <= most_concurrent_readers(); ++table) {
+      owners.push_back(std::make_unique<tree>());
+      const sr_opaque_handle_t loaded =
+          owners.back()->ok() ? create_loaded_table(owners.back()->handle(), "/w11", rows)
+                              : nullptr;
+      if (table == 0) {
+        tables.shared = loaded;
+      } else {
+        tables.copies.push_back(loaded);
+      }
+    }
+  }
   return tables;
 }
 
-void load_shared_table(const benchmark::State &state) {
-  shared_tables()[state.range(0)] = loaded_transient_table(state.range(0));
+void load_concurrent_tables(const benchmark::State &state) {
+  concurrent_tables(state.range(0));
 }
 
 void read_shared_table(benchmark::State &state) {
-  read_keys(state, shared_tables().at(state.range(0)),
+  read_keys(state, concurrent_tables(state.range(0)).shared,
             first_read_of_thread(state, static_cast<size_t>(state.range(0))));
 }
 
-// Workload 11's floor: a table of `rows` rows for each thread, each in a
-// tree of its own so that the threads share nothing, made before they
-// start and kept for the whole run. Indexed by row count, then thread.
-std::map<int64_t, std::vector<sr_opaque_handle_t>> &private_copies() {
-  static std::map<int64_t, std::vector<sr_opaque_handle_t>> copies;
-  return copies;
-}
-
-void load_private_copies(const benchmark::State &state) {
-  static std::vector<std::unique_ptr<tree>> owners;
-  std::vector<sr_opaque_handle_t> &copies = private_copies()[state.range(0)];
-  while (copies.size() < static_cast<size_t>(state.threads())) {
-    owners.push_back(std::make_unique<tree>());
-    copies.push_back(owners.back()->ok()
-                         ? create_loaded_table(owners.back()->handle(), "/private", state.range(0))
-                         : nullptr);
-  }
-}
-
 void read_private_copy(benchmark::State &state) {
-  const std::vector<sr_opaque_handle_t> &copies = private_copies().at(state.range(0));
-  read_keys(state, copies.at(static_cast<size_t>(state.thread_index())),
+  read_keys(state,
+            concurrent_tables(state.range(0)).copies.at(static_cast<size_t>(state.thread_index())),
             first_read_of_thread(state, static_cast<size_t>(state.range(0))));
 }
 
@@ -509,9 +518,9 @@ void ship_table(benchmark::State &state) {
     }
     auto receiver = std::make_unique<tree>();
     sr_opaque_handle_t unpacked = nullptr;
-    const bool made = receiver->ok() && sr_unpack_table_1(p_buffer, hash.buckets, hash.function,
-                                                          compare_keys, receiver->handle(), 0,
-                                                          &unpacked) == 0;
+    const bool made =
+        receiver->ok() && sr_unpack_table_1(p_buffer, hash.buckets, hash.function, compare_keys,
+                                            receiver->handle(), 0, &unpacked) == 0;
     std::free(p_buffer);
     if (!check(state, made, "sr_unpack_table_1") ||
         !check(state, read_every_value(unpacked, rows), "read every value")) {
@@ -531,8 +540,8 @@ void unpack(benchmark::State &state) {
   const uint32_t committed_view = 0, all_rows = 0;
   void *p_buffer = nullptr;
   if (!check(state,
-             table != nullptr && sr_pack_tables_1(1, &table, &committed_view, &all_rows, nullptr,
-                                                  &p_buffer) == 0,
+             table != nullptr &&
+                 sr_pack_tables_1(1, &table, &committed_view, &all_rows, nullptr, &p_buffer) == 0,
              "pack the table")) {
     return;
   }
@@ -542,11 +551,11 @@ void unpack(benchmark::State &state) {
     auto receiver = std::make_unique<tree>();
     state.ResumeTiming();
     sr_opaque_handle_t unpacked = nullptr;
-    if (!check(state,
-               receiver->ok() && sr_unpack_table_1(p_buffer, hash.buckets, hash.function,
-                                                   compare_keys, receiver->handle(), 0,
-                                                   &unpacked) == 0,
-               "sr_unpack_table_1")) {
+    if (!check(
+            state,
+            receiver->ok() && sr_unpack_table_1(p_buffer, hash.buckets, hash.function, compare_keys,
+                                                receiver->handle(), 0, &unpacked) == 0,
+            "sr_unpack_table_1")) {
       break;
     }
     state.PauseTiming();
@@ -627,8 +636,8 @@ void register_ours() {
       ->Unit(benchmark::kMillisecond);
   add(W10_Ship_Table, "ours", ship_table, Ship_Row_Counts)->Unit(benchmark::kMillisecond);
   add(W10_Unpack, "ours", unpack, Ship_Row_Counts)->Unit(benchmark::kMillisecond);
-  add_concurrent_reads("ours", read_shared_table, load_shared_table);
-  add_concurrent_reads(W11_Floor, read_private_copy, load_private_copies);
+  add_concurrent_reads("ours", read_shared_table, load_concurrent_tables);
+  add_concurrent_reads(W11_Floor, read_private_copy, load_concurrent_tables);
 }
 
 }  // namespace compare

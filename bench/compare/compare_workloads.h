@@ -210,6 +210,10 @@ benchmark::internal::Benchmark *add_concurrent_reads(const std::string &system,
                                                      void (*function)(benchmark::State &),
                                                      void (*setup)(const benchmark::State &));
 
+// The most threads workload 11 runs: 4 where the machine has four
+// processors, else 2.
+int most_concurrent_readers();
+
 // Where the reads of the calling thread start in the lookup order: the
 // threads spread evenly over it, so that they do not read the same rows in
 // step.

@@ -4,6 +4,12 @@
  * upgradable, consistent and usable again when a waiting thread is
  * cancelled. Failures of the underlying pthread calls are raised as 10
  * naming the pthread function.
+ *
+ * A lock is a few counters; what is heavy lives once in the process and is
+ * shared by every lock (sr_i_read_write_lock.cpp): the place where threads
+ * wait (a mutex and two conditions, chosen by the lock's address) and the
+ * readers' marks (one cache line per live thread, where a reader writes
+ * the address of each lock it holds).
  */
 #ifndef SR_I_READ_WRITE_LOCK_H
 #define SR_I_READ_WRITE_LOCK_H
@@ -13,45 +19,31 @@
 #include <atomic>
 #include <cstdint>
 
-/* One reader count on a cache line of its own, so that threads counting
- * themselves in different slots never write the same line. */
-struct alignas(64) sr_i_reader_slot_t {
-  std::atomic<int32_t> readers{0};
-};
-
 /*
- * Readers count themselves without the mutex, and a reader that finds no
- * writer writes only its own count: at first the lock's one count
- * (`readers`), and once two readers have been inside together, the slot of
- * its thread in `p_reader_slots`, one cache line per slot. A reader may
- * leave through another count than it came in by (the slots appear while
- * it reads); only the sum of all counts is the number of readers.
+ * A reader that finds no writer marks itself in its own thread's line
+ * (nothing another thread writes) and then looks at `lock_count`; a thread
+ * with no line or no free mark in it counts itself in `lock_count` instead.
+ * The readers inside are `lock_count` (when not -1) plus the marks holding
+ * the lock's address.
  *
- * A writer claims the lock under the mutex by setting `writer` and then
- * finding every count summed to 0; a reader counts itself first and then
- * looks at `writer`, so one of the two always sees the other. A reader that
- * sees a writer takes itself off again and waits under the mutex.
+ * A writer claims the lock under its waiting place's mutex by turning
+ * `lock_count` from 0 to -1 and then finding no mark of the lock; a reader
+ * marks itself first and then looks at `lock_count`, so one of the two
+ * always sees the other. A reader that sees -1 takes its mark off again
+ * and waits.
  */
 typedef struct sr_i_read_write_lock_struct_t {
-  pthread_mutex_t lock{};           /* guards the waiting counts and every wait */
-  pthread_cond_t read_condition{};  /* readers wait here */
-  pthread_cond_t write_condition{}; /* writers wait here */
   /* -1 while a writer holds the lock or, under the mutex, is claiming it;
-   * 0 otherwise. Only a thread holding the mutex changes it. */
-  std::atomic<int32_t> writer{0};
-  /* The readers until the slots exist; after that, what is left of the
-   * readers who came in before them. */
-  std::atomic<int32_t> readers{0};
-  /* Null until two readers are first inside together; then
-   * sr_i_rw_reader_slot_count() slots, freed by sr_i_rw_close. */
-  std::atomic<sr_i_reader_slot_t *> p_reader_slots{nullptr};
-  int32_t waiting_readers = 0; /* readers waiting or about to wait */
+   * otherwise the readers counted here rather than by a mark. Only a thread
+   * holding the mutex sets -1 or leaves it. */
+  std::atomic<int32_t> lock_count{0};
+  /* Writers inside their wait loop right now: a reader leaving takes the
+   * mutex to wake them only when this is not 0. */
+  std::atomic<int32_t> blocked_writers{0};
+  int32_t waiting_readers = 0; /* readers waiting or about to wait; under the mutex */
   /* Counted up when a writer starts to wait and down only when its wait fails
    * or it is cancelled; no decision reads it, it is a record of demand. */
   int32_t waiting_writers = 0;
-  /* Writers inside their wait loop right now: a reader leaving takes the
-   * mutex to wake one only when this is not 0. */
-  std::atomic<int32_t> blocked_writers{0};
 
   sr_i_read_write_lock_struct_t() = default;
   /* A lock belongs to the place it is in, not to the contents of the object
@@ -64,11 +56,22 @@ typedef struct sr_i_read_write_lock_struct_t {
   sr_i_read_write_lock_struct_t &operator=(const sr_i_read_write_lock_struct_t &) { return *this; }
 } sr_i_read_write_lock_t;
 
-/* The slots a lock gets once it is read by two threads at once: one per
- * processor online, at least one and at most 16. The same for the whole
- * process. */
-uint32_t sr_i_rw_reader_slot_count();
+/* Where the threads of a lock wait: shared by every lock whose address
+ * leads to it, so a wake-up may be for another lock and every waiter looks
+ * at its own lock again before it goes on. */
+typedef struct sr_i_rw_waiting_place_struct_t {
+  /* Initialised in the constant image of the program, so a lock works
+   * from the first static constructor on and nothing can fail to start. */
+  pthread_mutex_t lock = PTHREAD_MUTEX_INITIALIZER; /* guards the waiting counts and every wait */
+  pthread_cond_t read_condition = PTHREAD_COND_INITIALIZER;  /* readers wait here */
+  pthread_cond_t write_condition = PTHREAD_COND_INITIALIZER; /* writers wait here */
+} sr_i_rw_waiting_place_t;
 
+/* The waiting place of a lock: always the same one for the same address. */
+sr_i_rw_waiting_place_t *sr_i_rw_waiting_place(const sr_i_read_write_lock_t *p_rwlock);
+
+/* Opening zeroes the counters; closing has nothing to give back. Both are a
+ * few stores, since tables are made and freed often. */
 void sr_i_rw_open(sr_i_read_write_lock_t *p_rwlock);
 void sr_i_rw_close(sr_i_read_write_lock_t *p_rwlock);
 /* Each returns 0 or 10 (raised). */
@@ -77,9 +80,14 @@ int32_t sr_i_rw_unlock_read(sr_i_read_write_lock_t *p_rwlock);
 int32_t sr_i_rw_lock_write(sr_i_read_write_lock_t *p_rwlock);
 int32_t sr_i_rw_unlock_write(sr_i_read_write_lock_t *p_rwlock);
 
-/* The readers inside now: the sum of every count. Exact only while no
- * reader comes or goes; for checks and diagnostics. */
+/* The readers inside now: `lock_count` (unless a writer holds it) and every
+ * mark of the lock. Exact only while no reader comes or goes; for checks
+ * and diagnostics. */
 int32_t sr_i_rw_total_readers(const sr_i_read_write_lock_t *p_rwlock);
+
+/* The readers of the lock counted by a mark in the calling thread's line:
+ * 0 for a thread that has none. For checks. */
+int32_t sr_i_rw_marks_of_this_thread(const sr_i_read_write_lock_t *p_rwlock);
 
 /*
  * Holds a read-write lock for one scope:

@@ -6,6 +6,7 @@
 // Variable-length values are decoded by libqv_pmsg into one new block per
 // value, which the caller owns and frees with free().
 
+#include <cstdint>
 #include <cstring>
 
 #include "frame/sr_i_errors.h"
@@ -17,6 +18,10 @@
 #include "tables/sr_i_hash_table.h"
 
 namespace {
+
+// How far past the key a lookup asks for the rest of the record: one cache
+// line, which holds the values after a short key.
+constexpr uintptr_t Record_Tail_Prefetch = 64;
 
 // The record a read sees: the applied one when the table or the caller wants
 // uncommitted updates, else the committed one. Null when the row has none.
@@ -199,9 +204,27 @@ int32_t sr_i_get_fixed_row_index_for_key(sr_i_table_t *p_table, qv_value_t row_k
   const qv_value_t key = sr_i_value_or_empty(key_type, row_key);
   int32_t rc;
   if (p_table->p_rows_hash_table != nullptr) {
-    rc = sr_i_hash_table_get_index(p_table->p_rows_hash_table,
-                                   sr_i_client_key_pointer(key_type, key), p_fixed_row_index,
-                                   nullptr);
+    // In a table larger than the cache every step of a lookup misses: the
+    // bucket, the element, the key in its record, the row's index entry and
+    // the record's slots and values. As soon as an element names its row
+    // and key, the index entry and the record around the key are asked for,
+    // so that their misses overlap the comparison's instead of following
+    // it. The record's fixed part is taken to lie just before the key, where
+    // it is when the key is the first variable-length value (a fixed-size
+    // key lies in the slots themselves); when it is not, a prefetch is lost.
+    const sr_i_index_entry_t *p_entries = p_table->p_rows_fixed_index;
+    const uint32_t fixed_length =
+        sr_i_is_variable_length(key_type) ? sr_i_row_fixed_length(p_table) : Sr_Row_Header_Length;
+    rc = sr_i_hash_table_find_row(
+        p_table->p_rows_hash_table, sr_i_client_key_pointer(key_type, key), p_fixed_row_index,
+        [p_entries, fixed_length](const sr_hash_table_element_t &element) {
+          // In integers: a home's key may be null or point into a freed
+          // record, and a prefetch may go anywhere.
+          const auto key_address = reinterpret_cast<uintptr_t>(element.p_key_value);
+          __builtin_prefetch(&p_entries[element.row_index]);
+          __builtin_prefetch(reinterpret_cast<const void *>(key_address - fixed_length));
+          __builtin_prefetch(reinterpret_cast<const void *>(key_address + Record_Tail_Prefetch));
+        });
   } else {
     rc = scan_for_key(p_table, key, p_fixed_row_index);
   }

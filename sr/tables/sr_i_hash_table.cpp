@@ -5,15 +5,17 @@
 // good. New elements go to the head of their chain, so among equal keys the
 // newest is found first. Every bucket number a hash function produces is
 // checked against the bucket count before it is used, since a client's
-// function is outside our control. Elements come from the table's own
-// element blocks (see sr_hash_table_t); allocation uses nothrow new and
-// catches the block list's growth, so a failure is a code and never an
-// exception.
+// function is outside our control. Elements come from the homes of large
+// tables and from the table's own element blocks (see sr_hash_table_t);
+// allocation uses calloc, nothrow new and catches the block list's growth,
+// so a failure is a code and never an exception.
 
 #include "tables/sr_i_hash_table.h"
 
 #include <algorithm>
+#include <cstdint>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <new>
 
@@ -71,6 +73,16 @@ int32_t sr_i_hash_table_open(uint32_t total_hash_buckets, sr_hash_function_t p_h
   p_hash_table->last_block_capacity = 0;
   p_hash_table->unused_in_last_block = 0;
   p_hash_table->p_free_elements = nullptr;
+  p_hash_table->p_home_elements = nullptr;
+  if (total_hash_buckets >= Sr_Home_Element_Buckets) {
+    p_hash_table->p_home_elements = static_cast<sr_hash_table_element_t *>(
+        std::calloc(total_hash_buckets, sizeof(sr_hash_table_element_t)));
+    if (p_hash_table->p_home_elements == nullptr) {
+      delete p_hash_table;
+      delete[] p_elements;
+      return sr_i_raise_no_memory();
+    }
+  }
   *p_p_hash_table = p_hash_table;
   return 0;
 }
@@ -90,6 +102,7 @@ int32_t sr_i_hash_table_close(sr_hash_table_t *p_hash_table) {
     return 0;
   }
   delete[] p_hash_table->p_elements;
+  std::free(p_hash_table->p_home_elements);
   delete p_hash_table;  // with it the element blocks
   return 0;
 }
@@ -118,9 +131,24 @@ int32_t sr_i_hash_table_bucket(const sr_hash_table_t *p_hash_table, const void *
 
 namespace {
 
-// An unused element: a removed one if any waits, else the next of the last
-// block, else the first of a new block. Null when memory runs out.
-sr_hash_table_element_t *new_element(sr_hash_table_t *p_hash_table) {
+bool is_home(const sr_hash_table_t *p_hash_table, const sr_hash_table_element_t *p_element) {
+  // As addresses: the element may lie in a block rather than in the homes.
+  const auto homes = reinterpret_cast<uintptr_t>(p_hash_table->p_home_elements);
+  const auto element = reinterpret_cast<uintptr_t>(p_element);
+  return homes != 0 && element >= homes &&
+         element < homes + p_hash_table->total_hash_buckets * sizeof(sr_hash_table_element_t);
+}
+
+// An unused element for a key of `bucket`: the bucket's home if it has a
+// free one (a null key cannot mark a home as used, so it never takes one),
+// else a removed element if any waits, else the next of the last block,
+// else the first of a new block. Null when memory runs out.
+sr_hash_table_element_t *new_element(sr_hash_table_t *p_hash_table, uint32_t bucket,
+                                     const void *p_key_value) {
+  if (p_hash_table->p_home_elements != nullptr && p_key_value != nullptr &&
+      p_hash_table->p_home_elements[bucket].p_key_value == nullptr) {
+    return &p_hash_table->p_home_elements[bucket];
+  }
   if (sr_hash_table_element_t *p_element = p_hash_table->p_free_elements) {
     p_hash_table->p_free_elements = p_element->p_next;
     return p_element;
@@ -148,6 +176,11 @@ sr_hash_table_element_t *new_element(sr_hash_table_t *p_hash_table) {
 }
 
 void free_element(sr_hash_table_t *p_hash_table, sr_hash_table_element_t *p_element) {
+  if (is_home(p_hash_table, p_element)) {
+    p_element->p_key_value = nullptr;
+    p_element->p_next = nullptr;
+    return;
+  }
   p_element->p_next = p_hash_table->p_free_elements;
   p_hash_table->p_free_elements = p_element;
 }
@@ -191,14 +224,24 @@ int32_t sr_i_hash_table_add_to_bucket(sr_hash_table_t *p_hash_table, uint32_t bu
       return SR_E_DUPLICATE_KEY;
     }
   }
-  sr_hash_table_element_t *p_element = new_element(p_hash_table);
+  sr_hash_table_element_t *p_element = new_element(p_hash_table, bucket, p_key_value);
   if (p_element == nullptr) {
     return sr_i_raise_no_memory();
   }
   p_element->row_index = row_index;
   p_element->p_key_value = p_key_value;
-  p_element->p_next = p_hash_table->p_elements[bucket];
-  p_hash_table->p_elements[bucket] = p_element;
+  // A lookup finds the home without a miss of its own only while the home
+  // is the head, so a new element goes behind a home at the head when no
+  // equal key can be in the chain (the check above looked): the order of
+  // unequal keys is never seen. Equal keys are kept newest first.
+  sr_hash_table_element_t *p_head = p_hash_table->p_elements[bucket];
+  if (p_head != nullptr && (qualifier & 15) == SR_PRIMARY_KEY && is_home(p_hash_table, p_head)) {
+    p_element->p_next = p_head->p_next;
+    p_head->p_next = p_element;
+  } else {
+    p_element->p_next = p_head;
+    p_hash_table->p_elements[bucket] = p_element;
+  }
   *p_hash_index = bucket;
   *p_p_hash_table_element = p_element;
   return 0;

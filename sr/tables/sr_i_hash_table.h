@@ -42,7 +42,21 @@ typedef struct sr_hash_table_struct_t {
   uint32_t last_block_capacity;
   uint32_t unused_in_last_block;
   sr_hash_table_element_t *p_free_elements; /* linked through p_next */
+
+  /* Tables of Sr_Home_Element_Buckets buckets or more are made for rows
+   * beyond the cache, where each step of a lookup is a miss. They get one
+   * element place per bucket, its home: an element added to a bucket whose
+   * home is free takes it (a free home has a null `p_key_value`). A lookup
+   * then reads the home of its bucket at the same time as the bucket head,
+   * and when the head is the home, the element costs no miss of its own.
+   * Elements never move, so a row's index entry keeps its element. Null
+   * for fewer buckets; the memory comes from calloc and its pages are
+   * touched only as homes are used. */
+  sr_hash_table_element_t *p_home_elements;
 } sr_hash_table_t;
+
+/* The bucket count from which a hash table has home elements. */
+inline constexpr uint32_t Sr_Home_Element_Buckets = 65536;
 
 /*
  * Makes an empty hash table. With a null `p_hash_function` keys are resource
@@ -124,6 +138,49 @@ int32_t sr_i_hash_table_add_to_bucket(sr_hash_table_t *p_hash_table, uint32_t bu
  */
 int32_t sr_i_hash_table_get_index(const sr_hash_table_t *p_hash_table, const void *p_key_value,
                                   uint32_t *p_row_index, const void ***p_p_p_key_value);
+
+/*
+ * sr_i_hash_table_get_index for a reader about to read the row it finds:
+ * `reached(element)` is called with each element the walk reaches before
+ * its key is compared, and with the home of the key's bucket before the
+ * bucket head is read (a home may be free, or not in the chain: its fields
+ * are then only hints), so the caller can ask for the row's memory while
+ * the walk waits. Nothing is handed out through which an element could be
+ * changed. Returns 0, 202 (not raised) or 15 (raised).
+ */
+template <typename Reached>
+int32_t sr_i_hash_table_find_row(const sr_hash_table_t *p_hash_table, const void *p_key_value,
+                                 uint32_t *p_row_index, Reached reached) {
+  uint32_t bucket = 0;
+  if (const int32_t rc = sr_i_hash_table_bucket(p_hash_table, p_key_value, &bucket); rc != 0) {
+    return rc;
+  }
+  // The home is read at the same time as the bucket head, and its key asked
+  // for, so that when the head is the home its key's miss overlaps the
+  // head's instead of following it.
+  const sr_hash_table_element_t *p_home = nullptr;
+  if (p_hash_table->p_home_elements != nullptr) {
+    p_home = &p_hash_table->p_home_elements[bucket];
+    __builtin_prefetch(p_home->p_key_value);
+    reached(*p_home);
+  }
+  for (const sr_hash_table_element_t *p_element = p_hash_table->p_elements[bucket];
+       p_element != nullptr; p_element = p_element->p_next) {
+    if (p_element != p_home) {
+      reached(*p_element);
+    }
+    // The next element, if the key is not this one, loads while the
+    // comparison waits.
+    if (p_element->p_next != nullptr) {
+      __builtin_prefetch(p_element->p_next);
+    }
+    if (p_hash_table->p_compare_function(p_element->p_key_value, p_key_value) == 0) {
+      *p_row_index = p_element->row_index;
+      return 0;
+    }
+  }
+  return SR_E_NO_ROW_FOR_KEY;
+}
 
 /*
  * Unlinks and frees exactly `p_hash_table_element` (by identity, not by key)

@@ -26,6 +26,12 @@ constexpr uint32_t Buckets = 8;
 uint32_t key_modulo_buckets(const void *p_key) {
   return *static_cast<const uint32_t *>(p_key) % Buckets;
 }
+// The same eight chains in a table large enough to give every bucket a home
+// element, so that homes are taken, freed, taken again and put in front.
+constexpr uint32_t Home_Bucket_Spacing = Sr_Home_Element_Buckets / Buckets;
+uint32_t key_modulo_buckets_with_homes(const void *p_key) {
+  return key_modulo_buckets(p_key) * Home_Bucket_Spacing;
+}
 uint32_t key_itself(const void *p_key) {
   return *static_cast<const uint32_t *>(p_key);
 }
@@ -35,15 +41,25 @@ int32_t compare_keys(const void *p_stored_key, const void *p_key) {
 }
 
 // The row found for the key, or -1 for a clean 202 (returned, nothing raised).
+// The reader's walk must find the same row, having been shown the element
+// it found before comparing it.
 int64_t row_for(const sr_hash_table_t *p_table, const void *p_key) {
   uint32_t row = 0;
   cu_set_no_error_1();
   const int32_t rc = sr_i_hash_table_get_index(p_table, p_key, &row, nullptr);
   EXPECT_EQ(last_error().first, 0);
+  uint32_t walked_row = 0;
+  std::set<uint32_t> rows_shown;
+  const int32_t walk_rc = sr_i_hash_table_find_row(
+      p_table, p_key, &walked_row,
+      [&](const sr_hash_table_element_t &element) { rows_shown.insert(element.row_index); });
+  EXPECT_EQ(walk_rc, rc);
   if (rc == SR_E_NO_ROW_FOR_KEY) {
     return -1;
   }
   EXPECT_EQ(rc, 0);
+  EXPECT_EQ(walked_row, row);
+  EXPECT_EQ(rows_shown.count(row), 1u);
   return row;
 }
 
@@ -52,8 +68,14 @@ int64_t row_for(const sr_hash_table_t *p_table, uint32_t key) {
 }
 
 struct ClientHashTable : ::testing::Test {
-  void SetUp() override {
-    ASSERT_EQ(sr_i_hash_table_open(Buckets, key_modulo_buckets, compare_keys, &p_table), 0);
+  void SetUp() override { open(false); }
+  void open(bool with_homes) {
+    ASSERT_EQ(sr_i_hash_table_open(with_homes ? Sr_Home_Element_Buckets : Buckets,
+                                   with_homes ? key_modulo_buckets_with_homes : key_modulo_buckets,
+                                   compare_keys, &p_table),
+              0);
+    ASSERT_EQ(p_table->p_home_elements != nullptr, with_homes);
+    spacing = with_homes ? Home_Bucket_Spacing : 1;
   }
   void TearDown() override { EXPECT_EQ(sr_i_hash_table_close(p_table), 0); }
   int32_t add(const uint32_t &key, uint32_t row, uint32_t qualifier = SR_PRIMARY_KEY) {
@@ -61,6 +83,7 @@ struct ClientHashTable : ::testing::Test {
                                static_cast<sr_qualifier_t>(qualifier));
   }
   sr_hash_table_t *p_table = nullptr;
+  uint32_t spacing = 1;  // between the buckets the keys fall in
   uint32_t bucket = 0;
   sr_hash_table_element_t *p_element = nullptr;
 };
@@ -132,7 +155,14 @@ TEST(HashTable, BuiltInHashSharesABucketForHandlesDifferingAboveId4sLow14Bits) {
 // Random adds under both qualifiers, removals by element and by key, and
 // lookups, against a multimap whose equal keys keep their insertion order:
 // a checked add of a present key returns the newest equal element.
-TEST_F(ClientHashTable, RandomOperationsAgreeWithAMultimap) {
+// The random and the many-element tests run on eight buckets alone and on
+// eight buckets of a table with homes.
+struct ClientHashTableLayouts : ClientHashTable, ::testing::WithParamInterface<bool> {
+  void SetUp() override { open(GetParam()); }
+};
+INSTANTIATE_TEST_SUITE_P(WithAndWithoutHomes, ClientHashTableLayouts, ::testing::Bool());
+
+TEST_P(ClientHashTableLayouts, RandomOperationsAgreeWithAMultimap) {
   struct entry {
     uint32_t row, bucket;
     sr_hash_table_element_t *p_element;
@@ -158,7 +188,7 @@ TEST_F(ClientHashTable, RandomOperationsAgreeWithAMultimap) {
           ASSERT_EQ(p_element, std::prev(end)->second.p_element);
         } else {
           ASSERT_EQ(rc, 0);
-          ASSERT_EQ(bucket, key % Buckets);
+          ASSERT_EQ(bucket, key % Buckets * spacing);
           model.insert(end, {key, entry{row, bucket, p_element}});
         }
         break;
@@ -188,10 +218,49 @@ TEST_F(ClientHashTable, RandomOperationsAgreeWithAMultimap) {
   }
 }
 
+// In a table with homes, the first key of a bucket takes the bucket's home
+// and keeps it at the head while later unequal keys go behind it; a removed
+// home is taken by the next key of its bucket, and no element ever moves:
+// the ones handed out stay where they were and are still removed by
+// identity.
+TEST_F(ClientHashTable, HomesStayAtTheHeadAndAreTakenAgainWithoutMovingAnElement) {
+  EXPECT_EQ(sr_i_hash_table_close(p_table), 0);
+  open(true);
+  const uint32_t keys[] = {3, 11, 19, 27};  // one bucket
+  sr_hash_table_element_t *p_elements[4] = {};
+  for (uint32_t at = 0; at < 3; ++at) {
+    ASSERT_EQ(add(keys[at], at), 0);
+    p_elements[at] = p_element;
+  }
+  sr_hash_table_element_t *p_home = &p_table->p_home_elements[bucket];
+  EXPECT_EQ(p_elements[0], p_home);
+  EXPECT_EQ(p_table->p_elements[bucket], p_home);
+
+  ASSERT_EQ(sr_i_hash_table_remove_element(p_table, bucket, p_home), 0);
+  EXPECT_EQ(row_for(p_table, keys[0]), -1);
+  EXPECT_EQ(row_for(p_table, keys[1]), 1);
+  EXPECT_EQ(row_for(p_table, keys[2]), 2);
+  EXPECT_NE(p_table->p_elements[bucket], p_home);
+
+  ASSERT_EQ(add(keys[3], 3), 0);
+  p_elements[3] = p_element;
+  EXPECT_EQ(p_elements[3], p_home);
+  EXPECT_EQ(p_table->p_elements[bucket], p_home);
+  // A duplicate under the check names the existing element, wherever it is.
+  ASSERT_EQ(add(keys[1], 9), SR_E_DUPLICATE_KEY);
+  EXPECT_EQ(p_element, p_elements[1]);
+  for (uint32_t at = 1; at < 4; ++at) {
+    EXPECT_EQ(row_for(p_table, keys[at]), at);
+    ASSERT_EQ(sr_i_hash_table_remove_element(p_table, bucket, p_elements[at]), 0);
+    EXPECT_EQ(row_for(p_table, keys[at]), -1);
+  }
+  EXPECT_EQ(p_table->p_elements[bucket], nullptr);
+}
+
 // Elements live in blocks the table carves them from, and removed ones are
 // handed out again: thousands of keys, half removed and replaced by new
 // keys, must all stay findable, each element distinct from every other.
-TEST_F(ClientHashTable, ManyElementsSurviveRemovalAndReuseAcrossBlocks) {
+TEST_P(ClientHashTableLayouts, ManyElementsSurviveRemovalAndReuseAcrossBlocks) {
   constexpr uint32_t Keys = 6000;
   std::vector<uint32_t> keys(2 * Keys);
   std::vector<std::pair<uint32_t, sr_hash_table_element_t *>> placed(2 * Keys);

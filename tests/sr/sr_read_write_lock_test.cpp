@@ -9,6 +9,7 @@
 #include <pthread.h>
 
 #include <atomic>
+#include <barrier>
 #include <functional>
 #include <semaphore>
 #include <thread>
@@ -28,10 +29,11 @@ struct counters {
 // Read under the mutex: no writer is halfway through a claim, and the
 // waiting counts are exact.
 counters read_counters(sr_i_read_write_lock_t &rwlock) {
-  pthread_mutex_lock(&rwlock.lock);
+  pthread_mutex_t *p_mutex = &sr_i_rw_waiting_place(&rwlock)->lock;
+  pthread_mutex_lock(p_mutex);
   counters now{sr_i_rw_total_readers(&rwlock), rwlock.waiting_readers, rwlock.waiting_writers,
-               rwlock.writer.load() != 0};
-  pthread_mutex_unlock(&rwlock.lock);
+               rwlock.lock_count.load() < 0};
+  pthread_mutex_unlock(p_mutex);
   return now;
 }
 
@@ -169,58 +171,203 @@ TEST_F(ReadWriteLock, WriterLeavingWakesTheWaitingReadersBeforeAWaitingWriter) {
   EXPECT_TRUE(second_writer_held);
 }
 
-// A lock read by one thread at a time keeps its one count and costs no
-// slots; the first time two readers are inside together it gets its slots.
-// Readers who came in by the one count and leave by their slots still let
-// a writer in, and a writer still waits for a reader counted in a slot.
-TEST_F(ReadWriteLock, ReadersMoveToSlotsOnceTwoReadTogetherAndStillCountRight) {
-  for (int round = 0; round < 100; ++round) {
-    ASSERT_EQ(sr_i_rw_lock_read(&rwlock_), 0);
-    ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);
-  }
-  EXPECT_EQ(rwlock_.p_reader_slots.load(), nullptr);
-
-  ASSERT_EQ(sr_i_rw_lock_read(&rwlock_), 0);  // by the one count
-  std::binary_semaphore other_inside(0), other_may_leave(0), other_left(0);
+// Two threads reading one lock together each mark their own line and leave
+// the lock's count alone: the read path writes nothing both threads write.
+// A writer still waits for either of them.
+TEST_F(ReadWriteLock, ReadersTogetherMarkTheirOwnLinesAndAWriterStillWaitsForThem) {
+  std::binary_semaphore other_inside(0), other_may_leave(0);
   std::thread other([&] {
-    ASSERT_EQ(sr_i_rw_lock_read(&rwlock_), 0);  // the second reader inside
-    other_inside.release();
-    other_may_leave.acquire();
-    ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);
-    other_left.release();
-    // Now counted in this thread's slot, while the main thread writes.
-    other_may_leave.acquire();
     ASSERT_EQ(sr_i_rw_lock_read(&rwlock_), 0);
+    EXPECT_EQ(sr_i_rw_marks_of_this_thread(&rwlock_), 1);
     other_inside.release();
     other_may_leave.acquire();
     ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);
+    EXPECT_EQ(sr_i_rw_marks_of_this_thread(&rwlock_), 0);
   });
+  ASSERT_EQ(sr_i_rw_lock_read(&rwlock_), 0);
   other_inside.acquire();
-  ASSERT_NE(rwlock_.p_reader_slots.load(), nullptr);
+  EXPECT_EQ(sr_i_rw_marks_of_this_thread(&rwlock_), 1);
+  EXPECT_EQ(rwlock_.lock_count.load(), 0);
   EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 2);
 
-  ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);  // by this thread's slot
-  other_may_leave.release();
-  other_left.acquire();
-  EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 0);
-  ASSERT_EQ(sr_i_rw_lock_write(&rwlock_), 0);  // would wait for ever on a wrong sum
-  ASSERT_EQ(sr_i_rw_unlock_write(&rwlock_), 0);
-
-  other_may_leave.release();
-  other_inside.acquire();
-  EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 1);
   std::atomic<bool> writer_holds{false};
   std::thread writer([&] {
     ASSERT_EQ(sr_i_rw_lock_write(&rwlock_), 0);
     writer_holds = true;
+    EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 0);
     ASSERT_EQ(sr_i_rw_unlock_write(&rwlock_), 0);
   });
-  wait_for(rwlock_, [](counters now) { return now.waiting_writers == 2; });
-  EXPECT_FALSE(writer_holds);
+  wait_for(rwlock_, [](counters now) { return now.waiting_writers == 1; });
+  ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);
+  EXPECT_FALSE(writer_holds);  // the other thread's mark still holds it
   other_may_leave.release();
   other.join();
   writer.join();
   EXPECT_TRUE(writer_holds);
+}
+
+// A thread holding more read locks than it has marks, or the same lock
+// again and again, counts the rest in the locks' own counts; whichever way
+// each hold was counted, the lock is free again only after the last
+// release.
+TEST_F(ReadWriteLock, HoldsBeyondTheMarksAreCountedInTheLockAndReleasedRight) {
+  constexpr int Holds = 12;  // more than the marks of one thread
+  for (int hold = 0; hold < Holds; ++hold) {
+    ASSERT_EQ(sr_i_rw_lock_read(&rwlock_), 0);
+  }
+  EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), Holds);
+  EXPECT_GT(rwlock_.lock_count.load(), 0);
+
+  std::vector<sr_i_read_write_lock_t> others(Holds);
+  for (sr_i_read_write_lock_t &other : others) {
+    sr_i_rw_open(&other);
+  }
+  // With every mark taken, the other locks are counted in their counts.
+  for (sr_i_read_write_lock_t &other : others) {
+    ASSERT_EQ(sr_i_rw_lock_read(&other), 0);
+    EXPECT_EQ(sr_i_rw_total_readers(&other), 1);
+  }
+
+  std::atomic<int> writers_done{0};
+  auto write_once = [&](sr_i_read_write_lock_t *p_lock) {
+    ASSERT_EQ(sr_i_rw_lock_write(p_lock), 0);
+    ASSERT_EQ(sr_i_rw_unlock_write(p_lock), 0);
+    ++writers_done;
+  };
+  std::thread writer(write_once, &rwlock_);
+  std::thread other_writer(write_once, &others.back());
+  wait_for(rwlock_, [](counters now) { return now.waiting_writers == 1; });
+  wait_for(others.back(), [](counters now) { return now.waiting_writers == 1; });
+  for (int hold = 1; hold < Holds; ++hold) {
+    ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);
+  }
+  EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 1);
+  EXPECT_EQ(writers_done.load(), 0);
+  ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);
+  writer.join();
+  EXPECT_EQ(writers_done.load(), 1);
+
+  for (sr_i_read_write_lock_t &other : others) {
+    ASSERT_EQ(sr_i_rw_unlock_read(&other), 0);
+  }
+  other_writer.join();
+  EXPECT_EQ(writers_done.load(), 2);
+  for (sr_i_read_write_lock_t &other : others) {
+    EXPECT_EQ(sr_i_rw_total_readers(&other), 0);
+    EXPECT_EQ(sr_i_rw_marks_of_this_thread(&other), 0);
+    sr_i_rw_close(&other);
+  }
+}
+
+// More threads than there are lines read at once: those without a line are
+// counted in the lock's count, and a writer waits for every one of them.
+TEST_F(ReadWriteLock, ThreadsBeyondTheLinesAreCountedAndWaitedFor) {
+  constexpr int Readers = 80;
+  std::counting_semaphore<Readers> inside(0);
+  std::binary_semaphore leave(0);
+  std::atomic<int> still_inside{0};
+  std::vector<std::thread> readers;
+  for (int reader = 0; reader < Readers; ++reader) {
+    readers.emplace_back([&] {
+      ASSERT_EQ(sr_i_rw_lock_read(&rwlock_), 0);
+      ++still_inside;
+      inside.release();
+      leave.acquire();
+      --still_inside;
+      ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);
+      leave.release();  // the next reader may leave
+    });
+  }
+  for (int reader = 0; reader < Readers; ++reader) {
+    inside.acquire();
+  }
+  EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), Readers);
+  EXPECT_GT(rwlock_.lock_count.load(), 0);
+
+  std::atomic<int> readers_seen_by_writer{-1};
+  std::thread writer([&] {
+    ASSERT_EQ(sr_i_rw_lock_write(&rwlock_), 0);
+    readers_seen_by_writer = still_inside.load();
+    ASSERT_EQ(sr_i_rw_unlock_write(&rwlock_), 0);
+  });
+  wait_for(rwlock_, [](counters now) { return now.waiting_writers == 1; });
+  leave.release();
+  for (std::thread &reader : readers) {
+    reader.join();
+  }
+  writer.join();
+  EXPECT_EQ(readers_seen_by_writer.load(), 0);
+  EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 0);
+}
+
+// A thread that ends still holding a read lock hands its mark to the lock's
+// count: the lock stays held until someone releases it, and the next thread
+// to get that line finds it clean.
+TEST_F(ReadWriteLock, AThreadEndingWithAReadLockHandsItToTheLock) {
+  std::thread([&] { ASSERT_EQ(sr_i_rw_lock_read(&rwlock_), 0); }).join();
+  EXPECT_EQ(rwlock_.lock_count.load(), 1);
+  EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 1);
+  std::thread([&] {
+    ASSERT_EQ(sr_i_rw_lock_read(&rwlock_), 0);
+    EXPECT_EQ(sr_i_rw_marks_of_this_thread(&rwlock_), 1);  // a clean line
+    EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 2);
+    ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);
+  }).join();
+  ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);  // released for the ended thread
+  EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 0);
+  ASSERT_EQ(sr_i_rw_lock_write(&rwlock_), 0);
+  ASSERT_EQ(sr_i_rw_unlock_write(&rwlock_), 0);
+}
+
+// Tables are made and freed by the thousand: a lock costs a few words, and
+// locks opened where closed ones were (as the heap hands the same memory
+// out again) start free, whatever the old ones went through.
+TEST(ReadWriteLocks, ManyLocksOpenedAndClosedStartFreeAndCostAFewWords) {
+  EXPECT_LE(sizeof(sr_i_read_write_lock_t), 4 * sizeof(void *));
+  constexpr size_t Locks = 10000;
+  auto *p_locks =
+      static_cast<sr_i_read_write_lock_t *>(::operator new(Locks * sizeof(sr_i_read_write_lock_t)));
+  for (int generation = 0; generation < 3; ++generation) {
+    for (size_t lock = 0; lock < Locks; ++lock) {
+      new (&p_locks[lock]) sr_i_read_write_lock_t;
+      sr_i_rw_open(&p_locks[lock]);
+      ASSERT_EQ(sr_i_rw_total_readers(&p_locks[lock]), 0) << lock;
+    }
+    // Two threads read each lock together and keep a third of them while
+    // the main thread looks; every hold is released before the locks close.
+    std::barrier step(3);
+    auto read_all = [&] {
+      for (size_t lock = 0; lock < Locks; ++lock) {
+        ASSERT_EQ(sr_i_rw_lock_read(&p_locks[lock]), 0);
+        if (lock % 3 != 0) {
+          ASSERT_EQ(sr_i_rw_unlock_read(&p_locks[lock]), 0);
+        }
+      }
+      step.arrive_and_wait();
+      step.arrive_and_wait();
+      for (size_t lock = 0; lock < Locks; lock += 3) {
+        ASSERT_EQ(sr_i_rw_unlock_read(&p_locks[lock]), 0);
+      }
+    };
+    std::thread first(read_all), second(read_all);
+    step.arrive_and_wait();
+    for (size_t lock = 0; lock < Locks; lock += 4) {
+      EXPECT_EQ(sr_i_rw_total_readers(&p_locks[lock]), lock % 3 == 0 ? 2 : 0) << lock;
+    }
+    step.arrive_and_wait();
+    first.join();
+    second.join();
+    for (size_t lock = 0; lock < Locks; lock += 4) {
+      ASSERT_EQ(sr_i_rw_lock_write(&p_locks[lock]), 0);
+      ASSERT_EQ(sr_i_rw_unlock_write(&p_locks[lock]), 0);
+    }
+    for (size_t lock = 0; lock < Locks; ++lock) {
+      EXPECT_EQ(sr_i_rw_total_readers(&p_locks[lock]), 0) << lock;
+      sr_i_rw_close(&p_locks[lock]);
+      p_locks[lock].~sr_i_read_write_lock_t();
+    }
+  }
+  ::operator delete(p_locks);
 }
 
 TEST_F(ReadWriteLock, WritersExcludeEveryoneUnderHeavyMixedUse) {
@@ -267,6 +414,132 @@ TEST_F(ReadWriteLock, WritersExcludeEveryoneUnderHeavyMixedUse) {
   EXPECT_FALSE(after.writer_holds);
   EXPECT_EQ(after.waiting_readers, 0);
   EXPECT_EQ(rwlock_.blocked_writers.load(), 0);
+}
+
+// Two locks whose waiting place is the same, each with waiting readers and
+// writers: waking the waiters of one lets in only its own, and mixed use of
+// both from many threads keeps each lock's writers alone.
+class SharedWaitingPlace : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    for (sr_i_read_write_lock_t &lock : candidates_) {
+      sr_i_rw_open(&lock);
+    }
+    for (size_t first = 0; first < candidates_.size() && p_second_ == nullptr; ++first) {
+      for (size_t second = first + 1; second < candidates_.size(); ++second) {
+        if (sr_i_rw_waiting_place(&candidates_[first]) ==
+            sr_i_rw_waiting_place(&candidates_[second])) {
+          p_first_ = &candidates_[first];
+          p_second_ = &candidates_[second];
+          break;
+        }
+      }
+    }
+    ASSERT_NE(p_second_, nullptr) << "no two of the locks share a waiting place";
+  }
+  void TearDown() override {
+    for (sr_i_read_write_lock_t &lock : candidates_) {
+      sr_i_rw_close(&lock);
+    }
+  }
+  std::vector<sr_i_read_write_lock_t> candidates_ = std::vector<sr_i_read_write_lock_t>(1000);
+  sr_i_read_write_lock_t *p_first_ = nullptr;
+  sr_i_read_write_lock_t *p_second_ = nullptr;
+};
+
+TEST_F(SharedWaitingPlace, WakingOneLocksWaitersLetsInOnlyThem) {
+  ASSERT_EQ(sr_i_rw_lock_write(p_first_), 0);
+  ASSERT_EQ(sr_i_rw_lock_write(p_second_), 0);
+  std::atomic<bool> first_reader_in{false}, second_reader_in{false}, first_writer_in{false};
+  std::binary_semaphore first_reader_may_leave(0);
+  std::thread first_reader([&] {
+    ASSERT_EQ(sr_i_rw_lock_read(p_first_), 0);
+    first_reader_in = true;
+    first_reader_may_leave.acquire();
+    ASSERT_EQ(sr_i_rw_unlock_read(p_first_), 0);
+  });
+  std::thread second_reader([&] {
+    ASSERT_EQ(sr_i_rw_lock_read(p_second_), 0);
+    second_reader_in = true;
+    ASSERT_EQ(sr_i_rw_unlock_read(p_second_), 0);
+  });
+  std::thread first_writer([&] {
+    ASSERT_EQ(sr_i_rw_lock_write(p_first_), 0);
+    first_writer_in = true;
+    ASSERT_EQ(sr_i_rw_unlock_write(p_first_), 0);
+  });
+  wait_for(*p_first_,
+           [](counters now) { return now.waiting_readers == 1 && now.waiting_writers == 2; });
+  wait_for(*p_second_, [](counters now) { return now.waiting_readers == 1; });
+
+  ASSERT_EQ(sr_i_rw_unlock_write(p_second_), 0);
+  second_reader.join();
+  EXPECT_TRUE(second_reader_in);
+  EXPECT_FALSE(first_reader_in);
+  EXPECT_FALSE(first_writer_in);
+  EXPECT_EQ(read_counters(*p_first_).waiting_readers, 1);  // woken, looked, waits again
+
+  ASSERT_EQ(sr_i_rw_unlock_write(p_first_), 0);
+  wait_for(*p_first_, [](counters now) { return now.readers == 1; });
+  EXPECT_TRUE(first_reader_in);
+  EXPECT_FALSE(first_writer_in);  // readers first
+  first_reader_may_leave.release();
+  first_reader.join();
+  first_writer.join();
+  EXPECT_TRUE(first_writer_in);
+}
+
+TEST_F(SharedWaitingPlace, MixedUseOfBothLocksKeepsEachWriterAlone) {
+  constexpr int Threads = 6;
+  constexpr int Rounds = 1500;
+  struct guarded {
+    sr_i_read_write_lock_t *p_lock;
+    long total = 0;  // guarded by *p_lock alone
+    std::atomic<int> writers_inside{0};
+    std::atomic<int> readers_inside{0};
+    std::atomic<long> writes{0};
+  };
+  guarded both[2];
+  both[0].p_lock = p_first_;
+  both[1].p_lock = p_second_;
+  std::atomic<bool> overlap_seen{false};
+  std::vector<std::thread> threads;
+  for (int thread = 0; thread < Threads; ++thread) {
+    threads.emplace_back([&, thread] {
+      for (int round = 0; round < Rounds; ++round) {
+        guarded &one = both[(round / 2 + thread) % 2];
+        if ((round + thread) % 4 == 0) {
+          sr_i_write_guard guard(one.p_lock);
+          ASSERT_EQ(guard.result(), 0);
+          if (++one.writers_inside != 1 || one.readers_inside != 0) {
+            overlap_seen = true;
+          }
+          ++one.total;
+          ++one.writes;
+          --one.writers_inside;
+        } else {
+          sr_i_read_guard guard(one.p_lock);
+          ASSERT_EQ(guard.result(), 0);
+          ++one.readers_inside;
+          const long seen = one.total;
+          if (one.writers_inside != 0 || seen != one.total) {
+            overlap_seen = true;
+          }
+          --one.readers_inside;
+        }
+      }
+    });
+  }
+  for (std::thread &thread : threads) {
+    thread.join();
+  }
+  EXPECT_FALSE(overlap_seen);
+  for (guarded &one : both) {
+    EXPECT_EQ(one.total, one.writes.load());
+    EXPECT_EQ(sr_i_rw_total_readers(one.p_lock), 0);
+    EXPECT_EQ(one.p_lock->lock_count.load(), 0);
+    EXPECT_EQ(one.p_lock->blocked_writers.load(), 0);
+  }
 }
 
 // A thread cancelled while it waits takes itself off the waiting counts and

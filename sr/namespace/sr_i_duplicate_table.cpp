@@ -103,9 +103,12 @@ class side_file {
     }
   }
 
-  // Opens, locks and empties the file. Returns 0, 201 or a failure of the
-  // calls, raised.
+  // Opens, locks and empties the file, unless that is done already.
+  // Returns 0, 201 or a failure of the calls, raised.
   int32_t open() {
+    if (owned_) {
+      return 0;
+    }
     if (const int32_t rc = sr_i_open_file(path_.c_str(), O_RDWR | O_CREAT, &locked_.fd); rc != 0) {
       return rc;
     }
@@ -340,7 +343,25 @@ class duplication {
       if (locks.target_length() != 0 && !overwrite_) {
         return sr_i_raise(SR_E_TABLE_EXISTS);
       }
-      rc = moves_its_own_file() ? move_open_file(source_done) : write_target_file(&p_fresh);
+      // A missing target has no lock of its own, but its side file does: a
+      // process creating the target holds it while it writes. So the side
+      // file is locked first, whichever way the table goes, and once it is
+      // had the target is either still missing, and no creator can finish
+      // meanwhile, or made by that creator, and left to it.
+      side_file side(target_.key);
+      if (!locks.holds_target()) {
+        if ((rc = side.open()) != 0) {
+          return rc;
+        }
+        bool exists = false;
+        if ((rc = sr_i_path_exists(target_.key.c_str(), &exists)) != 0) {
+          return rc;
+        }
+        if (exists) {
+          return sr_i_raise(SR_E_TABLE_EXISTS);
+        }
+      }
+      rc = moves_its_own_file() ? move_open_file(source_done) : write_target_file(side, &p_fresh);
     }
     // The file locks are given up first: the fresh image holds the writer's
     // lock of the new file on its own descriptor. Once renamed, the new file
@@ -418,11 +439,11 @@ class duplication {
   }
 
   // The new target file, from the source object, by renaming the source
-  // file, or as a copy of it. A target open here gets `*pp_fresh`, its new
-  // image, once the new file is in place.
-  int32_t write_target_file(sr_i_table_t **pp_fresh) {
+  // file, or as a copy of it through the locked `side` file. A target open
+  // here gets `*pp_fresh`, its new image, once the new file is in place.
+  int32_t write_target_file(side_file &side, sr_i_table_t **pp_fresh) {
     if (p_source_ != nullptr || !remove_source_) {
-      return copy_into_place(pp_fresh);
+      return copy_into_place(side, pp_fresh);
     }
     // Between table files a move is one rename. A writer of the source in
     // another process holds its file's lock while it has the table open:
@@ -442,7 +463,7 @@ class duplication {
       // No rename crosses file systems: the file is copied, and removed
       // once the copy has the target's name, its lock held all the while.
       // A failure to remove it leaves the table at both paths, and says so.
-      if (const int32_t rc = copy_into_place(pp_fresh); rc != 0) {
+      if (const int32_t rc = copy_into_place(side, pp_fresh); rc != 0) {
         return rc;
       }
       return sr_i_remove_table_files(source_file_);
@@ -463,10 +484,9 @@ class duplication {
     return rc != 0 || !other_directory ? rc : sr_i_flush_directory(source_directory.c_str());
   }
 
-  // Writes the new target file beside the target, from the source object
-  // or as a copy of the source file, and renames it into place.
-  int32_t copy_into_place(sr_i_table_t **pp_fresh) {
-    side_file side(target_.key);
+  // Writes the new target file into the side file, locked, from the source
+  // object or as a copy of the source file, and renames it into place.
+  int32_t copy_into_place(side_file &side, sr_i_table_t **pp_fresh) {
     if (const int32_t rc = side.open(); rc != 0) {
       return rc;
     }

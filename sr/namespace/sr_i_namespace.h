@@ -42,10 +42,14 @@ class sr_i_target_lock {
   /* Bytes in the target file when it was locked: 0 for no table. */
   uint64_t target_length() const { return target_length_; }
 
+  /* Whether a target file was there to lock. */
+  bool holds_target() const { return holds_target_; }
+
  private:
   int lock_fd_ = -1;
   int target_fd_ = -1; /* only when opened here */
   uint64_t target_length_ = 0;
+  bool holds_target_ = false;
 };
 
 /*

@@ -58,6 +58,7 @@ int32_t sr_i_target_lock::lock(const std::string &target_file, const sr_i_table_
   if (const int32_t rc = sr_i_lock_file(fd); rc != 0) {
     return rc;
   }
+  holds_target_ = true;
   off_t end = 0;
   if (const int32_t rc = sr_i_seek_to_end(fd, &end); rc != 0) {
     return rc;

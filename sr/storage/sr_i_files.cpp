@@ -279,6 +279,15 @@ bool sr_i_path_is_free(const char *p_path) {
   return Sr_File_System.stat(p_path, &status) != 0 && errno == ENOENT;
 }
 
+int32_t sr_i_path_exists(const char *p_path, bool *p_exists) {
+  struct stat status {};
+  *p_exists = Sr_File_System.stat(p_path, &status) == 0;
+  if (!*p_exists && errno != ENOENT) {
+    return sr_i_raise_system_call("stat", errno);
+  }
+  return 0;
+}
+
 int32_t sr_i_is_same_file(int fd, const char *p_path, bool *p_same) {
   struct stat opened {};
   struct stat current {};

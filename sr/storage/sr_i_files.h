@@ -101,6 +101,9 @@ int32_t sr_i_try_lock_file(int fd, bool *p_locked);
  * nothing is raised: the caller reports the name as taken. */
 bool sr_i_path_is_free(const char *p_path);
 
+/* Whether anything is at `p_path` now. 0 or 10. */
+int32_t sr_i_path_exists(const char *p_path, bool *p_exists);
+
 /* Whether `fd` is the file at `p_path` now (false when nothing is there
  * any more). 0 or 10. */
 int32_t sr_i_is_same_file(int fd, const char *p_path, bool *p_same);

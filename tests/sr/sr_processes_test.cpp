@@ -397,6 +397,8 @@ TEST_F(Processes, OfACreatorAndACopierOntoOneNewPathOneWinsAndTheTableIsWhole) {
     std::filesystem::remove(directory_ + "/" + Table_File);
     const auto outcome = [](int32_t rc) { return rc == 0 ? 0 : rc == SR_E_TABLE_EXISTS ? 1 : 2; };
     const pid_t creator = start_process([&] {
+      // Later and later in the copier's work, so that each wins some rounds.
+      std::this_thread::sleep_for(std::chrono::microseconds(round % 8 * 300));
       sr_opaque_handle_t tree = mounted_tree(), table = nullptr;
       const int32_t rc = sr_versioned::create_table(tree, Table_Path, 0, &table);
       return sr_close_tree_1(tree) == 0 ? outcome(rc) : 3;

@@ -49,6 +49,18 @@ class ReadWriteLock : public ::testing::Test {
  protected:
   void SetUp() override { sr_i_rw_open(&rwlock_); }
   void TearDown() override { sr_i_rw_close(&rwlock_); }
+
+  // A writer that takes the lock, says so through `holds`, finds no reader
+  // inside with it, and leaves.
+  std::thread writer_alone(std::atomic<bool> &holds) {
+    return std::thread([this, &holds] {
+      ASSERT_EQ(sr_i_rw_lock_write(&rwlock_), 0);
+      holds = true;
+      EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 0);
+      ASSERT_EQ(sr_i_rw_unlock_write(&rwlock_), 0);
+    });
+  }
+
   sr_i_read_write_lock_t rwlock_;
 };
 
@@ -68,12 +80,7 @@ TEST_F(ReadWriteLock, ReadersShareAndTheLastUnlockLetsTheWriterIn) {
   EXPECT_EQ(read_counters(rwlock_).readers, 2);
 
   std::atomic<bool> writer_holds{false};
-  std::thread writer([&] {
-    ASSERT_EQ(sr_i_rw_lock_write(&rwlock_), 0);
-    writer_holds = true;
-    EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 0);
-    ASSERT_EQ(sr_i_rw_unlock_write(&rwlock_), 0);
-  });
+  std::thread writer = writer_alone(writer_holds);
   wait_for(rwlock_, [](counters now) { return now.waiting_writers == 1; });
 
   release_first.release();
@@ -191,12 +198,7 @@ TEST_F(ReadWriteLock, ReadersTogetherMarkTheirOwnLinesAndAWriterStillWaitsForThe
   EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 2);
 
   std::atomic<bool> writer_holds{false};
-  std::thread writer([&] {
-    ASSERT_EQ(sr_i_rw_lock_write(&rwlock_), 0);
-    writer_holds = true;
-    EXPECT_EQ(sr_i_rw_total_readers(&rwlock_), 0);
-    ASSERT_EQ(sr_i_rw_unlock_write(&rwlock_), 0);
-  });
+  std::thread writer = writer_alone(writer_holds);
   wait_for(rwlock_, [](counters now) { return now.waiting_writers == 1; });
   ASSERT_EQ(sr_i_rw_unlock_read(&rwlock_), 0);
   EXPECT_FALSE(writer_holds);  // the other thread's mark still holds it

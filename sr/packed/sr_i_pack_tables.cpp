@@ -16,8 +16,8 @@
 #include "frame/sr_i_errors.h"
 #include "packed/sr_i_packed_buffer.h"
 #include "packed/sr_i_packed_columns.h"
-#include "packed/sr_i_packed_memory.h"
 #include "rows/sr_i_rows.h"
+#include "storage/sr_i_prefault.h"
 
 namespace {
 

@@ -17,9 +17,9 @@
 
 #include "frame/sr_i_errors.h"
 #include "packed/sr_i_packed_buffer.h"
-#include "packed/sr_i_packed_memory.h"
 #include "packed/sr_i_unpack_table.h"
 #include "rows/sr_i_rows.h"
+#include "storage/sr_i_prefault.h"
 #include "tables/sr_i_columns.h"
 #include "tables/sr_i_create_table.h"
 

@@ -19,7 +19,7 @@
 #include "frame/sr_i_paths.h"
 #include "packed/sr_i_packed_buffer.h"
 #include "packed/sr_i_packed_columns.h"
-#include "packed/sr_i_packed_memory.h"
+#include "storage/sr_i_prefault.h"
 #include "tables/sr_i_create_table.h"
 
 namespace {

@@ -21,6 +21,7 @@
 
 #include "frame/sr_i_errors.h"
 #include "qv_cu.h"
+#include "storage/sr_i_prefault.h"
 #include "tables/sr_i_table.h"
 
 namespace {
@@ -57,13 +58,14 @@ int32_t sr_i_hash_table_open(uint32_t total_hash_buckets, sr_hash_function_t p_h
   } else if (p_compare_function == nullptr || total_hash_buckets == 0) {
     return sr_i_raise_internal();
   }
-  auto **p_elements = new (std::nothrow) sr_hash_table_element_t *[total_hash_buckets]();
+  auto **p_elements = static_cast<sr_hash_table_element_t **>(
+      sr_i_allocate_zeroed_block(total_hash_buckets, sizeof(sr_hash_table_element_t *)));
   if (p_elements == nullptr) {
     return sr_i_raise_no_memory();
   }
   auto *p_hash_table = new (std::nothrow) sr_hash_table_t;
   if (p_hash_table == nullptr) {
-    delete[] p_elements;
+    std::free(p_elements);
     return sr_i_raise_no_memory();
   }
   p_hash_table->total_hash_buckets = total_hash_buckets;
@@ -79,7 +81,7 @@ int32_t sr_i_hash_table_open(uint32_t total_hash_buckets, sr_hash_function_t p_h
         std::calloc(total_hash_buckets, sizeof(sr_hash_table_element_t)));
     if (p_hash_table->p_home_elements == nullptr) {
       delete p_hash_table;
-      delete[] p_elements;
+      std::free(p_elements);
       return sr_i_raise_no_memory();
     }
   }
@@ -101,7 +103,7 @@ int32_t sr_i_hash_table_close(sr_hash_table_t *p_hash_table) {
   if (p_hash_table == nullptr) {
     return 0;
   }
-  delete[] p_hash_table->p_elements;
+  std::free(p_hash_table->p_elements);
   std::free(p_hash_table->p_home_elements);
   delete p_hash_table;  // with it the element blocks
   return 0;
@@ -374,6 +376,7 @@ int32_t sr_i_hash_table_add_entries(sr_hash_table_t *p_hash_table, sr_i_index_en
     return sr_i_raise_no_memory();
   }
   sr_hash_table_element_t *p_block = block.get();
+  sr_i_map_block_to_fill(p_block, sizeof(sr_hash_table_element_t) * total_entries);
   try {
     p_hash_table->element_blocks.push_back(std::move(block));
   } catch (const std::bad_alloc &) {

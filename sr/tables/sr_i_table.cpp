@@ -24,6 +24,7 @@
 
 #include "frame/sr_i_errors.h"
 #include "schema/sr_i_application_metadata.h"
+#include "storage/sr_i_prefault.h"
 #include "storage/sr_i_table_file.h"
 #include "tables/sr_i_allocation.h"
 #include "tables/sr_i_hash_table.h"
@@ -90,9 +91,10 @@ int32_t sr_i_establish_rows_index(sr_i_table_t *p_table, uint32_t maximum_rows) 
   if (maximum_rows == 0) {
     maximum_rows = Sr_Default_Index_Rows;
   }
-  auto *p_fixed =
-      static_cast<sr_i_index_entry_t *>(std::calloc(maximum_rows, sizeof(sr_i_index_entry_t)));
-  auto *p_packed = static_cast<uint32_t *>(std::calloc(maximum_rows, sizeof(uint32_t)));
+  auto *p_fixed = static_cast<sr_i_index_entry_t *>(
+      sr_i_allocate_zeroed_block(maximum_rows, sizeof(sr_i_index_entry_t)));
+  auto *p_packed =
+      static_cast<uint32_t *>(sr_i_allocate_zeroed_block(maximum_rows, sizeof(uint32_t)));
   if (p_fixed == nullptr || p_packed == nullptr) {
     std::free(p_fixed);
     std::free(p_packed);

@@ -8,6 +8,7 @@
 // before it is filled, a memory hint of its own, is checked here too.
 
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <sys/mman.h>
 #include <unistd.h>
 
@@ -266,6 +267,30 @@ TEST(Prefault, MapsEveryWholePageAndKeepsEveryByte) {
   EXPECT_EQ(resident[0] & 1, 0);
   munmap(p_small, Sr_Prefault_Minimum_Length - page);
   munmap(p_region, pages * page);
+}
+
+// Large zeroed blocks are zero however dirty the heap memory they reuse,
+// small ones too, and a size that overflows is refused, not wrapped. The
+// heap is told to keep what is freed, so that the blocks do reuse it.
+TEST(Prefault, AZeroedBlockIsZeroOnReusedMemoryAndAnOverflowIsRefused) {
+  ASSERT_EQ(mallopt(M_MMAP_THRESHOLD, 256 << 20), 1);
+  ASSERT_EQ(mallopt(M_TRIM_THRESHOLD, 256 << 20), 1);
+  for (const size_t length : {size_t{4000}, Sr_Prefault_Minimum_Length * 3 + 24}) {
+    auto *p_dirty = static_cast<unsigned char *>(std::malloc(length * 3));
+    ASSERT_NE(p_dirty, nullptr);
+    std::memset(p_dirty, 0xEE, length * 3);
+    const auto dirty_start = reinterpret_cast<uintptr_t>(p_dirty);
+    std::free(p_dirty);
+    auto *p_block = static_cast<unsigned char *>(sr_i_allocate_zeroed_block(length / 8, 8));
+    ASSERT_NE(p_block, nullptr);
+    const auto start = reinterpret_cast<uintptr_t>(p_block);
+    EXPECT_TRUE(start >= dirty_start && start < dirty_start + length * 3)
+        << "the block did not reuse the dirty memory; the test proves nothing";
+    EXPECT_EQ(std::count(p_block, p_block + length, 0), static_cast<std::ptrdiff_t>(length))
+        << length << " bytes";
+    std::free(p_block);
+  }
+  EXPECT_EQ(sr_i_allocate_zeroed_block(SIZE_MAX / 4, 8), nullptr);
 }
 
 TEST(RecordBufferPool, RaisesAndLeavesThePoolAsItWas) {

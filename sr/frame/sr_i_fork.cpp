@@ -4,11 +4,15 @@
 // installed: the locks are not taken around fork(), so a lock held by
 // another thread of the parent at the fork stays held, for ever, in the
 // child; refusing the changing calls keeps the child from waiting on it.
+// The waiting places the locks share are made new in the child: one whose
+// mutex a parent thread held at the fork for some other lock would
+// otherwise block the child's use of every lock that waits there.
 
 #include <cstdio>
 #include <cstdlib>
 
 #include "frame/sr_i_frame.h"
+#include "frame/sr_i_read_write_lock.h"
 
 pthread_mutex_t ForkMutex = PTHREAD_MUTEX_INITIALIZER;
 std::atomic<int> In_Child_Process{0};
@@ -19,6 +23,7 @@ pthread_once_t ForkHandlersAreEstablished = PTHREAD_ONCE_INIT;
 
 void ForkChildHandler() {
   In_Child_Process.store(1, std::memory_order_relaxed);
+  sr_i_rw_renew_waiting_places_in_child();
 }
 
 void sr_reg_once() {

@@ -25,6 +25,7 @@
 
 #include <array>
 #include <bit>
+#include <new>
 
 #include "frame/sr_i_errors.h"
 
@@ -251,6 +252,12 @@ void leave_write_wait_when_cancelled(void *p_argument) {
 
 sr_i_rw_waiting_place_t *sr_i_rw_waiting_place(const sr_i_read_write_lock_t *p_rwlock) {
   return &Places[spread_address(p_rwlock) >> (64 - std::countr_zero(Waiting_Places))];
+}
+
+void sr_i_rw_renew_waiting_places_in_child() {
+  for (sr_i_rw_waiting_place_t &place : Places) {
+    new (&place) sr_i_rw_waiting_place_t;
+  }
 }
 
 int32_t sr_i_rw_total_readers(const sr_i_read_write_lock_t *p_rwlock) {

@@ -70,6 +70,12 @@ typedef struct sr_i_rw_waiting_place_struct_t {
 /* The waiting place of a lock: always the same one for the same address. */
 sr_i_rw_waiting_place_t *sr_i_rw_waiting_place(const sr_i_read_write_lock_t *p_rwlock);
 
+/* In a forked child only, from its fork handler: every waiting place made
+ * new. The child is a copy of the forking thread alone, so a place's mutex
+ * that another thread held at the fork, for whatever lock, would otherwise
+ * stay held for ever, and nobody waits in the child yet. */
+void sr_i_rw_renew_waiting_places_in_child();
+
 /* Opening zeroes the counters; closing has nothing to give back. Both are a
  * few stores, since tables are made and freed often. */
 void sr_i_rw_open(sr_i_read_write_lock_t *p_rwlock);

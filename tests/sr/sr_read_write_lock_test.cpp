@@ -7,14 +7,18 @@
 
 #include <gtest/gtest.h>
 #include <pthread.h>
+#include <sys/wait.h>
 
 #include <atomic>
 #include <barrier>
+#include <chrono>
+#include <csignal>
 #include <functional>
 #include <semaphore>
 #include <thread>
 #include <vector>
 
+#include "frame/sr_i_frame.h"
 #include "frame/sr_i_read_write_lock.h"
 
 namespace {
@@ -492,6 +496,55 @@ TEST_F(SharedWaitingPlace, WakingOneLocksWaitersLetsInOnlyThem) {
   first_reader.join();
   first_writer.join();
   EXPECT_TRUE(first_writer_in);
+}
+
+// A forked child is a copy of one thread: a waiting place's mutex that
+// another thread of the parent held at the fork, for some other lock, would
+// stay held in the child for ever. A child leaving a lock whose copied state
+// shows a waiting writer goes through that place to wake it, and must get
+// through.
+TEST_F(SharedWaitingPlace, AForkedChildGetsThroughAPlaceAParentThreadHeldAtTheFork) {
+  sr_i_establish_fork_handlers();
+  ASSERT_EQ(sr_i_rw_lock_read(p_first_), 0);
+  std::thread writer([&] {
+    ASSERT_EQ(sr_i_rw_lock_write(p_first_), 0);
+    ASSERT_EQ(sr_i_rw_unlock_write(p_first_), 0);
+  });
+  wait_for(*p_first_, [](counters now) { return now.waiting_writers == 1; });
+  pthread_mutex_t *p_shared_mutex = &sr_i_rw_waiting_place(p_second_)->lock;
+  std::binary_semaphore held(0), may_release(0);
+  std::thread holder([&] {
+    pthread_mutex_lock(p_shared_mutex);
+    held.release();
+    may_release.acquire();
+    pthread_mutex_unlock(p_shared_mutex);
+  });
+  held.acquire();
+
+  const pid_t child = fork();
+  ASSERT_NE(child, -1);
+  if (child == 0) {
+    _exit(sr_i_rw_unlock_read(p_first_) == 0 && sr_i_rw_lock_read(p_second_) == 0 ? 0 : 1);
+  }
+  int status = 0;
+  pid_t waited = 0;
+  for (int tenth = 0; tenth < 200 && waited == 0; ++tenth) {
+    waited = waitpid(child, &status, WNOHANG);
+    if (waited == 0) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    }
+  }
+  if (waited == 0) {
+    kill(child, SIGKILL);
+    waitpid(child, &status, 0);
+  }
+  may_release.release();
+  holder.join();
+  ASSERT_EQ(sr_i_rw_unlock_read(p_first_), 0);
+  writer.join();
+  ASSERT_EQ(waited, child) << "the child hung on the mutex held at the fork";
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0);
 }
 
 TEST_F(SharedWaitingPlace, MixedUseOfBothLocksKeepsEachWriterAlone) {

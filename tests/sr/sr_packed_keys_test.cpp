@@ -24,23 +24,14 @@
 namespace {
 
 using sr_test::column;
+using sr_test::compare_strings;
 using sr_test::int32_value;
 using sr_test::packed_table_description;
+using sr_test::string_hash_64;
 using sr_test::string_value;
 using sr_test::write_packed_buffer;
 
 using buffer_bytes = std::vector<unsigned char>;
-
-uint32_t string_hash_64(const void *p_key) {
-  uint32_t hash = 0;
-  for (const char *p_char = static_cast<const char *>(p_key); *p_char != '\0'; ++p_char) {
-    hash = hash * 31 + static_cast<unsigned char>(*p_char);
-  }
-  return hash % 64;
-}
-int32_t compare_strings(const void *p_stored, const void *p_key) {
-  return std::strcmp(static_cast<const char *>(p_stored), static_cast<const char *>(p_key));
-}
 
 // The whole buffer sr_pack_tables_1 makes of one table, all rows of its
 // committed view.

@@ -21,6 +21,7 @@
 namespace {
 
 using sr_test::column;
+using sr_test::compare_strings;
 using sr_test::field_list;
 using sr_test::int32_value;
 using sr_test::packed_table_description;
@@ -67,14 +68,7 @@ void set_word(buffer_bytes &bytes, size_t offset, uint32_t word) {
 uint32_t hash_calls = 0;
 uint32_t counting_string_hash(const void *p_key) {
   ++hash_calls;
-  uint32_t hash = 0;
-  for (const char *p_char = static_cast<const char *>(p_key); *p_char != '\0'; ++p_char) {
-    hash = hash * 31 + static_cast<unsigned char>(*p_char);
-  }
-  return hash % 64;
-}
-int32_t compare_strings(const void *p_stored, const void *p_key) {
-  return std::strcmp(static_cast<const char *>(p_stored), static_cast<const char *>(p_key));
+  return sr_test::string_hash_64(p_key);
 }
 
 class PackedTest : public ::testing::Test {

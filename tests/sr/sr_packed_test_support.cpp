@@ -137,4 +137,16 @@ std::vector<unsigned char> write_packed_buffer(const std::vector<packed_table_de
   return buffer;
 }
 
+uint32_t string_hash_64(const void *p_key) {
+  uint32_t hash = 0;
+  for (const char *p_char = static_cast<const char *>(p_key); *p_char != '\0'; ++p_char) {
+    hash = hash * 31 + static_cast<unsigned char>(*p_char);
+  }
+  return hash % 64;
+}
+
+int32_t compare_strings(const void *p_stored, const void *p_key) {
+  return std::strcmp(static_cast<const char *>(p_stored), static_cast<const char *>(p_key));
+}
+
 }  // namespace sr_test

@@ -25,6 +25,11 @@ struct packed_table_description {
   uint64_t change_counter = 1;
 };
 
+// The key hash and comparison the packed tests unpack string-keyed tables
+// with: a hash over 64 buckets and strcmp.
+uint32_t string_hash_64(const void *p_key);
+int32_t compare_strings(const void *p_stored, const void *p_key);
+
 // The whole buffer, in this machine's byte order or in the other one.
 std::vector<unsigned char> write_packed_buffer(const std::vector<packed_table_description> &tables,
                                                bool other_byte_order);
